@@ -1,0 +1,16 @@
+// The platform services the daemon reaches, one reference each. main() builds one from the Linux
+// implementations and hands it down to the service, sessions and workers; tests build one of
+// fakes. Nothing below main() looks a platform service up anywhere else.
+#pragma once
+
+namespace qv {
+
+class Clock;
+class DeviceInformation;
+
+struct Platform {
+    Clock& clock;
+    DeviceInformation& device;
+};
+
+}  // namespace qv

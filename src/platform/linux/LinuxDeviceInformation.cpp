@@ -1,0 +1,50 @@
+#include "platform/linux/LinuxDeviceInformation.h"
+
+#include <nlohmann/json.hpp>
+
+#include <cerrno>
+#include <cstring>
+#include <fstream>
+
+namespace qv {
+
+LinuxDeviceInformation::LinuxDeviceInformation(const std::string& path,
+                                               std::optional<bool> internalBuildOverride) {
+    std::ifstream in(path);
+    if (in) {
+        const auto doc = nlohmann::json::parse(in, nullptr, /*allow_exceptions=*/false);
+        if (!doc.is_object()) {
+            loadError_ = path + ": not a JSON object";
+        } else {
+            if (auto it = doc.find("InternalBuild"); it != doc.end() && it->is_boolean()) {
+                internalBuild_ = it->get<bool>();
+            }
+            if (auto caps = doc.find("capabilities"); caps != doc.end() && caps->is_object()) {
+                for (const auto& [name, value] : caps->items()) {
+                    if (value.is_boolean()) {
+                        capabilities_[name] = value.get<bool>();
+                    }
+                }
+            }
+        }
+    } else if (errno != ENOENT) {
+        loadError_ = path + ": " + std::strerror(errno);
+    }
+    if (internalBuildOverride) {
+        internalBuild_ = internalBuildOverride;
+    }
+}
+
+std::optional<bool> LinuxDeviceInformation::boolAnswer(std::string_view key) const {
+    if (key == "InternalBuild") {
+        return internalBuild_;
+    }
+    return std::nullopt;
+}
+
+bool LinuxDeviceInformation::hasCapability(std::string_view capability) const {
+    auto it = capabilities_.find(capability);
+    return it != capabilities_.end() && it->second;
+}
+
+}  // namespace qv

@@ -1,0 +1,32 @@
+// Device information on Linux: a JSON file such as /etc/qvreportd/device.json holding
+// {"InternalBuild": bool, "capabilities": {name: bool}}. A missing or unreadable file describes a
+// customer build without capabilities. The file is read once, at construction.
+#pragma once
+
+#include <map>
+#include <optional>
+#include <string>
+
+#include "platform/DeviceInformation.h"
+
+namespace qv {
+
+class LinuxDeviceInformation final : public DeviceInformation {
+  public:
+    // internalBuildOverride, when set, answers "InternalBuild" whatever the file says.
+    explicit LinuxDeviceInformation(const std::string& path,
+                                    std::optional<bool> internalBuildOverride = std::nullopt);
+
+    std::optional<bool> boolAnswer(std::string_view key) const override;
+    bool hasCapability(std::string_view capability) const override;
+
+    // Why the file could not be used, empty when it was read (or simply absent).
+    const std::string& loadError() const { return loadError_; }
+
+  private:
+    std::optional<bool> internalBuild_;
+    std::map<std::string, bool, std::less<>> capabilities_;
+    std::string loadError_;
+};
+
+}  // namespace qv

@@ -1,0 +1,92 @@
+// A thread that hands items to a writer function, fed through a bounded buffer. push() never
+// waits: an item that finds the buffer full is refused, and the caller counts the loss. Used where
+// a slow consumer (the journal, a sink file) must never stall the reporting server queue.
+//
+// Thread safety: push() and flush() may be called from any thread; the writer function runs only
+// on the writer's own thread, one item at a time, in push order.
+#pragma once
+
+#include <condition_variable>
+#include <cstddef>
+#include <deque>
+#include <functional>
+#include <mutex>
+#include <thread>
+
+namespace qv {
+
+template <typename T>
+class BoundedWriter {
+  public:
+    BoundedWriter(std::size_t capacity, std::function<void(T&)> write)
+        : capacity_(capacity), write_(std::move(write)), thread_([this] { run(); }) {}
+
+    BoundedWriter(const BoundedWriter&) = delete;
+    BoundedWriter& operator=(const BoundedWriter&) = delete;
+
+    // Writes what is queued, then ends the thread.
+    ~BoundedWriter() {
+        {
+            std::lock_guard lock(mutex_);
+            stopping_ = true;
+        }
+        wake_.notify_all();
+        thread_.join();
+    }
+
+    // Queues the item; false when the buffer is full (the item is dropped).
+    bool push(T item) {
+        {
+            std::lock_guard lock(mutex_);
+            if (items_.size() >= capacity_) {
+                return false;
+            }
+            items_.push_back(std::move(item));
+        }
+        wake_.notify_one();
+        return true;
+    }
+
+    // Blocks until everything pushed before this call has been written.
+    void flush() {
+        std::unique_lock lock(mutex_);
+        const std::size_t target = pushedCount();
+        drained_.wait(lock, [&] { return written_ >= target; });
+    }
+
+  private:
+    // REQUIRES: mutex_ held.
+    std::size_t pushedCount() const { return written_ + inFlight_ + items_.size(); }
+
+    void run() {
+        std::unique_lock lock(mutex_);
+        for (;;) {
+            wake_.wait(lock, [&] { return stopping_ || !items_.empty(); });
+            if (items_.empty()) {
+                return;  // stopping and drained
+            }
+            T item = std::move(items_.front());
+            items_.pop_front();
+            inFlight_ = 1;
+            lock.unlock();
+            write_(item);
+            lock.lock();
+            inFlight_ = 0;
+            ++written_;
+            drained_.notify_all();
+        }
+    }
+
+    const std::size_t capacity_;
+    const std::function<void(T&)> write_;
+    std::mutex mutex_;
+    std::condition_variable wake_;
+    std::condition_variable drained_;
+    std::deque<T> items_;       // guarded by mutex_
+    std::size_t written_ = 0;   // guarded by mutex_
+    std::size_t inFlight_ = 0;  // guarded by mutex_
+    bool stopping_ = false;     // guarded by mutex_
+    std::thread thread_;        // last: starts once the members above exist
+};
+
+}  // namespace qv

@@ -1,0 +1,110 @@
+#include "session/QVReportingStats.h"
+
+#include <algorithm>
+
+namespace qv {
+
+namespace {
+
+constexpr std::string_view kLimitNames[] = {"payload_bytes", "payload_values",      "payload_depth",
+                                            "reporter_ids",  "sessions_per_client", "clients"};
+
+void raiseMax(std::atomic<std::uint64_t>& max, std::uint64_t value) {
+    std::uint64_t seen = max.load();
+    while (seen < value && !max.compare_exchange_weak(seen, value)) {
+    }
+}
+
+}  // namespace
+
+QVReportingStats& QVReportingStats::shared() {
+    static QVReportingStats stats;
+    return stats;
+}
+
+void QVReportingStats::noteLimitExceeded(Limit limit) {
+    limitsExceeded_[static_cast<std::size_t>(limit)].fetch_add(1, std::memory_order_relaxed);
+}
+
+void QVReportingStats::noteInputRefused() {
+    inputRefused_.fetch_add(1, std::memory_order_relaxed);
+}
+
+void QVReportingStats::noteLogLineDropped() {
+    logLinesDropped_.fetch_add(1, std::memory_order_relaxed);
+}
+
+void QVReportingStats::noteSinkLineLost(std::string_view sink) {
+    std::lock_guard lock(mutex_);
+    auto it = sinkLinesLost_.find(sink);
+    if (it == sinkLinesLost_.end()) {
+        if (sinkLinesLost_.size() >= kMaxTrackedSinks) {
+            sink = "other";
+        }
+        it = sinkLinesLost_.emplace(std::string(sink), 0).first;
+    }
+    ++it->second;
+}
+
+void QVReportingStats::noteClientCount(std::size_t clients) {
+    clients_.store(clients);
+    raiseMax(clientsMax_, clients);
+}
+
+void QVReportingStats::noteSessionCount(std::size_t sessions) {
+    sessions_.store(sessions);
+    raiseMax(sessionsMax_, sessions);
+}
+
+std::uint64_t QVReportingStats::limitExceededCount(Limit limit) const {
+    return limitsExceeded_[static_cast<std::size_t>(limit)].load();
+}
+
+std::uint64_t QVReportingStats::sinkLinesLost(std::string_view sink) const {
+    std::lock_guard lock(mutex_);
+    auto it = sinkLinesLost_.find(sink);
+    return it == sinkLinesLost_.end() ? 0 : it->second;
+}
+
+Dictionary QVReportingStats::dump() const {
+    Dictionary out;
+    std::uint64_t limitsTotal = 0;
+    for (std::size_t i = 0; i < kLimitKinds; ++i) {
+        const auto n = limitsExceeded_[i].load();
+        limitsTotal += n;
+        out.set(std::string("limit_exceeded_") + std::string(kLimitNames[i]), n);
+    }
+    out.set("limits_exceeded", limitsTotal);
+    out.set("input_refused", inputRefused_.load());
+    out.set("log_lines_dropped", logLinesDropped_.load());
+    std::uint64_t sinkTotal = 0;
+    {
+        std::lock_guard lock(mutex_);
+        for (const auto& [name, n] : sinkLinesLost_) {
+            sinkTotal += n;
+            out.set("sink_lines_lost_" + name, n);
+        }
+    }
+    out.set("sink_lines_lost", sinkTotal);
+    out.set("clients", clients_.load());
+    out.set("clients_max", clientsMax_.load());
+    out.set("sessions", sessions_.load());
+    out.set("sessions_max", sessionsMax_.load());
+    return out;
+}
+
+void QVReportingStats::TEST_reset() {
+    for (auto& n : limitsExceeded_) {
+        n.store(0);
+    }
+    inputRefused_.store(0);
+    logLinesDropped_.store(0);
+    clients_.store(0);
+    clientsMax_.store(0);
+    sessions_.store(0);
+    sessionsMax_.store(0);
+    std::lock_guard lock(mutex_);
+    sinkLinesLost_.clear();
+}
+
+}  // namespace qv

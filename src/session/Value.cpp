@@ -1,0 +1,485 @@
+#include "session/Value.h"
+
+#include <fmt/format.h>
+
+#include <algorithm>
+#include <cmath>
+#include <ctime>
+#include <functional>
+#include <limits>
+
+namespace qv {
+
+namespace {
+
+constexpr std::size_t kSmallDictionary = 16;  // searched linearly up to this size
+constexpr std::uint32_t kEmptySlot = std::numeric_limits<std::uint32_t>::max();
+
+bool needsQuotes(std::string_view s) {
+    if (s.empty()) {
+        return true;
+    }
+    return !std::all_of(s.begin(), s.end(), [](char c) {
+        return (c >= 'a' && c <= 'z') || (c >= 'A' && c <= 'Z') || (c >= '0' && c <= '9') ||
+               c == '_' || c == '$' || c == '.' || c == '/' || c == ':';
+    });
+}
+
+void appendQuoted(std::string& out, std::string_view s) {
+    if (!needsQuotes(s)) {
+        out += s;
+        return;
+    }
+    out += '"';
+    for (char c : s) {
+        switch (c) {
+            case '"':
+                out += "\\\"";
+                break;
+            case '\\':
+                out += "\\\\";
+                break;
+            case '\n':
+                out += "\\n";
+                break;
+            default:
+                out += c;
+        }
+    }
+    out += '"';
+}
+
+void describe(const Value& v, std::string& out, int indent);
+
+void describeDictionary(const Dictionary& d, std::string& out, int indent) {
+    out += "{\n";
+    for (const auto& [key, value] : d) {
+        out.append(static_cast<std::size_t>(indent + 4), ' ');
+        appendQuoted(out, key);
+        out += " = ";
+        describe(value, out, indent + 4);
+        out += ";\n";
+    }
+    out.append(static_cast<std::size_t>(indent), ' ');
+    out += '}';
+}
+
+void describe(const Value& v, std::string& out, int indent) {
+    using K = Value::Kind;
+    switch (v.kind()) {
+        case K::Null:
+            out += "<null>";
+            break;
+        case K::Bool:
+            out += v.boolValue() ? '1' : '0';
+            break;
+        case K::Int:
+            out += fmt::to_string(*v.asInt64());
+            break;
+        case K::UInt:
+            out += fmt::to_string(*v.asUInt64());
+            break;
+        case K::Double:
+            // The shortest text that reads back as the same number.
+            out += fmt::format("{}", *v.asDouble());
+            break;
+        case K::String:
+            appendQuoted(out, *v.asString());
+            break;
+        case K::Bytes: {
+            const Bytes& b = *v.asBytes();
+            out += fmt::format("{{length = {}, bytes = 0x", b.size());
+            const std::size_t shown = std::min<std::size_t>(b.size(), 24);
+            for (std::size_t i = 0; i < shown; ++i) {
+                out += fmt::format("{:02x}", b[i]);
+            }
+            out += b.size() > shown ? "...}" : "}";
+            break;
+        }
+        case K::Date: {
+            const double secs = v.asDate()->secondsSince1970;
+            if (!std::isfinite(secs) || std::fabs(secs) > 1e15) {
+                out += fmt::format("{}", secs);
+                break;
+            }
+            const std::time_t t = static_cast<std::time_t>(std::floor(secs));
+            std::tm tm{};
+            gmtime_r(&t, &tm);
+            char buf[64];
+            std::strftime(buf, sizeof buf, "%Y-%m-%d %H:%M:%S +0000", &tm);
+            out += buf;
+            break;
+        }
+        case K::Array: {
+            const Array& a = *v.asArray();
+            out += "(\n";
+            for (std::size_t i = 0; i < a.size(); ++i) {
+                out.append(static_cast<std::size_t>(indent + 4), ' ');
+                describe(a[i], out, indent + 4);
+                out += i + 1 < a.size() ? ",\n" : "\n";
+            }
+            out.append(static_cast<std::size_t>(indent), ' ');
+            out += ')';
+            break;
+        }
+        case K::Dictionary:
+            describeDictionary(*v.asDictionary(), out, indent);
+            break;
+    }
+}
+
+}  // namespace
+
+Value::Value(Array a) : v_(std::make_shared<const Array>(std::move(a))) {}
+Value::Value(Dictionary d) : v_(std::make_shared<const Dictionary>(std::move(d))) {}
+
+bool Value::isNumber() const {
+    switch (kind()) {
+        case Kind::Bool:
+        case Kind::Int:
+        case Kind::UInt:
+        case Kind::Double:
+            return true;
+        default:
+            return false;
+    }
+}
+
+const Bytes* Value::asBytes() const {
+    const auto* p = std::get_if<std::shared_ptr<const Bytes>>(&v_);
+    return p ? p->get() : nullptr;
+}
+
+const Array* Value::asArray() const {
+    const auto* p = std::get_if<std::shared_ptr<const Array>>(&v_);
+    return p ? p->get() : nullptr;
+}
+
+const Dictionary* Value::asDictionary() const {
+    const auto* p = std::get_if<std::shared_ptr<const Dictionary>>(&v_);
+    return p ? p->get() : nullptr;
+}
+
+std::optional<Date> Value::asDate() const {
+    if (const auto* d = std::get_if<Date>(&v_)) {
+        return *d;
+    }
+    return std::nullopt;
+}
+
+std::optional<double> Value::asDouble() const {
+    switch (kind()) {
+        case Kind::Bool:
+            return std::get<bool>(v_) ? 1.0 : 0.0;
+        case Kind::Int:
+            return static_cast<double>(std::get<std::int64_t>(v_));
+        case Kind::UInt:
+            return static_cast<double>(std::get<std::uint64_t>(v_));
+        case Kind::Double:
+            return std::get<double>(v_);
+        default:
+            return std::nullopt;
+    }
+}
+
+std::optional<std::int64_t> Value::asInt64() const {
+    switch (kind()) {
+        case Kind::Bool:
+            return std::get<bool>(v_) ? 1 : 0;
+        case Kind::Int:
+            return std::get<std::int64_t>(v_);
+        case Kind::UInt: {
+            const auto u = std::get<std::uint64_t>(v_);
+            return u > static_cast<std::uint64_t>(std::numeric_limits<std::int64_t>::max())
+                       ? std::numeric_limits<std::int64_t>::max()
+                       : static_cast<std::int64_t>(u);
+        }
+        case Kind::Double: {
+            // Clamped: converting NaN or an out-of-range double to an integer is undefined.
+            const double d = std::get<double>(v_);
+            if (std::isnan(d)) {
+                return 0;
+            }
+            if (d >= 9223372036854775807.0) {
+                return std::numeric_limits<std::int64_t>::max();
+            }
+            if (d <= -9223372036854775808.0) {
+                return std::numeric_limits<std::int64_t>::min();
+            }
+            return static_cast<std::int64_t>(d);
+        }
+        default:
+            return std::nullopt;
+    }
+}
+
+std::optional<std::uint64_t> Value::asUInt64() const {
+    if (const auto* u = std::get_if<std::uint64_t>(&v_)) {
+        return *u;
+    }
+    return std::nullopt;
+}
+
+bool Value::boolValue() const {
+    if (const auto* s = asString()) {
+        std::size_t i = 0;
+        while (i < s->size() && ((*s)[i] == ' ' || (*s)[i] == '\t' || (*s)[i] == '\n')) {
+            ++i;
+        }
+        if (i < s->size() && ((*s)[i] == '+' || (*s)[i] == '-')) {
+            ++i;
+        }
+        while (i < s->size() && (*s)[i] == '0') {
+            ++i;
+        }
+        if (i == s->size()) {
+            return false;
+        }
+        const char c = (*s)[i];
+        return c == 'Y' || c == 'y' || c == 'T' || c == 't' || (c >= '1' && c <= '9');
+    }
+    const auto d = asDouble();
+    return d && *d != 0.0;
+}
+
+std::optional<__int128> Value::asExactInteger() const {
+    switch (kind()) {
+        case Kind::Bool:
+            return std::get<bool>(v_) ? 1 : 0;
+        case Kind::Int:
+            return std::get<std::int64_t>(v_);
+        case Kind::UInt:
+            return std::get<std::uint64_t>(v_);
+        default:
+            return std::nullopt;
+    }
+}
+
+bool Value::numbersEqual(const Value& other) const {
+    const auto a = asExactInteger();
+    const auto b = other.asExactInteger();
+    if (a && b) {
+        return *a == *b;  // exact, where doubles would lose digits beyond 2^53
+    }
+    if (!a && !b) {
+        return std::get<double>(v_) == std::get<double>(other.v_);
+    }
+    const double d = a ? std::get<double>(other.v_) : std::get<double>(v_);
+    const __int128 i = a ? *a : *b;
+    // Only an integral double within the integer range can equal an integer.
+    if (!(d >= -1.9e19 && d <= 1.9e19) || d != std::trunc(d)) {
+        return false;
+    }
+    return static_cast<__int128>(d) == i;
+}
+
+bool Value::operator==(const Value& other) const {
+    if (isNumber() && other.isNumber()) {
+        return numbersEqual(other);
+    }
+    if (kind() != other.kind()) {
+        return false;
+    }
+    switch (kind()) {
+        case Kind::Null:
+            return true;
+        case Kind::String:
+            return *asString() == *other.asString();
+        case Kind::Bytes:
+            return *asBytes() == *other.asBytes();
+        case Kind::Date:
+            return *asDate() == *other.asDate();
+        case Kind::Array:
+            return asArray() == other.asArray() || *asArray() == *other.asArray();
+        case Kind::Dictionary:
+            return asDictionary() == other.asDictionary() ||
+                   *asDictionary() == *other.asDictionary();
+        default:
+            return false;
+    }
+}
+
+std::string Value::description() const {
+    std::string out;
+    describe(*this, out, 0);
+    return out;
+}
+
+Value Value::deepCopy() const {
+    if (const Array* a = asArray()) {
+        Array copy;
+        copy.reserve(a->size());
+        for (const Value& v : *a) {
+            copy.push_back(v.deepCopy());
+        }
+        return Value(std::move(copy));
+    }
+    if (const Dictionary* d = asDictionary()) {
+        Dictionary copy;
+        copy.reserve(d->size());
+        for (const auto& [k, v] : *d) {
+            copy.set(k, v.deepCopy());
+        }
+        return Value(std::move(copy));
+    }
+    if (const Bytes* b = asBytes()) {
+        return Value(Bytes(*b));
+    }
+    return *this;
+}
+
+std::size_t Value::valueCount() const {
+    std::size_t n = 1;
+    if (const Array* a = asArray()) {
+        for (const Value& v : *a) {
+            n += v.valueCount();
+        }
+    } else if (const Dictionary* d = asDictionary()) {
+        for (const auto& entry : *d) {
+            n += entry.second.valueCount();
+        }
+    }
+    return n;
+}
+
+std::size_t Value::depth() const {
+    std::size_t deepest = 0;
+    if (const Array* a = asArray()) {
+        for (const Value& v : *a) {
+            deepest = std::max(deepest, v.depth());
+        }
+        return deepest + 1;
+    }
+    if (const Dictionary* d = asDictionary()) {
+        for (const auto& entry : *d) {
+            deepest = std::max(deepest, entry.second.depth());
+        }
+        return deepest + 1;
+    }
+    return 0;
+}
+
+// ---- Dictionary ----
+
+Dictionary::Dictionary(std::initializer_list<Entry> entries) {
+    entries_.reserve(entries.size());
+    for (const auto& [k, v] : entries) {
+        set(k, v);
+    }
+}
+
+std::ptrdiff_t Dictionary::indexOf(std::string_view key) const {
+    if (slots_.empty()) {
+        for (std::size_t i = 0; i < entries_.size(); ++i) {
+            if (entries_[i].first == key) {
+                return static_cast<std::ptrdiff_t>(i);
+            }
+        }
+        return -1;
+    }
+    const std::size_t mask = slots_.size() - 1;
+    for (std::size_t s = std::hash<std::string_view>{}(key)&mask;; s = (s + 1) & mask) {
+        const std::uint32_t i = slots_[s];
+        if (i == kEmptySlot) {
+            return -1;
+        }
+        if (entries_[i].first == key) {
+            return static_cast<std::ptrdiff_t>(i);
+        }
+    }
+}
+
+void Dictionary::insertSlot(std::uint32_t entryIndex) {
+    const std::size_t mask = slots_.size() - 1;
+    std::size_t s = std::hash<std::string_view>{}(entries_[entryIndex].first) & mask;
+    while (slots_[s] != kEmptySlot) {
+        s = (s + 1) & mask;
+    }
+    slots_[s] = entryIndex;
+}
+
+void Dictionary::rebuildSlots() {
+    slots_.clear();
+    if (entries_.size() <= kSmallDictionary) {
+        slots_.shrink_to_fit();
+        return;
+    }
+    std::size_t capacity = 32;
+    while (capacity < entries_.size() * 2) {
+        capacity *= 2;
+    }
+    slots_.assign(capacity, kEmptySlot);
+    for (std::uint32_t i = 0; i < entries_.size(); ++i) {
+        insertSlot(i);
+    }
+}
+
+const Value* Dictionary::find(std::string_view key) const {
+    const auto i = indexOf(key);
+    return i < 0 ? nullptr : &entries_[static_cast<std::size_t>(i)].second;
+}
+
+Value* Dictionary::find(std::string_view key) {
+    const auto i = indexOf(key);
+    return i < 0 ? nullptr : &entries_[static_cast<std::size_t>(i)].second;
+}
+
+void Dictionary::set(std::string_view key, Value value) {
+    if (Value* existing = find(key)) {
+        *existing = std::move(value);
+        return;
+    }
+    entries_.emplace_back(std::string(key), std::move(value));
+    if (entries_.size() > kSmallDictionary) {
+        // Keep the table at most half full so probes stay short.
+        if (slots_.size() < entries_.size() * 2) {
+            rebuildSlots();
+        } else {
+            insertSlot(static_cast<std::uint32_t>(entries_.size() - 1));
+        }
+    }
+}
+
+bool Dictionary::erase(std::string_view key) {
+    const auto i = indexOf(key);
+    if (i < 0) {
+        return false;
+    }
+    entries_.erase(entries_.begin() + i);
+    if (!slots_.empty()) {
+        rebuildSlots();
+    }
+    return true;
+}
+
+void Dictionary::merge(const Dictionary& other) {
+    for (const auto& [k, v] : other) {
+        set(k, v);
+    }
+}
+
+void Dictionary::clear() {
+    entries_.clear();
+    slots_.clear();
+}
+
+bool Dictionary::operator==(const Dictionary& other) const {
+    if (size() != other.size()) {
+        return false;
+    }
+    for (const auto& [k, v] : entries_) {
+        const Value* o = other.find(k);
+        if (!o || *o != v) {
+            return false;
+        }
+    }
+    return true;
+}
+
+std::string Dictionary::description() const {
+    std::string out;
+    describeDictionary(*this, out, 0);
+    return out;
+}
+
+}  // namespace qv

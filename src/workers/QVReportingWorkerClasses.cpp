@@ -1,0 +1,16 @@
+#include "workers/QVReportingWorkerClasses.h"
+
+#include "workers/derived/QVReportingSessionOrbitMessagesWorker.h"
+
+namespace qv {
+
+QVReportingWorkerRegistry::ClassList QVReportingAllWorkerClasses() {
+    // Fixed order: trace, volume, orbit, summary, input, MetricsHub, EnergyLog, memory log, MTX,
+    // driver snapshot, system monitor, ICX, Pulsar, summary JSON file, audio registration, Convo,
+    // IssueFiler. Only the classes that exist are listed.
+    return {
+        &makeWorkerClass<QVReportingSessionOrbitMessagesWorker>(),
+    };
+}
+
+}  // namespace qv
