@@ -2,6 +2,8 @@
 
 #include <gtest/gtest.h>
 
+#include <cmath>
+
 #include <random>
 
 #include "fakes/FakePlatform.h"
