@@ -5,12 +5,20 @@
 
 namespace qv {
 
+class AnalyticsService;
 class Clock;
 class DeviceInformation;
+class NotificationCenter;
+class PreferenceStore;
+class ProcessInfo;
 
 struct Platform {
     Clock& clock;
     DeviceInformation& device;
+    ProcessInfo& process;
+    PreferenceStore& preferences;
+    NotificationCenter& notifications;
+    AnalyticsService& analytics;
 };
 
 }  // namespace qv

@@ -21,7 +21,7 @@
 #include "session/QVReportingSessionMessage.h"
 #include "session/QVReportingSessionWorker.h"
 #include "session/QVReportingVocabulary.h"
-#include "session/Value.h"
+#include "values/Value.h"
 
 namespace qv {
 

@@ -11,7 +11,7 @@
 #include <vector>
 
 #include "session/QVReportingVocabulary.h"
-#include "session/Value.h"
+#include "values/Value.h"
 
 namespace qv {
 

@@ -14,7 +14,7 @@
 #include <string>
 #include <string_view>
 
-#include "session/Value.h"
+#include "values/Value.h"
 
 namespace qv {
 

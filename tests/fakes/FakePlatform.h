@@ -3,6 +3,7 @@
 
 #include "fakes/FakeClock.h"
 #include "fakes/FakeDeviceInformation.h"
+#include "fakes/FakeServices.h"
 #include "platform/Platform.h"
 
 namespace qv::test {
@@ -10,7 +11,11 @@ namespace qv::test {
 struct FakePlatform {
     FakeClock clock;
     FakeDeviceInformation device;
-    Platform platform{clock, device};
+    FakeProcessInfo process;
+    FakePreferenceStore preferences;
+    FakeNotificationCenter notifications;
+    FakeAnalyticsService analytics;
+    Platform platform{clock, device, process, preferences, notifications, analytics};
 };
 
 }  // namespace qv::test

@@ -1,4 +1,4 @@
-#include "session/Value.h"
+#include "values/Value.h"
 
 #include <fmt/format.h>
 
