@@ -10,7 +10,7 @@
 #include <cstring>
 #include <mutex>
 
-#include "session/BoundedWriter.h"
+#include "platform/BoundedWriter.h"
 #include "session/QVReportingStats.h"
 
 namespace qv {

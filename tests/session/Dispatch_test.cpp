@@ -9,7 +9,7 @@
 #include <vector>
 
 #include "fakes/MemoryLogSink.h"
-#include "session/BoundedWriter.h"
+#include "platform/BoundedWriter.h"
 #include "session/QVReportingWait.h"
 #include "session/RepeatingTimer.h"
 #include "session/SerialQueue.h"

@@ -1,0 +1,349 @@
+#include "service/QVReportingDBusCodec.h"
+
+#include <fmt/format.h>
+#include <sdbus-c++/Error.h>
+#include <sdbus-c++/Types.h>
+
+namespace qv {
+
+namespace {
+
+// Reads values one complete type at a time, keeping count of what the input costs.
+class Reader {
+  public:
+    Reader(sdbus::Message& message, const QVReportingInputBudget& budget)
+        : m_(message), budget_(budget) {}
+
+    bool readDictionary(const std::string& entrySignature, std::size_t depth, Value& out,
+                        bool topLevel);
+    bool read(std::size_t depth, Value& out);
+
+    std::optional<QVReportingError> error;
+    std::optional<QVReportingStats::Limit> limit;
+    Dictionary topLevel;
+    std::string key;  // the top-level key being read, for error messages
+
+  private:
+    bool atEnd(std::string& type, std::string& contents) {
+        m_.peekType(type, contents);
+        return type.empty() || type[0] == '\0';
+    }
+    bool charge(std::size_t bytes) {
+        bytes_ += bytes;
+        if (bytes_ > budget_.maxBytes) {
+            return refuse(QVReportingStats::Limit::PayloadBytes,
+                          fmt::format("a payload may hold at most {} bytes", budget_.maxBytes));
+        }
+        return true;
+    }
+    bool refuse(QVReportingStats::Limit which, std::string why) {
+        limit = which;
+        error = QVReportingError::limitsExceeded(std::move(why));
+        return false;
+    }
+    template <typename T>
+    bool readScalar(Value& out) {
+        T v{};
+        m_ >> v;
+        out = v;
+        return charge(sizeof(T));
+    }
+    template <typename T>
+    bool readString(Value& out) {
+        T v;
+        m_ >> v;
+        const std::size_t size = v.size();
+        out = std::string(std::move(v));
+        return charge(size + 5);
+    }
+    bool readArray(const std::string& contents, std::size_t depth, Value& out);
+    bool readStruct(const std::string& contents, std::size_t depth, Value& out);
+
+    sdbus::Message& m_;
+    const QVReportingInputBudget& budget_;
+    std::size_t bytes_ = 0;
+    std::size_t values_ = 0;
+};
+
+bool Reader::read(std::size_t depth, Value& out) {
+    std::string type, contents;
+    if (atEnd(type, contents)) {
+        return false;
+    }
+    if (++values_ > budget_.maxValues) {
+        return refuse(QVReportingStats::Limit::PayloadValues,
+                      fmt::format("a payload may hold at most {} values", budget_.maxValues));
+    }
+    switch (type[0]) {
+        case 'b': {
+            bool b = false;
+            m_ >> b;
+            out = b;
+            return charge(4);
+        }
+        case 'y': {
+            std::uint8_t v = 0;
+            m_ >> v;
+            out = std::int64_t{v};
+            return charge(1);
+        }
+        case 'n':
+            return readScalar<std::int16_t>(out);
+        case 'q': {
+            std::uint16_t v = 0;
+            m_ >> v;
+            out = std::int64_t{v};
+            return charge(2);
+        }
+        case 'i':
+            return readScalar<std::int32_t>(out);
+        case 'u': {
+            std::uint32_t v = 0;
+            m_ >> v;
+            out = std::int64_t{v};
+            return charge(4);
+        }
+        case 'x':
+            return readScalar<std::int64_t>(out);
+        case 't':
+            return readScalar<std::uint64_t>(out);
+        case 'd':
+            return readScalar<double>(out);
+        case 's':
+            return readString<std::string>(out);
+        case 'o':
+            return readString<sdbus::ObjectPath>(out);
+        case 'g':
+            return readString<sdbus::Signature>(out);
+        case 'v': {
+            m_.enterVariant(contents);
+            if (!charge(contents.size() + 2) || !read(depth, out)) {
+                return false;
+            }
+            m_.exitVariant();
+            return true;
+        }
+        case 'a':
+            return readArray(contents, depth + 1, out);
+        case 'r':
+            return readStruct(contents, depth + 1, out);
+        case 'h':
+            error = QVReportingError::invalidArgs(fmt::format(
+                "the value under \"{}\" is a unix fd, which a payload cannot hold", key));
+            return false;
+        default:
+            error = QVReportingError::invalidArgs(
+                fmt::format("the value under \"{}\" has a type a payload cannot hold", key));
+            return false;
+    }
+}
+
+bool Reader::readArray(const std::string& contents, std::size_t depth, Value& out) {
+    if (depth > budget_.maxDepth) {
+        return refuse(QVReportingStats::Limit::PayloadDepth,
+                      fmt::format("a payload may nest at most {} deep", budget_.maxDepth));
+    }
+    if (!charge(4)) {
+        return false;
+    }
+    if (!contents.empty() && contents[0] == '{') {
+        return readDictionary(contents.substr(1, contents.size() - 2), depth, out, false);
+    }
+    std::string type, inner;
+    m_.enterContainer(contents);
+    if (contents == "y") {
+        Bytes bytes;
+        while (!atEnd(type, inner)) {
+            std::uint8_t b = 0;
+            m_ >> b;
+            bytes.push_back(b);
+            if (!charge(1)) {
+                return false;
+            }
+        }
+        m_.exitContainer();
+        out = std::move(bytes);
+        return true;
+    }
+    Array items;
+    while (!atEnd(type, inner)) {
+        Value v;
+        if (!read(depth, v)) {
+            return false;
+        }
+        items.push_back(std::move(v));
+    }
+    m_.exitContainer();
+    out = std::move(items);
+    return true;
+}
+
+bool Reader::readStruct(const std::string& contents, std::size_t depth, Value& out) {
+    if (depth > budget_.maxDepth) {
+        return refuse(QVReportingStats::Limit::PayloadDepth,
+                      fmt::format("a payload may nest at most {} deep", budget_.maxDepth));
+    }
+    m_.enterStruct(contents);
+    Array items;
+    std::string type, inner;
+    while (!atEnd(type, inner)) {
+        Value v;
+        if (!read(depth, v)) {
+            return false;
+        }
+        items.push_back(std::move(v));
+    }
+    m_.exitStruct();
+    out = std::move(items);
+    return true;
+}
+
+bool Reader::readDictionary(const std::string& entrySignature, std::size_t depth, Value& out,
+                            bool isTopLevel) {
+    m_.enterContainer("{" + entrySignature + "}");
+    const bool stringKeys = !entrySignature.empty() && entrySignature[0] == 's';
+    Dictionary dict;
+    Array pairs;
+    std::string type, inner;
+    while (!atEnd(type, inner)) {
+        m_.enterDictEntry(entrySignature);
+        Value k, v;
+        if (stringKeys) {
+            std::string name;
+            m_ >> name;
+            if (!charge(name.size() + 5)) {
+                return false;
+            }
+            if (isTopLevel) {
+                key = name;
+            }
+            k = std::move(name);
+        } else if (!read(depth, k)) {
+            return false;
+        }
+        if (!read(depth, v)) {
+            return false;
+        }
+        m_.exitDictEntry();
+        if (stringKeys) {
+            dict.set(*k.asString(), std::move(v));
+        } else {
+            pairs.push_back(Array{std::move(k), std::move(v)});
+        }
+    }
+    m_.exitContainer();
+    if (isTopLevel) {
+        topLevel = std::move(dict);
+    } else if (stringKeys) {
+        out = std::move(dict);
+    } else {
+        out = std::move(pairs);
+    }
+    return true;
+}
+
+std::string signatureOf(const Value& value) {
+    switch (value.kind()) {
+        case Value::Kind::Bool:
+            return "b";
+        case Value::Kind::Int:
+            return "x";
+        case Value::Kind::UInt:
+            return "t";
+        case Value::Kind::Double:
+        case Value::Kind::Date:
+            return "d";
+        case Value::Kind::String:
+            return "s";
+        case Value::Kind::Bytes:
+            return "ay";
+        case Value::Kind::Dictionary:
+            return "a{sv}";
+        case Value::Kind::Null:  // D-Bus has no null: an empty array stands for it
+        case Value::Kind::Array:
+            return "av";
+    }
+    return "av";
+}
+
+}  // namespace
+
+QVReportingDecodeResult QVReportingReadDictionary(sdbus::Message& message,
+                                                  const QVReportingInputBudget& budget) {
+    QVReportingDecodeResult result;
+    Reader reader(message, budget);
+    Value unused;
+    try {
+        if (!reader.readDictionary("sv", 1, unused, true) && !reader.error) {
+            reader.error = QVReportingError::invalidArgs("the payload ended early");
+        }
+    } catch (const sdbus::Error& e) {
+        reader.error = QVReportingError::invalidArgs(e.getMessage());
+    }
+    result.error = std::move(reader.error);
+    result.limit = reader.limit;
+    if (!result.error) {
+        result.dictionary = std::move(reader.topLevel);
+    }
+    return result;
+}
+
+void QVReportingAppendVariant(sdbus::Message& message, const Value& value) {
+    const std::string signature = signatureOf(value);
+    message.openVariant(signature);
+    switch (value.kind()) {
+        case Value::Kind::Bool:
+            message << value.boolValue();
+            break;
+        case Value::Kind::Int:
+            message << *value.asInt64();
+            break;
+        case Value::Kind::UInt:
+            message << *value.asUInt64();
+            break;
+        case Value::Kind::Double:
+            message << *value.asDouble();
+            break;
+        case Value::Kind::Date:
+            message << value.asDate()->secondsSince1970;
+            break;
+        case Value::Kind::String:
+            message << *value.asString();
+            break;
+        case Value::Kind::Bytes:
+            message.openContainer("y");
+            for (std::uint8_t b : *value.asBytes()) {
+                message << b;
+            }
+            message.closeContainer();
+            break;
+        case Value::Kind::Dictionary:
+            QVReportingAppendDictionary(message, *value.asDictionary());
+            break;
+        case Value::Kind::Array:
+            message.openContainer("v");
+            for (const Value& v : *value.asArray()) {
+                QVReportingAppendVariant(message, v);
+            }
+            message.closeContainer();
+            break;
+        case Value::Kind::Null:
+            message.openContainer("v");
+            message.closeContainer();
+            break;
+    }
+    message.closeVariant();
+}
+
+void QVReportingAppendDictionary(sdbus::Message& message, const Dictionary& dictionary) {
+    message.openContainer("{sv}");
+    for (const auto& [key, value] : dictionary) {
+        message.openDictEntry("sv");
+        message << key;
+        QVReportingAppendVariant(message, value);
+        message.closeDictEntry();
+    }
+    message.closeContainer();
+}
+
+}  // namespace qv

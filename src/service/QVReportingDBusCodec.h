@@ -1,0 +1,45 @@
+// Payload values to and from D-Bus messages.
+//
+// Reading: b is a bool; y n q i u x signed integers; t an unsigned integer; d a double; s o g
+// strings; ay bytes; other arrays and structs arrays; a{s?} dictionaries (a dictionary with keys
+// of another type becomes an array of [key, value] pairs); variants unwrap. A unix fd, or input
+// beyond the limits, is refused with a reason naming the key. Writing: dates go out as doubles.
+//
+// Thread safety: the functions keep no state; a message must only be touched by one thread.
+#pragma once
+
+#include <optional>
+#include <string>
+
+#include <sdbus-c++/Message.h>
+
+#include "service/QVReportingError.h"
+#include "session/QVReportingStats.h"
+#include "values/Value.h"
+
+namespace qv {
+
+// Bounds on one payload or configuration read from a client.
+struct QVReportingInputBudget {
+    std::size_t maxBytes;
+    std::size_t maxValues;
+    std::size_t maxDepth;
+};
+
+struct QVReportingDecodeResult {
+    Dictionary dictionary;
+    // Set when the input was refused; the limit (when it was one) is in limit.
+    std::optional<QVReportingError> error;
+    std::optional<QVReportingStats::Limit> limit;
+};
+
+// Reads an a{sv} at the message's current position.
+QVReportingDecodeResult QVReportingReadDictionary(sdbus::Message& message,
+                                                  const QVReportingInputBudget& budget);
+
+// Appends a value as a variant.
+void QVReportingAppendVariant(sdbus::Message& message, const Value& value);
+// Appends an a{sv}.
+void QVReportingAppendDictionary(sdbus::Message& message, const Dictionary& dictionary);
+
+}  // namespace qv
