@@ -108,7 +108,9 @@ void BM_StopWith100kMessages(benchmark::State& state) {
 }
 BENCHMARK(BM_StopWith100kMessages)->Arg(100000)->Iterations(5)->Unit(benchmark::kMillisecond);
 
-std::size_t heapInUse() { return mallinfo2().uordblks; }
+std::size_t heapInUse() {
+    return mallinfo2().uordblks;
+}
 
 // Bytes per stored message, against the same payloads kept as nlohmann::json objects.
 void BM_MemoryPerStoredMessage(benchmark::State& state) {
@@ -121,7 +123,8 @@ void BM_MemoryPerStoredMessage(benchmark::State& state) {
         std::vector<nlohmann::json> asJson;
         asJson.reserve(static_cast<std::size_t>(n) + 2);
         for (const auto& m : session->messages()) {
-            asJson.push_back(nlohmann::json::parse(QVReportingDictionaryToJson(m->message()).dump()));
+            asJson.push_back(
+                nlohmann::json::parse(QVReportingDictionaryToJson(m->message()).dump()));
         }
         const std::size_t withJson = heapInUse();
         const double count = static_cast<double>(session->messages().size());

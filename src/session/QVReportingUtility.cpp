@@ -178,8 +178,8 @@ Dictionary QVReportingUtilityAddDates(const Dictionary& dictionary, const Clock&
     Dictionary out = dictionary;
     out.set(kTimestampKey, clock.now());
     out.set(kSystemUptimeKey, roundToInt32(clock.systemUptime()));
-    // Single precision on purpose: the stamp has always been computed this way, and consumers
-    // compare it with earlier stamps.
+    // Single precision is part of the stamp's definition, so stamps stay comparable with those
+    // of other producers; past 2^24 ms (4.6 hours of processor time) it skips whole milliseconds.
     const float milliseconds = static_cast<float>(clock.processCPUTime()) / 1000000.0f * 1000.0f;
     out.set(kProcessUptimeKey, roundToInt32(static_cast<double>(std::round(milliseconds))));
     return out;

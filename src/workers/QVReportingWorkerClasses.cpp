@@ -1,5 +1,7 @@
 #include "workers/QVReportingWorkerClasses.h"
 
+#include "monitoring/QVReportingSessionSystemMonitorWorker.h"
+#include "workers/backends/QVReportingSessionMetricsHubWorker.h"
 #include "workers/derived/QVReportingSessionOrbitMessagesWorker.h"
 
 namespace qv {
@@ -10,6 +12,8 @@ QVReportingWorkerRegistry::ClassList QVReportingAllWorkerClasses() {
     // IssueFiler. Only the classes that exist are listed.
     return {
         &makeWorkerClass<QVReportingSessionOrbitMessagesWorker>(),
+        &makeWorkerClass<QVReportingSessionMetricsHubWorker>(),
+        &makeWorkerClass<QVReportingSessionSystemMonitorWorker>(),
     };
 }
 

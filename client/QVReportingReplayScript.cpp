@@ -1,0 +1,239 @@
+#include "QVReportingReplayScript.h"
+
+#include <algorithm>
+#include <array>
+#include <cmath>
+#include <limits>
+#include <optional>
+
+#include "QVReportingCtlSupport.h"
+#include "QVReportingJsonVariant.h"
+
+namespace qv::client {
+
+namespace {
+
+using Kind = QVReportingReplayOperation::Kind;
+using Json = nlohmann::ordered_json;
+
+// Longer pauses are almost surely a slip (200 for 0.2) and would look like a hang.
+constexpr double kMaxSleepSeconds = 3600;
+
+// Keys besides "op"; unused places are empty.
+using Keys = std::array<std::string_view, 2>;
+
+struct OperationSpec {
+    Kind kind;
+    std::string_view name;
+    Keys required;
+    Keys optional;
+};
+
+constexpr OperationSpec kSpecs[] = {
+    {Kind::Create, "create", {"id"}, {}},
+    {Kind::SetType, "set-type", {"id", "type"}, {}},
+    {Kind::GetType, "get-type", {"id"}, {}},
+    {Kind::Configure, "configure", {"id", "config"}, {}},
+    {Kind::Start, "start", {"id"}, {}},
+    {Kind::Send, "send", {"category", "type"}, {"ids", "payload"}},
+    {Kind::Stop, "stop", {"id"}, {}},
+    {Kind::Destroy, "destroy", {"id"}, {}},
+    {Kind::Valid, "valid", {"id"}, {}},
+    {Kind::List, "list", {}, {}},
+    {Kind::Sleep, "sleep", {"seconds"}, {}},
+};
+
+struct Bad {
+    std::string message;
+};
+
+std::string jsonQuoted(std::string_view s) {
+    return Json(std::string(s)).dump(-1, ' ', false, Json::error_handler_t::replace);
+}
+
+std::int64_t reporterIDFrom(const Json& json, std::string_view what) {
+    if (json.is_number_integer() && !json.is_number_unsigned()) {
+        return json.get<std::int64_t>();
+    }
+    if (json.is_number_unsigned()) {
+        const auto u = json.get<std::uint64_t>();
+        if (u <= static_cast<std::uint64_t>(std::numeric_limits<std::int64_t>::max())) {
+            return static_cast<std::int64_t>(u);
+        }
+    }
+    throw Bad{std::string(what) + " must be an integer reporter ID (signed 64-bit), not " +
+              json.dump()};
+}
+
+const OperationSpec& specFor(const Json& op) {
+    if (!op.is_string()) {
+        throw Bad{"\"op\" must be a string"};
+    }
+    const auto name = op.get<std::string>();
+    for (const auto& spec : kSpecs) {
+        if (spec.name == name) {
+            return spec;
+        }
+    }
+    std::string known;
+    for (const auto& spec : kSpecs) {
+        known += known.empty() ? "" : ", ";
+        known += spec.name;
+    }
+    throw Bad{"unknown operation " + jsonQuoted(name) + " (known: " + known + ")"};
+}
+
+void checkKeys(const Json& object, const OperationSpec& spec) {
+    for (const auto& [key, value] : object.items()) {
+        if (key == "op") {
+            continue;
+        }
+        const auto listed = [&](const Keys& keys) {
+            return !key.empty() && std::find(keys.begin(), keys.end(), key) != keys.end();
+        };
+        if (!listed(spec.required) && !listed(spec.optional)) {
+            throw Bad{"\"" + std::string(spec.name) + "\" takes no key " + jsonQuoted(key)};
+        }
+    }
+    for (std::string_view key : spec.required) {
+        if (!key.empty() && !object.contains(key)) {
+            throw Bad{"\"" + std::string(spec.name) + "\" needs \"" + std::string(key) + "\""};
+        }
+    }
+}
+
+// Checks now that the dictionary has a D-Bus form, so a bad value fails before anything runs.
+void checkDictionary(const Json& json, std::string_view what) {
+    QVReportingJsonConversionOptions options;
+    options.now = 0;
+    try {
+        (void)QVReportingJsonToVariantMap(json, options, std::string(what));
+    } catch (const QVReportingJsonConversionError& e) {
+        throw Bad{e.what()};
+    }
+}
+
+QVReportingReplayOperation parse(std::string_view text, std::size_t line) {
+    const Json object = Json::parse(text.begin(), text.end(), nullptr, false);
+    if (object.is_discarded()) {
+        throw Bad{"not valid JSON"};
+    }
+    if (!object.is_object()) {
+        throw Bad{"expected a JSON object, found " + std::string(object.type_name())};
+    }
+    const auto opField = object.find("op");
+    if (opField == object.end()) {
+        throw Bad{"missing \"op\""};
+    }
+    const OperationSpec& spec = specFor(*opField);
+    checkKeys(object, spec);
+
+    QVReportingReplayOperation op;
+    op.line = line;
+    op.kind = spec.kind;
+    if (object.contains("id")) {
+        op.reporterID = reporterIDFrom(object.at("id"), "\"id\"");
+    }
+    switch (spec.kind) {
+        case Kind::SetType: {
+            const auto serviceType = QVReportingCtlParseServiceTypeFromJson(object.at("type"));
+            if (!serviceType) {
+                throw Bad{
+                    "\"type\" must be a service type: a number up to 65535 or a name such "
+                    "as \"longformaudio\", not " +
+                    object.at("type").dump()};
+            }
+            op.serviceType = *serviceType;
+            break;
+        }
+        case Kind::Configure:
+            op.dictionary = object.at("config");
+            checkDictionary(op.dictionary, "config");
+            break;
+        case Kind::Send: {
+            const auto category = QVReportingCtlParseCategoryFromJson(object.at("category"));
+            if (!category) {
+                throw Bad{
+                    "\"category\" must be a number up to 4294967295 or a name such as "
+                    "\"Playback\" or \"DSP_Setup\", not " +
+                    object.at("category").dump()};
+            }
+            const auto type = QVReportingCtlParseTypeFromJson(object.at("type"));
+            if (!type) {
+                throw Bad{
+                    "\"type\" must be a number up to 65535 or a name such as \"Start\", "
+                    "not " +
+                    object.at("type").dump()};
+            }
+            op.category = *category;
+            op.type = *type;
+            if (object.contains("ids")) {
+                const Json& ids = object.at("ids");
+                if (!ids.is_array()) {
+                    throw Bad{"\"ids\" must be an array of reporter IDs"};
+                }
+                for (std::size_t i = 0; i < ids.size(); ++i) {
+                    op.reporterIDs.push_back(
+                        reporterIDFrom(ids[i], "\"ids\"[" + std::to_string(i) + "]"));
+                }
+            }
+            op.dictionary = object.contains("payload") ? object.at("payload") : Json::object();
+            checkDictionary(op.dictionary, "payload");
+            break;
+        }
+        case Kind::Sleep: {
+            const Json& seconds = object.at("seconds");
+            if (!seconds.is_number()) {
+                throw Bad{"\"seconds\" must be a number"};
+            }
+            op.seconds = seconds.get<double>();
+            if (!(op.seconds >= 0 && op.seconds <= kMaxSleepSeconds)) {
+                throw Bad{"\"seconds\" must lie between 0 and 3600"};
+            }
+            break;
+        }
+        default:
+            break;
+    }
+    return op;
+}
+
+}  // namespace
+
+std::string_view QVReportingReplayOperationName(Kind kind) {
+    for (const auto& spec : kSpecs) {
+        if (spec.kind == kind) {
+            return spec.name;
+        }
+    }
+    return "?";
+}
+
+std::variant<QVReportingReplayOperation, QVReportingReplayError> QVReportingParseReplayLine(
+    std::string_view text, std::size_t line) {
+    try {
+        return parse(text, line);
+    } catch (const Bad& bad) {
+        return QVReportingReplayError{line, bad.message};
+    }
+}
+
+std::variant<std::vector<QVReportingReplayOperation>, QVReportingReplayError>
+QVReportingParseReplayScript(std::istream& in) {
+    std::vector<QVReportingReplayOperation> operations;
+    std::string text;
+    for (std::size_t line = 1; std::getline(in, text); ++line) {
+        if (std::all_of(text.begin(), text.end(),
+                        [](unsigned char c) { return c == ' ' || c == '\t' || c == '\r'; })) {
+            continue;
+        }
+        auto parsed = QVReportingParseReplayLine(text, line);
+        if (auto* error = std::get_if<QVReportingReplayError>(&parsed)) {
+            return *error;
+        }
+        operations.push_back(std::move(std::get<QVReportingReplayOperation>(parsed)));
+    }
+    return operations;
+}
+
+}  // namespace qv::client

@@ -1,0 +1,105 @@
+// A sink file: <stateDir>/sinks/<name>.jsonl, one JSON object a line, each starting with "time"
+// (seconds since 1970, a double, read from the clock when the line is appended) followed by the
+// caller's members in their order. This is where the Linux stand-ins of the platform's telemetry
+// services put what they receive.
+//
+// append() never waits: lines go through a bounded buffer to the sink's own thread, which turns
+// them into JSON and writes each with one write(2) on an O_APPEND descriptor as soon as it is
+// woken, so a line reaches its file promptly and whole even when other processes append too. A
+// line that finds the buffer full is dropped; a line that cannot be written (the directory cannot
+// be made, the file cannot be opened, the write fails or falls short) is lost; either way the
+// loss is counted through the callbacks and the sink goes on, opening the file afresh for the
+// next line after a failure. The file and its directory are made when missing.
+//
+// Values in JSON: integers exactly (unsigned 64-bit included), doubles with every digit needed
+// to read them back, bytes as base64 text, dates as doubles, dictionaries in insertion order;
+// text that is not valid UTF-8 has its bad bytes replaced rather than losing the line.
+//
+// Thread safety: append() and flush() may be called from any thread at once. The callbacks run
+// on the caller's thread (buffer full) or on the sink's thread (write failures), never under a
+// lock of the sink's.
+#pragma once
+
+#include <atomic>
+#include <cstddef>
+#include <cstdint>
+#include <functional>
+#include <memory>
+#include <string>
+#include <string_view>
+
+#include "platform/BoundedWriter.h"
+#include "values/Value.h"
+
+namespace qv {
+
+class Clock;
+
+// How a sink tells its owner about trouble. Platform code neither counts nor logs by itself:
+// main() wires these to the guardrail counters and to the log.
+struct SinkCallbacks {
+    // One line lost (buffer full, or not written); called once per line.
+    std::function<void(std::string_view sinkName)> lineLost;
+    // A problem worth an error line: the text names the sink and the cause. Repeats of the same
+    // cause are not reported again until a line is written or the cause changes, so a broken
+    // disk costs one log line, not one per event; lineLost still hears of every line.
+    std::function<void(const std::string& message)> problem;
+};
+
+class JsonlSink {
+  public:
+    // Lines held for the sink's thread before further lines are dropped.
+    static constexpr std::size_t kDefaultCapacity = 4096;
+
+    // name must be a plain file name (the daemon names its sinks); it is made safe all the same.
+    // Nothing is opened yet: the first line makes the directory and opens the file.
+    JsonlSink(std::string stateDir, std::string name, const Clock& clock, SinkCallbacks callbacks,
+              std::size_t capacity = kDefaultCapacity);
+    // Writes every line still queued, then closes the file.
+    ~JsonlSink();
+
+    JsonlSink(const JsonlSink&) = delete;
+    JsonlSink& operator=(const JsonlSink&) = delete;
+
+    // Queues one line: "time" now, then members in order (a member called "time" would take the
+    // stamp's place, so callers use names of their own). Returns false when the line was dropped
+    // because the buffer is full.
+    bool append(Dictionary members);
+
+    // Blocks until every line appended before this call has been written or given up.
+    void flush();
+
+    const std::string& name() const { return name_; }
+    const std::string& path() const { return path_; }
+
+  private:
+    struct Line {
+        double time = 0;
+        Dictionary members;
+    };
+
+    // The sink's thread only, from here down.
+    void writeLine(Line& line);
+    // Makes the directory and opens the file when no descriptor is open; false with a reason.
+    bool openFile(std::string& reason);
+    void closeFile();
+    void lose(const std::string& reason);
+
+    const std::string name_;
+    const std::string directory_;
+    const std::string path_;
+    const Clock& clock_;
+    const SinkCallbacks callbacks_;
+    const std::size_t capacity_;
+    // A run of drops for a full buffer is reported once; cleared by the next accepted line.
+    std::atomic<bool> dropping_{false};
+
+    int fd_ = -1;                  // sink's thread only
+    std::string lastProblem_;      // sink's thread only: the cause last reported, "" when healthy
+    std::uint64_t lostInRun_ = 0;  // sink's thread only: lines lost since the last written one
+
+    // Last, and reset first in the destructor: its thread uses every member above.
+    std::unique_ptr<BoundedWriter<Line>> writer_;
+};
+
+}  // namespace qv

@@ -1,0 +1,99 @@
+#include "service/QVReportingDaemonOptions.h"
+
+#include <unistd.h>
+
+#include <CLI/CLI.hpp>
+#include <cstdlib>
+#include <iostream>
+#include <map>
+
+namespace qv {
+
+namespace {
+
+constexpr const char* kVersion = "qvreportd 0.1.0";
+
+}  // namespace
+
+std::string QVReportingDefaultStateDirectory() {
+    if (const char* systemd = std::getenv("STATE_DIRECTORY"); systemd && *systemd) {
+        std::string dirs = systemd;
+        return dirs.substr(0, dirs.find(':'));  // systemd lists several separated by ':'
+    }
+    if (::geteuid() == 0) {
+        return "/var/lib/qvreportd";
+    }
+    if (const char* xdg = std::getenv("XDG_STATE_HOME"); xdg && *xdg) {
+        return std::string(xdg) + "/qvreportd";
+    }
+    const char* home = std::getenv("HOME");
+    return std::string(home && *home ? home : "/tmp") + "/.local/state/qvreportd";
+}
+
+std::optional<QVReportingDaemonOptions> QVReportingParseDaemonOptions(int argc, char** argv,
+                                                                      int& exitCode) {
+    QVReportingDaemonOptions o;
+    CLI::App app{
+        "qvreportd: the audio reporting daemon. Clients create reporting sessions over D-Bus "
+        "(com.korvane.qvsound.Reporting), send them messages and stop them; the daemon stores, "
+        "de-duplicates and forwards them to its sinks under the state directory."};
+    app.set_version_flag("--version", kVersion);
+    app.add_option("--bus", o.bus,
+                   "Bus to serve on: system, session, or a bus address (unix:path=...)")
+        ->capture_default_str();
+    std::string stateDir;
+    app.add_option("--state-dir", stateDir,
+                   "State directory (defaults/, sinks/, logs/); default: $STATE_DIRECTORY, "
+                   "/var/lib/qvreportd for root, else ~/.local/state/qvreportd");
+    app.add_option("--device-file", o.deviceFile,
+                   "Device description: {\"InternalBuild\": bool, \"capabilities\": {...}}")
+        ->capture_default_str();
+    bool internalBuild = false;
+    app.add_flag("--internal-build", internalBuild,
+                 "Behave as on an internal build, whatever the device file says");
+    app.add_option("--analytics-events", o.analyticsEventsFile,
+                   "File of analytics event names or globs in use (one a line); default: all")
+        ->check(CLI::ExistingFile);
+    const std::map<std::string, LogLevel> levels{{"debug", LogLevel::Debug},
+                                                 {"info", LogLevel::Info},
+                                                 {"default", LogLevel::Default},
+                                                 {"error", LogLevel::Error}};
+    app.add_option("--log-level", o.logLevel, "Lowest level logged: debug, info, default, error")
+        ->transform(CLI::CheckedTransformer(levels, CLI::ignore_case));
+    auto& l = o.limits;
+    app.add_option("--max-payload-bytes", l.maxPayloadBytes,
+                   "Largest payload or configuration, in D-Bus bytes")
+        ->capture_default_str()
+        ->check(CLI::PositiveNumber);
+    app.add_option("--max-payload-values", l.maxPayloadValues, "Most values in one payload")
+        ->capture_default_str()
+        ->check(CLI::PositiveNumber);
+    app.add_option("--max-payload-depth", l.maxPayloadDepth, "Deepest nesting of one payload")
+        ->capture_default_str()
+        ->check(CLI::PositiveNumber);
+    app.add_option("--max-reporter-ids", l.maxReporterIDsPerMessage,
+                   "Most reporter IDs one message may name")
+        ->capture_default_str()
+        ->check(CLI::PositiveNumber);
+    app.add_option("--max-sessions-per-client", l.maxSessionsPerClient,
+                   "Most sessions one client may hold")
+        ->capture_default_str()
+        ->check(CLI::PositiveNumber);
+    app.add_option("--max-clients", l.maxClients, "Most clients served at once")
+        ->capture_default_str()
+        ->check(CLI::PositiveNumber);
+    try {
+        app.parse(argc, argv);
+    } catch (const CLI::ParseError& e) {
+        exitCode = app.exit(e);
+        return std::nullopt;
+    }
+    if (internalBuild) {
+        o.internalBuild = true;
+    }
+    o.stateDir = stateDir.empty() ? QVReportingDefaultStateDirectory() : stateDir;
+    exitCode = 0;
+    return o;
+}
+
+}  // namespace qv

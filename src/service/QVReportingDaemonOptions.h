@@ -1,0 +1,31 @@
+// The daemon's command line and the state directory it settles on.
+#pragma once
+
+#include <optional>
+#include <string>
+
+#include "session/QVReportingLog.h"
+#include "session/QVReportingStats.h"
+
+namespace qv {
+
+struct QVReportingDaemonOptions {
+    std::string bus = "system";  // "system", "session" or a bus address
+    std::string stateDir;        // resolved: never empty after parsing
+    std::string deviceFile = "/etc/qvreportd/device.json";
+    std::optional<bool> internalBuild;
+    std::string analyticsEventsFile;
+    LogLevel logLevel = LogLevel::Info;
+    QVReportingLimits limits;
+};
+
+// Parses argv. Returns the options, or nothing after printing help, the version or an error;
+// exitCode then says how to leave (0 for help and version).
+std::optional<QVReportingDaemonOptions> QVReportingParseDaemonOptions(int argc, char** argv,
+                                                                      int& exitCode);
+
+// --state-dir, else $STATE_DIRECTORY (the first of its list), else /var/lib/qvreportd for root,
+// else $XDG_STATE_HOME/qvreportd, else ~/.local/state/qvreportd.
+std::string QVReportingDefaultStateDirectory();
+
+}  // namespace qv

@@ -1,0 +1,192 @@
+"""qvreportd driven over a private bus by an independent client (python3-dbus)."""
+
+import os
+import signal
+import subprocess
+import sys
+import time
+import unittest
+
+import dbus
+
+sys.path.insert(0, os.path.dirname(__file__))
+from harness import (BUS_NAME, DaemonTestCase, OBJECT_PATH, INTERFACE, wait_until)  # noqa: E402
+
+PLAYBACK, START = 4, 1
+GENERIC_CATEGORY, GENERIC_TYPE = 1, 0
+
+
+class SessionLife(DaemonTestCase):
+    def test_messages_of_a_session_reach_the_analytics_sink_under_both_names(self):
+        c = self.client()
+        c.create(7, service_type=7, config={"KXHostApplicationDisplayID": "com.example.music"})
+        c.start(7)
+        now = time.time()
+        c.send({"volume": 0.5, "qvreporting_timestamp": now, "key with blank": "x"}, PLAYBACK, START, [7])
+        c.send({"volume": 0.5, "qvreporting_timestamp": now + 1, "key with blank": "x"}, PLAYBACK, START, [7])
+        c.send({"volume": 0.7, "qvreporting_timestamp": now + 2, "key with blank": "x"}, PLAYBACK, START, [7])
+        self.assertTrue(c.stop(7))
+        self.assertTrue(c.destroy(7))
+
+        generic = wait_until(lambda: len(self.daemon.events("com.korvane.qvsound.Playback.Start")) == 2
+                             and self.daemon.events("com.korvane.qvsound.Playback.Start"),
+                             what="two forwarded messages (the repeat is redundant)")
+        named = self.daemon.events("com.korvane.longformaudio.Playback.Start")
+        self.assertEqual(len(named), 2)
+        first = generic[0]["payload"]
+        self.assertEqual(first["volume"], 0.5)
+        self.assertEqual(first["key_with_blank"], "x")
+        self.assertEqual(first["audiotag"], "PlaybackStart")
+        self.assertEqual(first["HostApplicationDisplayID"], "com.example.music")
+        self.assertEqual(generic[1]["payload"]["volume"], 0.7)
+        self.assertEqual(list(generic[0].keys())[0], "time")
+
+    def test_unknown_ids_are_answered_with_success_and_change_nothing(self):
+        c = self.client()
+        r = c.reporting
+        self.assertTrue(r.StartReportingSession(dbus.Int64(404)))
+        self.assertTrue(r.StopReportingSession(dbus.Int64(404)))
+        self.assertTrue(r.DestroyReportingSession(dbus.Int64(0)))
+        self.assertTrue(r.SetServiceType(dbus.UInt16(3), dbus.Int64(404)))
+        self.assertEqual(r.GetServiceNameForReporterID(dbus.Int64(404)), 65535)
+        valid = r.ReporterIDValid(dbus.Int64(404))
+        self.assertEqual(valid["reporterID"], 0)
+        self.assertEqual(valid["serviceType"], 65535)
+        self.assertIsInstance(valid["reporterID"], dbus.Int64)
+        self.assertIsInstance(valid["serviceType"], dbus.UInt16)
+        self.assertEqual(list(r.GetAllReporters()), [])
+
+
+class TwoClients(DaemonTestCase):
+    def test_a_message_without_ids_reaches_every_started_session_of_every_client(self):
+        a, b = self.client(), self.client()
+        a.create(1001, service_type=2)
+        b.create(2002, service_type=3)
+        a.start(1001)
+        b.start(2002)
+        self.assertEqual(sorted(a.reporting.GetAllReporters()), [1001, 2002])
+        self.assertEqual(b.reporting.ReporterIDValid(dbus.Int64(1001))["serviceType"], 2)
+        a.send({"broadcast": True}, GENERIC_CATEGORY, GENERIC_TYPE)
+        wait_until(lambda: self.daemon.events("com.korvane.telephony.Generic.Generic")
+                   and self.daemon.events("com.korvane.haptics.Generic.Generic"),
+                   what="the broadcast in both sessions")
+        # b cannot start a's session: the call is answered but nothing starts.
+        b.create(3003)
+        self.assertTrue(b.reporting.StartReportingSession(dbus.Int64(1001), timeout=5))
+
+    def test_a_client_killed_mid_session_has_its_sessions_stopped_and_its_uptime_recorded(self):
+        script = f"""
+import dbus, sys, time
+bus = dbus.bus.BusConnection({self.bus.address!r})
+r = dbus.Interface(bus.get_object({BUS_NAME!r}, {OBJECT_PATH!r}, introspect=False), {INTERFACE!r})
+r.CreateReportingSession(dbus.Int64(99))
+r.StartReportingSession(dbus.Int64(99), ignore_reply=True)
+r.GetAllReporters()
+print("ready", flush=True)
+time.sleep(60)
+"""
+        child = subprocess.Popen(["/usr/bin/python3", "-c", script], stdout=subprocess.PIPE, text=True)
+        self.addCleanup(child.stdout.close)
+        self.assertEqual(child.stdout.readline().strip(), "ready")
+        observer = self.client()
+        self.assertEqual(list(observer.reporting.GetAllReporters()), [99])
+        child.kill()
+        child.wait()
+        wait_until(lambda: list(observer.reporting.GetAllReporters()) == [], what="session gone")
+        uptime = wait_until(lambda: self.daemon.events("com.korvane.qvsound.qvreportingclientuptime"),
+                            what="the uptime event")
+        self.assertEqual(uptime[0]["payload"]["processName"], "python3")
+        self.assertGreaterEqual(uptime[0]["payload"]["seconds"], 0)
+        self.assertIn(f"removing {child.pid} from the server client list", self.daemon.log_text())
+
+
+class SingleMessageSession(DaemonTestCase):
+    def test_a_message_without_ids_while_nothing_runs_lives_in_the_shared_session_until_idle(self):
+        c = self.client()
+        c.send({"lonely": 1}, GENERIC_CATEGORY, GENERIC_TYPE)
+        events = wait_until(lambda: self.daemon.events("com.korvane.standalone.Generic.Generic"),
+                            what="the message in the standalone session")
+        self.assertEqual(events[0]["payload"]["lonely"], 1)
+        self.assertIn("Creating singleMessageSession", self.daemon.log_text())
+        wait_until(lambda: "Stopping singleMessageSession after timeout=5.000000" in self.daemon.log_text(),
+                   timeout=12, what="the idle session to be reaped")
+        # Unknown IDs never make one.
+        c.send({"nowhere": 1}, GENERIC_CATEGORY, GENERIC_TYPE, [123])
+        self.assertEqual(self.daemon.log_text().count("Creating singleMessageSession"), 1)
+
+
+class BadInput(DaemonTestCase):
+    daemon_args = ("--max-payload-bytes", "65536")
+
+    def assertRefused(self, call, error_name, text=None):
+        with self.assertRaises(dbus.exceptions.DBusException) as caught:
+            call()
+        self.assertEqual(caught.exception.get_dbus_name(), error_name)
+        if text:
+            self.assertIn(text, caught.exception.get_dbus_message())
+
+    def test_input_beyond_limits_or_of_foreign_types_is_refused_and_counted(self):
+        c = self.client()
+        c.create(5)
+        deep = {"leaf": 1}
+        for _ in range(20):
+            deep = {"nested": dbus.Dictionary(deep, signature="sv")}
+        with open(os.devnull) as f:
+            fd_payload = {"descriptor": dbus.types.UnixFd(f)}
+            self.assertRefused(lambda: c.send(fd_payload, 1, 0, [5]),
+                               "org.freedesktop.DBus.Error.InvalidArgs", "descriptor")
+        limits = "org.freedesktop.DBus.Error.LimitsExceeded"
+        self.assertRefused(lambda: c.send(deep, 1, 0, [5]), limits)
+        self.assertRefused(lambda: c.send({"big": "x" * 70000}, 1, 0, [5]), limits)
+        self.assertRefused(lambda: c.send({"k": 1}, 1, 0, list(range(1, 2000))), limits)
+        many = {f"k{i}": i for i in range(10001)}
+        self.assertRefused(lambda: c.send(many, 1, 0, [5]), limits)
+        stats = c.stats.GetStats()
+        self.assertEqual(stats["limits_exceeded"], 4)
+        self.assertEqual(stats["input_refused"], 1)
+        # Everything else still works, also every kind of value the bus carries.
+        c.start(5)
+        c.send({"b": True, "y": dbus.Byte(7), "n": dbus.Int16(-3), "q": dbus.UInt16(3),
+                "i": dbus.Int32(-70000), "u": dbus.UInt32(70000), "t": dbus.UInt64(2**64 - 1),
+                "d": 0.1, "s": "ü", "o": dbus.ObjectPath("/a/b"), "g": dbus.Signature("a{sv}"),
+                "ay": dbus.ByteArray(b"\x00\x01"), "st": dbus.Struct((1, "two"), signature="is"),
+                "ax": dbus.Array([1, 2], signature="x"), "empty": dbus.Dictionary({}, signature="sv"),
+                "": "empty key"}, 1, 0, [5])
+        line = wait_until(lambda: self.daemon.events("com.korvane.qvsound.Generic.Generic"),
+                          what="the message of every type")[0]["payload"]
+        self.assertEqual(line["t"], 2**64 - 1)
+        self.assertEqual(line["n"], -3)
+        self.assertEqual(line["ay"], "AAE=")
+        self.assertEqual(line["st"], [1, "two"])
+        self.assertEqual(line["s"], "ü")
+        self.assertEqual(line[""], "empty key")
+
+
+class Notifications(DaemonTestCase):
+    def test_a_ringer_change_posted_on_the_bus_reaches_running_sessions(self):
+        c = self.client()
+        c.create(8)
+        c.start(8)
+        c.notify.Post("com.korvane.deskhost.ringerstate", dbus.UInt64(1))
+        self.assertEqual(c.notify.GetState("com.korvane.deskhost.ringerstate"), 1)
+        setup = wait_until(lambda: [e for e in self.daemon.events("com.korvane.qvsound.Setup.Setup")
+                                    if "ringerstate" in e["payload"]],
+                           what="the ringer state in the session")
+        self.assertIs(setup[0]["payload"]["ringerstate"], True)
+        self.assertIn("last_updated", setup[0]["payload"])
+
+
+class Shutdown(DaemonTestCase):
+    def test_sigterm_stops_sessions_flushes_the_sinks_and_exits_zero(self):
+        c = self.client()
+        c.create(11)
+        c.start(11)
+        for i in range(200):
+            c.send({"i": i}, PLAYBACK, START, [11])
+        self.assertEqual(self.daemon.stop(signal.SIGTERM), 0)
+        self.assertEqual(len(self.daemon.events("com.korvane.qvsound.Playback.Start")), 200)
+        self.assertIn("stopping on", self.daemon.log_text())
+
+
+if __name__ == "__main__":
+    unittest.main(verbosity=2)
