@@ -11,12 +11,19 @@
 #include <malloc.h>
 #include <nlohmann/json.hpp>
 
+#include <unistd.h>
+
+#include <filesystem>
 #include <memory>
 #include <string>
 #include <vector>
 
+#include "platform/linux/LinuxAnalyticsService.h"
 #include "platform/linux/LinuxClock.h"
 #include "platform/linux/LinuxDeviceInformation.h"
+#include "platform/linux/LinuxNotificationCenter.h"
+#include "platform/linux/LinuxPreferenceStore.h"
+#include "platform/linux/LinuxProcessInfo.h"
 #include "session/QVReportingLog.h"
 #include "session/QVReportingSession.h"
 #include "session/QVReportingWorkerRegistry.h"
@@ -28,14 +35,25 @@ using namespace qv;
 
 constexpr std::int64_t kMessagesPerRun = 200000;
 
+// The real Linux platform on a temporary state directory; a session with no workers touches only
+// its clock.
 struct Env {
     Env() {
         setLogLevel(LogLevel::Error);
         QVReportingWorkerRegistry::setAllWorkerClasses({});  // a session with no workers
     }
+    ~Env() { std::filesystem::remove_all(stateDir); }
+    std::string stateDir = (std::filesystem::temp_directory_path() /
+                            ("qv-session-bench-" + std::to_string(::getpid())))
+                               .string();
     LinuxClock clock;
     LinuxDeviceInformation device{"/nonexistent"};
-    Platform platform{clock, device};
+    LinuxProcessInfo process;
+    LinuxPreferenceStore preferences{stateDir};
+    LinuxNotificationCenter notifications;
+    LinuxAnalyticsService::Created analytics =
+        LinuxAnalyticsService::create(stateDir, clock, "", SinkCallbacks{});
+    Platform platform{clock, device, process, preferences, notifications, *analytics.service};
 };
 
 Env& env() {

@@ -171,12 +171,17 @@ void QVReportingSession::addAudioMessageTag(QVReportingSessionMessage& message) 
 
 void QVReportingSession::addAppName(QVReportingSessionMessage& message) const {
     Dictionary& payload = message.message();
-    if (const Value* name = payload.find(QVReportingApplicationName);
-        name && *name != Value("Unknown")) {
+    Value* name = payload.find(QVReportingApplicationName);
+    if (name && !(name->isString() && *name->asString() == "Unknown")) {
         return;
     }
     const Value* configured = configuration_.find(QVReportingApplicationName);
-    payload.set(QVReportingApplicationName, configured ? *configured : Value("Unknown"));
+    Value chosen = configured ? *configured : Value("Unknown");
+    if (name) {
+        *name = std::move(chosen);
+    } else {
+        payload.set(QVReportingApplicationName, std::move(chosen));
+    }
 }
 
 // ---- intake ----
@@ -194,11 +199,13 @@ bool QVReportingSession::messageIsRedundant(const QVReportingSessionMessage& mes
     if (countCompared(current) != countCompared(previous)) {
         return false;
     }
+    std::size_t position = 0;  // messages of one kind usually hold their keys in one order
     for (const auto& [key, value] : current) {
+        const std::size_t at = position++;
         if (ignoredByRedundancy(key)) {
             continue;
         }
-        const Value* other = previous.find(key);
+        const Value* other = previous.findNear(key, at);
         if (!other || *other != value) {
             return false;
         }

@@ -19,15 +19,14 @@ constexpr std::size_t kStampedKeys = 4;
 QVReportingSessionMessage::QVReportingSessionMessage(const Dictionary& payload,
                                                      AudioEventCategory category,
                                                      AudioEventType type)
-    : category_(category), type_(type) {
-    message_.reserve(payload.size() + kStampedKeys);
-    message_.merge(payload);
-}
+    : message_(payload, kStampedKeys), category_(category), type_(type) {}
 
 QVReportingSessionMessage::QVReportingSessionMessage(Dictionary&& payload,
                                                      AudioEventCategory category,
                                                      AudioEventType type)
-    : message_(std::move(payload)), category_(category), type_(type) {}
+    : message_(std::move(payload)), category_(category), type_(type) {
+    message_.reserveMore(kStampedKeys);
+}
 
 std::string QVReportingSessionMessage::description() const {
     return fmt::format("category={} type={} {}", QVReportingUtilityCategoryString(category_),

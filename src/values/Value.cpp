@@ -6,6 +6,7 @@
 #include <cmath>
 #include <ctime>
 #include <functional>
+#include <iterator>
 #include <limits>
 
 namespace qv {
@@ -368,10 +369,32 @@ Dictionary::Dictionary(std::initializer_list<Entry> entries) {
     }
 }
 
+Dictionary::Dictionary(const Dictionary& other, std::size_t extra) : slots_(other.slots_) {
+    entries_.reserve(other.size() + extra);
+    entries_.insert(entries_.end(), other.entries_.begin(), other.entries_.end());
+}
+
+void Dictionary::reserveMore(std::size_t extra) {
+    const std::size_t want = entries_.size() + extra;
+    if (entries_.capacity() < want) {
+        entries_.reserve(want);
+    } else if (entries_.capacity() > want + want / 4) {
+        // A dictionary that grew by doubling is kept at the size it will stay at.
+        std::vector<Entry> tight;
+        tight.reserve(want);
+        std::move(entries_.begin(), entries_.end(), std::back_inserter(tight));
+        entries_.swap(tight);
+    }
+}
+
 std::ptrdiff_t Dictionary::indexOf(std::string_view key) const {
     if (slots_.empty()) {
+        // Most keys differ in length or first letter: test those before comparing bytes.
+        const std::size_t size = key.size();
+        const char first = size ? key[0] : '\0';
         for (std::size_t i = 0; i < entries_.size(); ++i) {
-            if (entries_[i].first == key) {
+            const std::string& k = entries_[i].first;
+            if (k.size() == size && (size == 0 || (k[0] == first && k == key))) {
                 return static_cast<std::ptrdiff_t>(i);
             }
         }
@@ -452,9 +475,32 @@ bool Dictionary::erase(std::string_view key) {
     return true;
 }
 
+const Value* Dictionary::findNear(std::string_view key, std::size_t hint) const {
+    if (hint < entries_.size() && entries_[hint].first == key) {
+        return &entries_[hint].second;
+    }
+    return find(key);
+}
+
 void Dictionary::merge(const Dictionary& other) {
+    // Payloads of one client tend to repeat their keys in one order: look where the previous key
+    // was found, one further, before searching.
+    std::size_t hint = 0;
     for (const auto& [k, v] : other) {
-        set(k, v);
+        Value* existing = nullptr;
+        if (hint < entries_.size() && entries_[hint].first == k) {
+            existing = &entries_[hint].second;
+        } else if (const auto i = indexOf(k); i >= 0) {
+            hint = static_cast<std::size_t>(i);
+            existing = &entries_[hint].second;
+        }
+        if (existing) {
+            *existing = v;
+            ++hint;
+        } else {
+            set(k, v);
+            hint = entries_.size();
+        }
     }
 }
 

@@ -118,6 +118,8 @@ class Dictionary {
 
     Dictionary() = default;
     Dictionary(std::initializer_list<Entry> entries);
+    // A copy with room for extra more entries.
+    Dictionary(const Dictionary& other, std::size_t extra);
 
     std::size_t size() const { return entries_.size(); }
     bool empty() const { return entries_.empty(); }
@@ -127,6 +129,9 @@ class Dictionary {
     const Value* find(std::string_view key) const;
     Value* find(std::string_view key);
     bool contains(std::string_view key) const { return find(key) != nullptr; }
+    // find(), trying the entry at position hint first: cheap when two dictionaries hold their
+    // keys in the same order.
+    const Value* findNear(std::string_view key, std::size_t hint) const;
 
     // Inserts at the end, or replaces the value in place when the key exists.
     void set(std::string_view key, Value value);
@@ -136,6 +141,9 @@ class Dictionary {
     void merge(const Dictionary& other);
     void clear();
     void reserve(std::size_t n) { entries_.reserve(n); }
+    // Makes room for exactly extra more entries (giving back spare room) without changing what
+    // the dictionary holds.
+    void reserveMore(std::size_t extra);
 
     // Same keys with equal values; order does not matter.
     bool operator==(const Dictionary& other) const;
