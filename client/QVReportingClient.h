@@ -13,8 +13,8 @@
 //
 // Thread safety: every member may be called from any thread. Asynchronous callbacks run on the
 // client's own event-loop thread, one at a time (a call that cannot even be sent calls back at
-// once, on the caller's thread); a callback may call blocking operations, but the replies of
-// other asynchronous calls wait until it returns. No callback runs after the destructor has
+// once, on the caller's thread); a callback should return promptly, since the replies of other
+// asynchronous calls wait until it returns. No callback runs after the destructor has
 // returned; the destructor must not run on the event-loop thread (inside a callback), nor while
 // another thread waits in a blocking call.
 #pragma once

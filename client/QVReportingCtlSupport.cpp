@@ -23,8 +23,9 @@ namespace {
 constexpr std::string_view kSinkSuffix = ".jsonl";
 constexpr std::string_view kMTXSink = "mtx";
 
-// A whole decimal or 0x-hex unsigned number, nothing around it.
-std::optional<std::uint64_t> parseUnsigned(std::string_view text) {
+}  // namespace
+
+std::optional<std::uint64_t> QVReportingCtlParseUnsigned(std::string_view text) {
     int base = 10;
     if (text.size() > 2 && text[0] == '0' && (text[1] == 'x' || text[1] == 'X')) {
         text.remove_prefix(2);
@@ -40,6 +41,8 @@ std::optional<std::uint64_t> parseUnsigned(std::string_view text) {
     }
     return value;
 }
+
+namespace {
 
 template <typename T>
 std::optional<T> bounded(std::optional<std::uint64_t> value) {
@@ -76,7 +79,7 @@ constexpr AudioEventCategory kPrefixes[] = {
 // --- Vocabulary ---------------------------------------------------------------------------------
 
 std::optional<std::uint32_t> QVReportingCtlParseCategory(std::string_view text) {
-    if (auto number = bounded<std::uint32_t>(parseUnsigned(text))) {
+    if (auto number = bounded<std::uint32_t>(QVReportingCtlParseUnsigned(text))) {
         return number;
     }
     // The one name that the daemon reads but never prints ("Undefined" would name every unknown
@@ -96,7 +99,7 @@ std::optional<std::uint32_t> QVReportingCtlParseCategory(std::string_view text) 
 }
 
 std::optional<std::uint16_t> QVReportingCtlParseType(std::string_view text) {
-    if (auto number = bounded<std::uint16_t>(parseUnsigned(text))) {
+    if (auto number = bounded<std::uint16_t>(QVReportingCtlParseUnsigned(text))) {
         return number;
     }
     for (AudioEventType t = type::kGeneric; t <= type::kMemoryLog; ++t) {
@@ -111,7 +114,7 @@ std::optional<std::uint16_t> QVReportingCtlParseType(std::string_view text) {
 }
 
 std::optional<std::uint16_t> QVReportingCtlParseServiceType(std::string_view text) {
-    if (auto number = bounded<std::uint16_t>(parseUnsigned(text))) {
+    if (auto number = bounded<std::uint16_t>(QVReportingCtlParseUnsigned(text))) {
         return number;
     }
     // Unknown names map to "unknown" too; only a name that comes back unchanged is one.

@@ -32,6 +32,8 @@ std::optional<std::uint32_t> QVReportingCtlParseCategoryFromJson(
 std::optional<std::uint16_t> QVReportingCtlParseTypeFromJson(const nlohmann::ordered_json& json);
 std::optional<std::uint16_t> QVReportingCtlParseServiceTypeFromJson(
     const nlohmann::ordered_json& json);
+// A decimal or 0x-hexadecimal number in the unsigned 64-bit range (notification states).
+std::optional<std::uint64_t> QVReportingCtlParseUnsigned(std::string_view text);
 // A reporter ID: a decimal integer in the signed 64-bit range.
 std::optional<std::int64_t> QVReportingCtlParseReporterID(std::string_view text);
 

@@ -22,14 +22,14 @@ constexpr double kMaxSleepSeconds = 3600;
 // Keys besides "op"; unused places are empty.
 using Keys = std::array<std::string_view, 2>;
 
-struct OperationSpec {
+struct OperationShape {
     Kind kind;
     std::string_view name;
     Keys required;
     Keys optional;
 };
 
-constexpr OperationSpec kSpecs[] = {
+constexpr OperationShape kShapes[] = {
     {Kind::Create, "create", {"id"}, {}},
     {Kind::SetType, "set-type", {"id", "type"}, {}},
     {Kind::GetType, "get-type", {"id"}, {}},
@@ -65,25 +65,25 @@ std::int64_t reporterIDFrom(const Json& json, std::string_view what) {
               json.dump()};
 }
 
-const OperationSpec& specFor(const Json& op) {
+const OperationShape& shapeFor(const Json& op) {
     if (!op.is_string()) {
         throw Bad{"\"op\" must be a string"};
     }
     const auto name = op.get<std::string>();
-    for (const auto& spec : kSpecs) {
-        if (spec.name == name) {
-            return spec;
+    for (const auto& shape : kShapes) {
+        if (shape.name == name) {
+            return shape;
         }
     }
     std::string known;
-    for (const auto& spec : kSpecs) {
+    for (const auto& shape : kShapes) {
         known += known.empty() ? "" : ", ";
-        known += spec.name;
+        known += shape.name;
     }
     throw Bad{"unknown operation " + jsonQuoted(name) + " (known: " + known + ")"};
 }
 
-void checkKeys(const Json& object, const OperationSpec& spec) {
+void checkKeys(const Json& object, const OperationShape& shape) {
     for (const auto& [key, value] : object.items()) {
         if (key == "op") {
             continue;
@@ -91,13 +91,13 @@ void checkKeys(const Json& object, const OperationSpec& spec) {
         const auto listed = [&](const Keys& keys) {
             return !key.empty() && std::find(keys.begin(), keys.end(), key) != keys.end();
         };
-        if (!listed(spec.required) && !listed(spec.optional)) {
-            throw Bad{"\"" + std::string(spec.name) + "\" takes no key " + jsonQuoted(key)};
+        if (!listed(shape.required) && !listed(shape.optional)) {
+            throw Bad{"\"" + std::string(shape.name) + "\" takes no key " + jsonQuoted(key)};
         }
     }
-    for (std::string_view key : spec.required) {
+    for (std::string_view key : shape.required) {
         if (!key.empty() && !object.contains(key)) {
-            throw Bad{"\"" + std::string(spec.name) + "\" needs \"" + std::string(key) + "\""};
+            throw Bad{"\"" + std::string(shape.name) + "\" needs \"" + std::string(key) + "\""};
         }
     }
 }
@@ -125,16 +125,16 @@ QVReportingReplayOperation parse(std::string_view text, std::size_t line) {
     if (opField == object.end()) {
         throw Bad{"missing \"op\""};
     }
-    const OperationSpec& spec = specFor(*opField);
-    checkKeys(object, spec);
+    const OperationShape& shape = shapeFor(*opField);
+    checkKeys(object, shape);
 
     QVReportingReplayOperation op;
     op.line = line;
-    op.kind = spec.kind;
+    op.kind = shape.kind;
     if (object.contains("id")) {
         op.reporterID = reporterIDFrom(object.at("id"), "\"id\"");
     }
-    switch (spec.kind) {
+    switch (shape.kind) {
         case Kind::SetType: {
             const auto serviceType = QVReportingCtlParseServiceTypeFromJson(object.at("type"));
             if (!serviceType) {
@@ -201,9 +201,9 @@ QVReportingReplayOperation parse(std::string_view text, std::size_t line) {
 }  // namespace
 
 std::string_view QVReportingReplayOperationName(Kind kind) {
-    for (const auto& spec : kSpecs) {
-        if (spec.kind == kind) {
-            return spec.name;
+    for (const auto& shape : kShapes) {
+        if (shape.kind == kind) {
+            return shape.name;
         }
     }
     return "?";

@@ -5,6 +5,7 @@
 // is not running on the chosen bus. Messages for people go to standard error; with --json,
 // results go to standard output as one JSON document per line.
 
+#include <algorithm>
 #include <chrono>
 #include <condition_variable>
 #include <csignal>
@@ -51,6 +52,8 @@ constexpr const char* kDaemonSuiteChanged = "com.korvane.qvsound.reporting";
 
 // How long a script waits, after stopping a session, for that session's held start reply.
 constexpr auto kStartReplyWait = std::chrono::seconds(5);
+// How long a script's end waits for answers that it did not wait for on the way.
+constexpr auto kLateAnswerWait = std::chrono::milliseconds(200);
 constexpr auto kFollowInterval = std::chrono::milliseconds(100);
 
 // A problem with what the user gave us (exit 2), as opposed to a failed call (exit 1).
@@ -345,12 +348,16 @@ class BusCommands {
         return 0;
     }
 
-    int notifyPost(const std::string& name, std::uint64_t state) {
-        client().postNotification(name, state);
+    int notifyPost(const std::string& name, const std::string& text) {
+        const auto state = qv::client::QVReportingCtlParseUnsigned(text);
+        if (!state) {
+            throw UsageError{"not a state (an unsigned 64-bit number): " + text};
+        }
+        client().postNotification(name, *state);
         if (options_.json) {
-            emit({{"op", "notify-post"}, {"name", name}, {"state", state}});
+            emit({{"op", "notify-post"}, {"name", name}, {"state", *state}});
         } else {
-            std::cout << fmt::format("posted {} = {}", name, state) << std::endl;
+            std::cout << fmt::format("posted {} = {}", name, *state) << std::endl;
         }
         return 0;
     }
@@ -385,14 +392,23 @@ class ReplayRunner {
             runOne(op);
             printArrivedStarts();
         }
+        {
+            // An answer that was not waited for (a start before a same-type set-type, say)
+            // may still be on its way.
+            std::unique_lock lock(shared_->mutex);
+            if (!shared_->pending.empty()) {
+                shared_->changed.wait_for(lock, kLateAnswerWait,
+                                          [&] { return !shared_->arrived.empty(); });
+            }
+        }
         printArrivedStarts();
         std::lock_guard lock(shared_->mutex);
         for (const auto& [id, lines] : shared_->pending) {
             for (auto line : lines) {
                 report(line, "start", id,
-                       json_ ? Json{{"pending", true}}
-                             : Json("never answered: the session was still running, or was "
-                                    "already started, when the script ended"));
+                       "never answered: the session was still running, or was already started, "
+                       "when the script ended",
+                       true);
             }
         }
         return 0;
@@ -413,17 +429,19 @@ class ReplayRunner {
         std::condition_variable changed;
         std::deque<StartReply> arrived;                           // guarded by mutex
         std::map<std::int64_t, std::deque<std::size_t>> pending;  // lines; guarded by mutex
+        std::map<std::int64_t, std::size_t> answers;  // start answers so far; guarded by mutex
     };
 
+    // One line of output; a pending start has no result yet (for people, result says why).
     void report(std::size_t line, std::string_view op, std::optional<std::int64_t> id,
-                const Json& result) {
+                const Json& result, bool pending = false) {
         if (json_) {
             Json out = {{"line", line}, {"op", op}};
             if (id) {
                 out["id"] = *id;
             }
-            if (result.is_object() && result.contains("pending")) {
-                out["pending"] = result["pending"];
+            if (pending) {
+                out["pending"] = true;
             } else {
                 out["result"] = result;
             }
@@ -449,10 +467,12 @@ class ReplayRunner {
         try {
             switch (op.kind) {
                 case Kind::Create:
+                    endSession(op.reporterID, op.line);
                     report(op.line, name, op.reporterID,
                            client_.createReportingSession(op.reporterID));
                     break;
                 case Kind::SetType:
+                    endSession(op.reporterID, op.line);
                     report(op.line, name, op.reporterID,
                            client_.setServiceType(op.serviceType, op.reporterID));
                     break;
@@ -482,15 +502,21 @@ class ReplayRunner {
                                                   qv::QVReportingUtilityTypeString(op.type),
                                                   idsText(op.reporterIDs))));
                     break;
-                case Kind::Stop:
+                case Kind::Stop: {
+                    const bool held = endSession(op.reporterID, op.line);
+                    const auto before = startAnswers(op.reporterID);
                     report(op.line, name, op.reporterID,
                            client_.stopReportingSession(op.reporterID));
-                    awaitStartReply(op.reporterID);
+                    if (held) {
+                        awaitStartReply(op.reporterID, before);
+                    }
                     break;
+                }
                 case Kind::Destroy:
+                    // Destroying stops a started session without answering its start call.
+                    endSession(op.reporterID, op.line);
                     report(op.line, name, op.reporterID,
                            client_.destroyReportingSession(op.reporterID));
-                    awaitStartReply(op.reporterID);
                     break;
                 case Kind::Valid:
                     report(op.line, name, op.reporterID,
@@ -522,34 +548,53 @@ class ReplayRunner {
                                const QVReportingClientError* error, bool result) {
                 std::lock_guard lock(shared->mutex);
                 auto& lines = shared->pending[id];
-                // The daemon answers a session's first start call; later ones stay unanswered.
-                if (!lines.empty()) {
-                    lines.pop_front();
+                if (auto it = std::find(lines.begin(), lines.end(), line); it != lines.end()) {
+                    lines.erase(it);
                 }
                 if (lines.empty()) {
                     shared->pending.erase(id);
                 }
+                ++shared->answers[id];
                 shared->arrived.push_back(
                     {id, line, error ? std::optional(*error) : std::nullopt, result});
                 shared->changed.notify_all();
             });
         report(op.line, "start", op.reporterID,
-               json_ ? Json{{"pending", true}} : Json("reply held until the session stops"));
+               "waiting for the reply (held until the session stops)", true);
+    }
+
+    // Whether the daemon holds a start call of this session: one made since the session was last
+    // stopped, destroyed or replaced (create, and set-type when the type changes, put a new
+    // session in its place, dropping a held call unanswered). Marks the session as ended here.
+    bool endSession(std::int64_t id, std::size_t line) {
+        std::size_t& boundary = sessionBoundaries_[id];
+        bool held = false;
+        {
+            std::lock_guard lock(shared_->mutex);
+            if (auto it = shared_->pending.find(id); it != shared_->pending.end()) {
+                held = std::any_of(it->second.begin(), it->second.end(),
+                                   [&](std::size_t l) { return l > boundary; });
+            }
+        }
+        boundary = line;
+        return held;
+    }
+
+    // The number of answers to start calls of a session so far.
+    std::size_t startAnswers(std::int64_t id) {
+        std::lock_guard lock(shared_->mutex);
+        auto it = shared_->answers.find(id);
+        return it == shared_->answers.end() ? 0 : it->second;
     }
 
     // A stopped session answers its held start call just before the stop reply; the answer may
-    // still be on its way through the client's thread.
-    void awaitStartReply(std::int64_t id) {
+    // still be on its way through the client's thread, or may have come already (answers then
+    // moved past before). A start call made while the session was already started is never
+    // answered, so this waits for one answer, not for all, and only while one is outstanding.
+    void awaitStartReply(std::int64_t id, std::size_t before) {
         std::unique_lock lock(shared_->mutex);
-        auto it = shared_->pending.find(id);
-        if (it == shared_->pending.end()) {
-            return;
-        }
-        const std::size_t before = it->second.size();
-        shared_->changed.wait_for(lock, kStartReplyWait, [&] {
-            auto now = shared_->pending.find(id);
-            return now == shared_->pending.end() || now->second.size() < before;
-        });
+        shared_->changed.wait_for(lock, kStartReplyWait,
+                                  [&] { return shared_->answers[id] > before; });
         lock.unlock();
         printArrivedStarts();
     }
@@ -567,14 +612,15 @@ class ReplayRunner {
                     fmt::format("line {}: start failed: {}", reply.line, reply.error->message()));
             }
             report(reply.line, "start", reply.id,
-                   json_ ? Json(reply.result)
-                         : Json(fmt::format("{} (answered as the session stopped)", reply.result)));
+                   json_ ? Json(reply.result) : Json(fmt::format("answered {}", reply.result)));
         }
     }
 
     QVReportingClient& client_;
     const bool json_;
     std::shared_ptr<Shared> shared_ = std::make_shared<Shared>();
+    // Per session, the line that last stopped, destroyed or replaced it (script thread only).
+    std::map<std::int64_t, std::size_t> sessionBoundaries_;
 };
 
 int BusCommands::replay(const std::string& file) {
@@ -770,7 +816,6 @@ int run(int argc, char** argv) {
 
     std::string id, type, text, category, suite, key, name, sink, config;
     std::vector<std::string> ids;
-    std::uint64_t state = 0;
     bool follow = false, create = false;
 
     auto* c = app.add_subcommand("create", "Create a session (CreateReportingSession)");
@@ -860,8 +905,8 @@ int run(int argc, char** argv) {
     notify->require_subcommand(1);
     c = notify->add_subcommand("post", "Post a notification with a 64-bit state");
     c->add_option("NAME", name, "Notification name")->required();
-    c->add_option("STATE", state, "State, 0 to 18446744073709551615")->required();
-    c->callback([&] { action = [&] { return bus.notifyPost(name, state); }; });
+    c->add_option("STATE", text, "State, 0 to 18446744073709551615")->required();
+    c->callback([&] { action = [&] { return bus.notifyPost(name, text); }; });
     c = notify->add_subcommand("get", "Print a notification's state");
     c->add_option("NAME", name, "Notification name")->required();
     c->callback([&] { action = [&] { return bus.notifyGet(name); }; });
@@ -877,7 +922,8 @@ int run(int argc, char** argv) {
     try {
         app.parse(argc, argv);
     } catch (const CLI::ParseError& e) {
-        return app.exit(e);
+        // Help is a "parse error" that exits 0; every real one is a usage error.
+        return app.exit(e) == 0 ? 0 : kExitUsage;
     }
     if (options.stateDir.empty()) {
         options.stateDir = qv::client::QVReportingCtlDefaultStateDirectory();

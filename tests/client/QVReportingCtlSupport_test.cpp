@@ -46,6 +46,11 @@ TEST(TheCtlVocabulary, ReadsTypesServiceTypesAndReporterIDs) {
     EXPECT_EQ(QVReportingCtlParseTypeFromJson(nlohmann::ordered_json("Stop")), 2);
     EXPECT_EQ(QVReportingCtlParseServiceTypeFromJson(nlohmann::ordered_json(1.5)), std::nullopt);
 
+    EXPECT_EQ(QVReportingCtlParseUnsigned("18446744073709551615"), UINT64_MAX);
+    EXPECT_EQ(QVReportingCtlParseUnsigned("0xFFFFFFFFFFFFFFFF"), UINT64_MAX);
+    EXPECT_EQ(QVReportingCtlParseUnsigned("18446744073709551616"), std::nullopt);
+    EXPECT_EQ(QVReportingCtlParseUnsigned("-1"), std::nullopt);
+
     EXPECT_EQ(QVReportingCtlParseReporterID("-9223372036854775808"), INT64_MIN);
     EXPECT_EQ(QVReportingCtlParseReporterID("9223372036854775807"), INT64_MAX);
     EXPECT_EQ(QVReportingCtlParseReporterID("9223372036854775808"), std::nullopt);
