@@ -1,5 +1,6 @@
 #include "platform/linux/LinuxPreferenceStore.h"
 
+#include <fmt/format.h>
 #include <gtest/gtest.h>
 
 #include <sys/stat.h>
@@ -244,8 +245,7 @@ TEST_F(ALinuxPreferenceStore, LosesNoWriteWhenStoresWriteOneSuiteAtOnce) {
         threads.emplace_back([&, t] {
             LinuxPreferenceStore& store = t % 2 == 0 ? first : second;
             for (int i = 0; i < kKeysPerThread; ++i) {
-                EXPECT_TRUE(store.setValue(
-                    "shared", "t" + std::to_string(t) + "_" + std::to_string(i), Value(i)));
+                EXPECT_TRUE(store.setValue("shared", fmt::format("t{}_{}", t, i), Value(i)));
                 (void)store.values("shared");
             }
         });

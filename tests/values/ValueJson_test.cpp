@@ -1,5 +1,6 @@
 #include "values/ValueJson.h"
 
+#include <fmt/format.h>
 #include <gtest/gtest.h>
 #include <nlohmann/json.hpp>
 
@@ -121,7 +122,7 @@ TEST(ValueJson, ReadsNestedObjectsInSourceOrderAndRefusesNonObjectsAsDictionarie
 TEST(ValueJson, LargeDictionariesKeepTheirOrderBothWays) {
     Dictionary big;
     for (int i = 4999; i >= 0; --i) {
-        big.set("k" + std::to_string(i), i);
+        big.set(fmt::format("k{}", i), i);
     }
     const Dictionary back = roundTrip(big);
     ASSERT_EQ(back.size(), big.size());
