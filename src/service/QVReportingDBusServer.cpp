@@ -89,16 +89,24 @@ void QVReportingDBusServer::start() {
     connection_->requestName(dbus::kBusName);
     QVLOG_DEFAULT(logCategory(), "owning bus name {} as {}", dbus::kBusName,
                   connection_->getUniqueName());
-    loopThread_ = std::thread([this] { loop(); });
+    loopThread_ = std::thread([this] {
+        loop();
+        drainPosted(true);
+    });
 }
 
-void QVReportingDBusServer::post(std::function<void()> fn) {
+bool QVReportingDBusServer::post(std::function<void()> fn) {
     {
+        // A loop that ended (the bus was lost) runs nothing more.
         std::lock_guard lock(postMutex_);
+        if (loopEnded_) {
+            return false;
+        }
         posted_.push_back(std::move(fn));
     }
     const std::uint64_t one = 1;
     [[maybe_unused]] const auto n = ::write(wakeFd_, &one, sizeof one);
+    return true;
 }
 
 void QVReportingDBusServer::flush() {
@@ -107,17 +115,19 @@ void QVReportingDBusServer::flush() {
     }
     std::promise<void> done;
     auto future = done.get_future();
-    post([&done] { done.set_value(); });
-    future.wait();
+    if (post([&done] { done.set_value(); })) {
+        future.wait();
+    }
 }
 
-void QVReportingDBusServer::drainPosted() {
+void QVReportingDBusServer::drainPosted(bool last) {
     std::uint64_t count = 0;
     [[maybe_unused]] const auto n = ::read(wakeFd_, &count, sizeof count);
     std::deque<std::function<void()>> batch;
     {
         std::lock_guard lock(postMutex_);
         batch.swap(posted_);
+        loopEnded_ = loopEnded_ || last;
     }
     for (auto& fn : batch) {
         try {

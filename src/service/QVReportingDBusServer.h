@@ -43,8 +43,8 @@ class QVReportingDBusServer {
     // Registers the objects, starts the loop thread and requests the bus name. Throws
     // sdbus::Error when the name cannot be had.
     void start();
-    // Runs fn on the loop thread.
-    void post(std::function<void()> fn);
+    // Runs fn on the loop thread; false (fn dropped) once the loop has ended.
+    bool post(std::function<void()> fn);
     // Blocks until every reply and signal posted so far has been handed to the bus.
     void flush();
 
@@ -62,7 +62,8 @@ class QVReportingDBusServer {
     void registerStatsInterface();
     void registerNotifyInterface();
     void loop();
-    void drainPosted();
+    // Runs what was posted; with last, also marks the loop as ended so nothing waits on it.
+    void drainPosted(bool last = false);
 
     // On the loop thread: the client of the call's sender, accepted on its first call; null when
     // the daemon serves as many clients as it may (the call is then answered with an error).
@@ -88,6 +89,7 @@ class QVReportingDBusServer {
     std::atomic<bool> stopping_{false};
     std::mutex postMutex_;
     std::deque<std::function<void()>> posted_;  // guarded by postMutex_
+    bool loopEnded_ = false;                    // guarded by postMutex_
 
     // Touched on the loop thread only.
     std::unordered_map<std::string, std::shared_ptr<QVReportingClientServerInstance>> clients_;

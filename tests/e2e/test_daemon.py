@@ -10,7 +10,8 @@ import unittest
 import dbus
 
 sys.path.insert(0, os.path.dirname(__file__))
-from harness import (BUS_NAME, DaemonTestCase, OBJECT_PATH, INTERFACE, wait_until)  # noqa: E402
+from harness import (BUS_NAME, Bus, Client, Daemon, DaemonTestCase, OBJECT_PATH, INTERFACE,
+                     wait_until)  # noqa: E402
 
 PLAYBACK, START = 4, 1
 GENERIC_CATEGORY, GENERIC_TYPE = 1, 0
@@ -186,6 +187,32 @@ class Shutdown(DaemonTestCase):
         self.assertEqual(self.daemon.stop(signal.SIGTERM), 0)
         self.assertEqual(len(self.daemon.events("com.korvane.qvsound.Playback.Start")), 200)
         self.assertIn("stopping on", self.daemon.log_text())
+
+    def test_losing_the_bus_stops_the_daemon_cleanly_even_amid_a_sigterm(self):
+        # Alone, the bus vanishing stops the daemon; with a SIGTERM at the same moment, the stop
+        # must not wait on a bus loop that already ended.
+        for also_sigterm in (False, True):
+            with self.subTest(also_sigterm=also_sigterm):
+                if also_sigterm:
+                    self.bus = Bus(self.workdir)
+                    state = os.path.join(self.workdir, "state2")
+                    os.makedirs(state)
+                    self.daemon = Daemon(self.bus, state)
+                c = Client(self.bus)
+                c.create(12)
+                c.start(12)
+                for i in range(50):
+                    c.send({"i": i}, PLAYBACK, START, [12])
+                if also_sigterm:
+                    self.daemon.process.send_signal(signal.SIGTERM)
+                self.bus.process.kill()
+                self.assertEqual(self.daemon.process.wait(timeout=10), 0)
+                self.assertEqual(len(self.daemon.events("com.korvane.qvsound.Playback.Start")), 50)
+                if not also_sigterm:
+                    self.assertIn("lost the bus", self.daemon.log_text())
+                self.bus.process.wait()
+                self.bus.process.stdout.close()
+                self.daemon.log.close()
 
 
 if __name__ == "__main__":
