@@ -24,6 +24,7 @@
 #include "platform/linux/LinuxNotificationCenter.h"
 #include "platform/linux/LinuxPreferenceStore.h"
 #include "platform/linux/LinuxProcessInfo.h"
+#include "platform/linux/LinuxSystemCondition.h"
 #include "session/QVReportingLog.h"
 #include "session/QVReportingSession.h"
 #include "session/QVReportingWorkerRegistry.h"
@@ -47,13 +48,15 @@ struct Env {
                             ("qv-session-bench-" + std::to_string(::getpid())))
                                .string();
     LinuxClock clock;
-    LinuxDeviceInformation device{"/nonexistent"};
+    LinuxDeviceInformation device{"/nonexistent", std::filesystem::temp_directory_path()};
     LinuxProcessInfo process;
     LinuxPreferenceStore preferences{stateDir};
     LinuxNotificationCenter notifications;
     LinuxAnalyticsService::Created analytics =
         LinuxAnalyticsService::create(stateDir, clock, "", SinkCallbacks{});
-    Platform platform{clock, device, process, preferences, notifications, *analytics.service};
+    LinuxSystemCondition condition;
+    Platform platform{clock,    device, process, preferences, notifications, *analytics.service,
+                      condition};
 };
 
 Env& env() {

@@ -3,6 +3,7 @@
 // Thread safety: implementations are safe to call from any thread.
 #pragma once
 
+#include <filesystem>
 #include <optional>
 #include <string_view>
 
@@ -17,6 +18,8 @@ class DeviceInformation {
     virtual std::optional<bool> boolAnswer(std::string_view key) const = 0;
     // Whether the device declares a capability; false when it is not declared.
     virtual bool hasCapability(std::string_view capability) const = 0;
+    // Where the device keeps diagnostic logs (session summary files, trace results).
+    virtual std::filesystem::path diagnosticLogsDirectory() const = 0;
 };
 
 }  // namespace qv

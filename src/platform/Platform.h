@@ -11,6 +11,7 @@ class DeviceInformation;
 class NotificationCenter;
 class PreferenceStore;
 class ProcessInfo;
+class SystemCondition;
 
 struct Platform {
     Clock& clock;
@@ -19,6 +20,7 @@ struct Platform {
     PreferenceStore& preferences;
     NotificationCenter& notifications;
     AnalyticsService& analytics;
+    SystemCondition& condition;
 };
 
 }  // namespace qv

@@ -18,6 +18,7 @@
 #include "platform/linux/LinuxNotificationCenter.h"
 #include "platform/linux/LinuxPreferenceStore.h"
 #include "platform/linux/LinuxProcessInfo.h"
+#include "platform/linux/LinuxSystemCondition.h"
 #include "service/QVReportingDBusServer.h"
 #include "service/QVReportingDaemonOptions.h"
 #include "service/QVReportingService.h"
@@ -77,7 +78,9 @@ int main(int argc, char** argv) {
         QVLOG_ERROR(logCategory(), "{}", message);
     };
     LinuxClock clock;
-    LinuxDeviceInformation device(options->deviceFile, options->internalBuild);
+    LinuxDeviceInformation device(options->deviceFile,
+                                  std::filesystem::path(options->stateDir) / "logs",
+                                  options->internalBuild);
     if (!device.loadError().empty()) {
         QVLOG_ERROR(logCategory(), "device file ignored: {}", device.loadError());
     }
@@ -93,7 +96,9 @@ int main(int argc, char** argv) {
         QVLOG_ERROR(logCategory(), "{}", analytics.error);
         return 1;
     }
-    const Platform platform{clock, device, process, preferences, notifications, *analytics.service};
+    LinuxSystemCondition condition;
+    const Platform platform{
+        clock, device, process, preferences, notifications, *analytics.service, condition};
 
     QVReportingWorkerRegistry::setAllWorkerClasses(QVReportingAllWorkerClasses());
     SerialQueue& queue = QVReportingUtilityGetReportingServerQueue();

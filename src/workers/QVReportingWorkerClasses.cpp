@@ -3,6 +3,8 @@
 #include "monitoring/QVReportingSessionSystemMonitorWorker.h"
 #include "workers/backends/QVReportingSessionMetricsHubWorker.h"
 #include "workers/derived/QVReportingSessionOrbitMessagesWorker.h"
+#include "workers/derived/QVReportingSessionSummaryJsonFileWorker.h"
+#include "workers/derived/QVReportingSessionSummaryWorker.h"
 
 namespace qv {
 
@@ -12,8 +14,10 @@ QVReportingWorkerRegistry::ClassList QVReportingAllWorkerClasses() {
     // IssueFiler. Only the classes that exist are listed.
     return {
         &makeWorkerClass<QVReportingSessionOrbitMessagesWorker>(),
+        &makeWorkerClass<QVReportingSessionSummaryWorker>(),
         &makeWorkerClass<QVReportingSessionMetricsHubWorker>(),
         &makeWorkerClass<QVReportingSessionSystemMonitorWorker>(),
+        &makeWorkerClass<QVReportingSessionSummaryJsonFileWorker>(),
     };
 }
 

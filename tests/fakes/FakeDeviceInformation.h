@@ -23,7 +23,10 @@ class FakeDeviceInformation : public DeviceInformation {
         return it != capabilities.end() && it->second;
     }
 
+    std::filesystem::path diagnosticLogsDirectory() const override { return logsDirectory; }
+
     std::optional<bool> internalBuild;
+    std::filesystem::path logsDirectory = "/nonexistent/logs";
     std::map<std::string, bool> capabilities;
     mutable int questions = 0;  // how often the device was asked
 };

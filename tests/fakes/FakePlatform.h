@@ -15,7 +15,8 @@ struct FakePlatform {
     FakePreferenceStore preferences;
     FakeNotificationCenter notifications;
     FakeAnalyticsService analytics;
-    Platform platform{clock, device, process, preferences, notifications, analytics};
+    FakeSystemCondition condition;
+    Platform platform{clock, device, process, preferences, notifications, analytics, condition};
 };
 
 }  // namespace qv::test

@@ -1,5 +1,6 @@
 // In-memory fakes of the platform services that carry data: processes, preferences, named
-// notifications and analytics events. Each records what it was asked, for the test to check.
+// notifications, analytics events and the device condition. Each records what it was asked, for the
+// test to check.
 #pragma once
 
 #include <map>
@@ -12,6 +13,7 @@
 #include "platform/NotificationCenter.h"
 #include "platform/PreferenceStore.h"
 #include "platform/ProcessInfo.h"
+#include "platform/SystemCondition.h"
 
 namespace qv::test {
 
@@ -171,6 +173,27 @@ class FakeAnalyticsService : public AnalyticsService {
 
   private:
     mutable std::mutex mutex_;
+};
+
+// A device condition set by the test; footprintError makes the memory query fail.
+class FakeSystemCondition : public SystemCondition {
+  public:
+    ThermalState thermalState() const override { return thermal; }
+    bool lowPowerModeEnabled() const override { return lowPower; }
+    std::optional<std::uint64_t> ownMemoryFootprint(std::string& error) const override {
+        if (!footprintError.empty()) {
+            error = footprintError;
+            return std::nullopt;
+        }
+        return footprintBytes;
+    }
+    std::array<double, 3> loadAverages() const override { return loads; }
+
+    ThermalState thermal = ThermalState::Nominal;
+    bool lowPower = false;
+    std::uint64_t footprintBytes = 0;
+    std::string footprintError;
+    std::array<double, 3> loads{0.0, 0.0, 0.0};
 };
 
 }  // namespace qv::test

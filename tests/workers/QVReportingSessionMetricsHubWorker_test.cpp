@@ -146,8 +146,8 @@ TEST_F(AMetricsHubWorker, ForwardsThePayloadExactlyAsTheSessionHoldsIt) {
 
 TEST_F(AMetricsHubWorker, GivesEachEventItsOwnCopyTakenWhenTheBackendAsks) {
     DeferringAnalytics analytics;
-    const Platform platform{fake.clock,       fake.device,        fake.process,
-                            fake.preferences, fake.notifications, analytics};
+    const Platform platform{fake.clock,         fake.device, fake.process,  fake.preferences,
+                            fake.notifications, analytics,   fake.condition};
     auto session = make(platform);
     session->setServiceType(service::kHaptics);
     auto sent = message({{"level", 3}}, category::kOutput, type::kSetup);

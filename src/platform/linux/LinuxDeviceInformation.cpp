@@ -9,7 +9,9 @@
 namespace qv {
 
 LinuxDeviceInformation::LinuxDeviceInformation(const std::string& path,
-                                               std::optional<bool> internalBuildOverride) {
+                                               std::filesystem::path logsDirectory,
+                                               std::optional<bool> internalBuildOverride)
+    : logsDirectory_(std::move(logsDirectory)) {
     std::ifstream in(path);
     if (in) {
         const auto doc = nlohmann::json::parse(in, nullptr, /*allow_exceptions=*/false);

@@ -1,0 +1,178 @@
+#include "workers/derived/QVReportingSessionSummaryJsonFileWorker.h"
+
+#include <fcntl.h>
+#include <time.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cmath>
+#include <cstring>
+#include <map>
+#include <system_error>
+
+#include <fmt/format.h>
+#include <nlohmann/json.hpp>
+
+#include "platform/Clock.h"
+#include "platform/DeviceInformation.h"
+#include "platform/SafeFileName.h"
+#include "session/QVReportingLog.h"
+#include "session/QVReportingSession.h"
+#include "session/QVReportingUtility.h"
+#include "session/QVReportingVocabulary.h"
+#include "values/ValueJson.h"
+
+namespace qv {
+
+namespace {
+
+const QVReportingLogCategory& logCategory() {
+    return QVReportingSessionCategory();
+}
+
+// The local time of wallSeconds as "yyyyMMdd-HHmmssZ", e.g. "20240131-142501+0100".
+std::string fileTimestamp(double wallSeconds) {
+    const auto seconds = std::isfinite(wallSeconds) ? static_cast<time_t>(wallSeconds) : 0;
+    tm local{};
+    localtime_r(&seconds, &local);
+    char text[32];
+    const std::size_t n = strftime(text, sizeof text, "%Y%m%d-%H%M%S%z", &local);
+    return std::string(text, n);
+}
+
+// Writes all of data; false with errno set when the file refuses.
+bool writeAll(int fd, std::string_view data) {
+    while (!data.empty()) {
+        const ssize_t n = ::write(fd, data.data(), data.size());
+        if (n < 0) {
+            if (errno == EINTR) {
+                continue;
+            }
+            return false;
+        }
+        data.remove_prefix(static_cast<std::size_t>(n));
+    }
+    return true;
+}
+
+}  // namespace
+
+std::filesystem::path QVReportingLogsDirectory(const Platform& platform) {
+    return platform.device.diagnosticLogsDirectory() / "Audio" / "Reporting";
+}
+
+std::shared_ptr<QVReportingSessionSummaryJsonFileWorker>
+QVReportingSessionSummaryJsonFileWorker::initWithSession(
+    const std::shared_ptr<QVReportingSession>& session) {
+    if (!session || (session->serviceType() != service::kTest &&
+                     !QVReportingUtilityIsInternalBuild(session->platform()))) {
+        return nullptr;
+    }
+    auto worker = std::make_shared<QVReportingSessionSummaryJsonFileWorker>();
+    worker->setSession(session);
+    worker->setStarted(true);
+    return worker;
+}
+
+QVReportingSessionSummaryJsonFileWorker::~QVReportingSessionSummaryJsonFileWorker() {
+    if (reportFileHandle_ >= 0) {
+        ::close(reportFileHandle_);
+    }
+}
+
+void QVReportingSessionSummaryJsonFileWorker::openFile() {
+    const auto owner = session();
+    if (!owner) {
+        return;
+    }
+    const std::filesystem::path directory = QVReportingLogsDirectory(owner->platform());
+    std::error_code ec;
+    std::filesystem::create_directories(directory, ec);
+    if (ec) {
+        QVLOG_ERROR(logCategory(), "can't create logging directory at {}: {}", directory.string(),
+                    ec.message());
+    }
+    // Whatever the client named its application, the name stays one file in this directory.
+    const std::string name = fmt::format(
+        "{}-{}-{}-{}.json", fileTimestamp(owner->platform().clock.now()), owner->reporterID(),
+        QVReportingSafeFileComponent(QVReportingUtilityRetrieveAppName(owner->configuration())),
+        QVReportingSafeFileComponent(owner->serviceName(), 64));
+    reportPath_ = (directory / name).string();
+    reportFileHandle_ =
+        ::open(reportPath_.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_NOFOLLOW | O_CLOEXEC, 0666);
+    if (reportFileHandle_ < 0) {
+        QVLOG_ERROR(logCategory(),
+                    "SummaryJsonFileWorker failed to open file. action=open file={} error=\"{}\"",
+                    reportPath_, std::strerror(errno));
+        setStarted(false);
+        return;
+    }
+    QVLOG_INFO(logCategory(), "SummaryJsonFileWorker opened file. action=open file={}",
+               reportPath_);
+    setStarted(true);
+    writeLine("[");
+}
+
+void QVReportingSessionSummaryJsonFileWorker::writeLine(std::string_view line) {
+    std::string text(line);
+    text += '\n';
+    if (!writeAll(reportFileHandle_, text)) {
+        QVLOG_ERROR(
+            logCategory(),
+            "SummaryJsonFileWorker failed to write line. action=writeline file={} error=\"{}\"",
+            reportPath_, std::strerror(errno));
+    }
+}
+
+void QVReportingSessionSummaryJsonFileWorker::closeFile() {
+    writeLine("]");
+    const int result = ::close(reportFileHandle_);
+    reportFileHandle_ = -1;
+    if (result != 0) {
+        QVLOG_ERROR(
+            logCategory(),
+            "SummaryJsonFileWorker failed to closed file. action=close file={} error=\"{}\"",
+            reportPath_, std::strerror(errno));
+    } else {
+        QVLOG_INFO(logCategory(), "SummaryJsonFileWorker closed file. action=close file={}",
+                   reportPath_);
+    }
+}
+
+void QVReportingSessionSummaryJsonFileWorker::stop() {
+    const auto owner = session();
+    if (!owner || owner->messages().empty()) {
+        return;
+    }
+    std::map<std::string, std::uint64_t> counters;
+    const auto& messages = owner->messages();
+    for (std::size_t i = 0; i < messages.size(); ++i) {
+        QVReportingSessionMessage& message = *messages[i];
+        if (message.isRedundant()) {
+            continue;
+        }
+        if (!reportPath_.empty()) {
+            writeLine(",");
+        } else {
+            openFile();
+        }
+        const std::string key =
+            fmt::format("{}_{}", QVReportingUtilityCategoryString(message.category()),
+                        QVReportingUtilityTypeString(message.type()));
+        const std::uint64_t n = ++counters[key];
+        message.message().set("isSessionStarted", message.isSessionStarted() ? "YES" : "NO");
+        nlohmann::ordered_json member;
+        member[fmt::format("{}_{}", key, n)] = QVReportingDictionaryToJson(message.message());
+        try {
+            writeLine(member.dump(2));
+        } catch (const nlohmann::json::exception& e) {
+            QVLOG_ERROR(logCategory(), "dataWithJSONObject: {}", e.what());
+        }
+    }
+    if (!reportPath_.empty()) {
+        closeFile();
+        reportPath_.clear();
+    }
+}
+
+}  // namespace qv
