@@ -1,10 +1,12 @@
 // qvreportd: the composition root. Builds the platform from its Linux implementations, hands the
 // worker table to the registry, starts the system monitor and the service, serves D-Bus, and on
 // SIGTERM or SIGINT stops every session (so workers flush) before leaving.
+#include <malloc.h>
 #include <signal.h>
 #include <sys/stat.h>
 
 #include <cerrno>
+#include <chrono>
 #include <cstring>
 #include <filesystem>
 #include <memory>
@@ -25,6 +27,7 @@
 #include "session/QVReportingLog.h"
 #include "session/QVReportingStats.h"
 #include "session/QVReportingWorkerRegistry.h"
+#include "session/RepeatingTimer.h"
 #include "session/SerialQueue.h"
 #include "workers/QVReportingWorkerClasses.h"
 
@@ -44,6 +47,17 @@ std::unique_ptr<sdbus::IConnection> connectTo(const std::string& bus) {
         return sdbus::createSessionBusConnection();
     }
     return sdbus::createSessionBusConnectionWithAddress(bus);
+}
+
+// Stopped sessions free their messages in bulk, but the allocator keeps freed pages inside its
+// arenas. Once this much lies free, it is handed back to the system, so that the daemon's
+// footprint follows its load instead of its busiest moment.
+constexpr std::size_t kFreeBytesWorthReturning = 16u << 20;
+
+void returnFreeMemory() {
+    if (mallinfo2().fordblks > kFreeBytesWorthReturning) {
+        malloc_trim(0);
+    }
 }
 
 }  // namespace
@@ -115,6 +129,8 @@ int main(int argc, char** argv) {
                     e.getMessage());
         return 1;
     }
+
+    RepeatingTimer memoryReturn(std::chrono::seconds(5), returnFreeMemory);
 
     int signal = 0;
     sigwait(&stopSignals, &signal);
