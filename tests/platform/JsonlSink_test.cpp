@@ -18,6 +18,7 @@
 #include <vector>
 
 #include "fakes/FakeClock.h"
+#include "fakes/TempDirectory.h"
 
 namespace qv {
 namespace {
@@ -27,16 +28,7 @@ using nlohmann::ordered_json;
 
 class AJsonlSink : public ::testing::Test {
   protected:
-    void SetUp() override {
-        std::string pattern = (fs::temp_directory_path() / "qvsink.XXXXXX").string();
-        ASSERT_NE(::mkdtemp(pattern.data()), nullptr);
-        root = pattern;
-        stateDir = root / "state";
-    }
-    void TearDown() override {
-        std::error_code ec;
-        fs::remove_all(root, ec);
-    }
+    void SetUp() override { stateDir = root / "state"; }
 
     SinkCallbacks recording() {
         return {[this](std::string_view sink) {
@@ -73,7 +65,8 @@ class AJsonlSink : public ::testing::Test {
         return keys;
     }
 
-    fs::path root;
+    test::TempDirectory tmp{"qvsink"};
+    const fs::path root = tmp.path();
     fs::path stateDir;
     test::FakeClock clock;
     std::mutex mutex;

@@ -13,6 +13,7 @@
 #include <vector>
 
 #include "fakes/FakeClock.h"
+#include "fakes/TempDirectory.h"
 
 namespace qv {
 namespace {
@@ -22,16 +23,6 @@ using nlohmann::ordered_json;
 
 class ALinuxAnalyticsService : public ::testing::Test {
   protected:
-    void SetUp() override {
-        std::string pattern = (fs::temp_directory_path() / "qvanalytics.XXXXXX").string();
-        ASSERT_NE(::mkdtemp(pattern.data()), nullptr);
-        root = pattern;
-    }
-    void TearDown() override {
-        std::error_code ec;
-        fs::remove_all(root, ec);
-    }
-
     // A service over root/state, with an events file holding listing when one is given.
     std::unique_ptr<LinuxAnalyticsService> make(const std::string* listing = nullptr) {
         std::string eventsFile;
@@ -53,7 +44,8 @@ class ALinuxAnalyticsService : public ::testing::Test {
         return lines;
     }
 
-    fs::path root;
+    test::TempDirectory tmp{"qvanalytics"};
+    const fs::path root = tmp.path();
     test::FakeClock clock;
     std::atomic<int> lost{0};
 };

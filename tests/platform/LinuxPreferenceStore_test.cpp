@@ -1,4 +1,5 @@
 #include "platform/linux/LinuxPreferenceStore.h"
+#include "fakes/TempDirectory.h"
 
 #include <fmt/format.h>
 #include <gtest/gtest.h>
@@ -21,16 +22,7 @@ namespace fs = std::filesystem;
 
 class ALinuxPreferenceStore : public ::testing::Test {
   protected:
-    void SetUp() override {
-        std::string pattern = (fs::temp_directory_path() / "qvprefs.XXXXXX").string();
-        ASSERT_NE(::mkdtemp(pattern.data()), nullptr);
-        root = pattern;
-        stateDir = root / "state";
-    }
-    void TearDown() override {
-        std::error_code ec;
-        fs::remove_all(root, ec);
-    }
+    void SetUp() override { stateDir = root / "state"; }
 
     LinuxPreferenceStore::ErrorCallback recordErrors() {
         return [this](const std::string& message) {
@@ -61,7 +53,8 @@ class ALinuxPreferenceStore : public ::testing::Test {
         return files;
     }
 
-    fs::path root;
+    test::TempDirectory tmp{"qvprefs"};
+    const fs::path root = tmp.path();
     fs::path stateDir;
     std::mutex errorsMutex;
     std::vector<std::string> errors;

@@ -8,15 +8,16 @@
 #include <filesystem>
 #include <fstream>
 
+#include "fakes/TempDirectory.h"
+
 namespace qv {
 namespace {
 
 namespace fs = std::filesystem;
 
 TEST(ALinuxProcessInfo, ReadsTheCommandNameWithoutItsLineFeed) {
-    std::string pattern = (fs::temp_directory_path() / "qvproc.XXXXXX").string();
-    ASSERT_NE(::mkdtemp(pattern.data()), nullptr);
-    const fs::path root = pattern;
+    const test::TempDirectory tmp{"qvproc"};
+    const fs::path& root = tmp.path();
     fs::create_directories(root / "42");
     std::ofstream(root / "42" / "comm") << "coreaudiod\n";
     fs::create_directories(root / "43");
@@ -28,7 +29,6 @@ TEST(ALinuxProcessInfo, ReadsTheCommandNameWithoutItsLineFeed) {
     EXPECT_FALSE(info.processName(44));
     EXPECT_FALSE(info.processName(0));
     EXPECT_FALSE(info.processName(-42));
-    fs::remove_all(root);
 }
 
 TEST(ALinuxProcessInfo, KnowsItsOwnProcessOnTheRealProcFileSystem) {
