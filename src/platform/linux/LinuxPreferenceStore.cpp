@@ -12,6 +12,7 @@
 #include <filesystem>
 #include <utility>
 
+#include "platform/PosixIO.h"
 #include "platform/SafeFileName.h"
 #include "values/ValueJson.h"
 
@@ -89,20 +90,6 @@ int nestingDepth(std::string_view text, int limit) {
         }
     }
     return deepest;
-}
-
-bool writeAll(int fd, std::string_view data) {
-    while (!data.empty()) {
-        const ssize_t n = ::write(fd, data.data(), data.size());
-        if (n < 0) {
-            if (errno == EINTR) {
-                continue;
-            }
-            return false;
-        }
-        data.remove_prefix(static_cast<std::size_t>(n));
-    }
-    return true;
 }
 
 // Reads the whole file; false with errno set when it cannot.

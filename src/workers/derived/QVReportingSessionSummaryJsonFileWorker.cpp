@@ -15,6 +15,7 @@
 
 #include "platform/Clock.h"
 #include "platform/DeviceInformation.h"
+#include "platform/PosixIO.h"
 #include "platform/SafeFileName.h"
 #include "session/QVReportingLog.h"
 #include "session/QVReportingSession.h"
@@ -38,21 +39,6 @@ std::string fileTimestamp(double wallSeconds) {
     char text[32];
     const std::size_t n = strftime(text, sizeof text, "%Y%m%d-%H%M%S%z", &local);
     return std::string(text, n);
-}
-
-// Writes all of data; false with errno set when the file refuses.
-bool writeAll(int fd, std::string_view data) {
-    while (!data.empty()) {
-        const ssize_t n = ::write(fd, data.data(), data.size());
-        if (n < 0) {
-            if (errno == EINTR) {
-                continue;
-            }
-            return false;
-        }
-        data.remove_prefix(static_cast<std::size_t>(n));
-    }
-    return true;
 }
 
 }  // namespace

@@ -1,0 +1,23 @@
+#include "platform/PosixIO.h"
+
+#include <unistd.h>
+
+#include <cerrno>
+
+namespace qv {
+
+bool writeAll(int fd, std::string_view data) {
+    while (!data.empty()) {
+        const ssize_t n = ::write(fd, data.data(), data.size());
+        if (n < 0) {
+            if (errno == EINTR) {
+                continue;
+            }
+            return false;
+        }
+        data.remove_prefix(static_cast<std::size_t>(n));
+    }
+    return true;
+}
+
+}  // namespace qv
