@@ -18,14 +18,7 @@
 #include <string>
 #include <vector>
 
-#include "platform/linux/LinuxAnalyticsService.h"
-#include "platform/linux/LinuxClock.h"
-#include "platform/linux/LinuxDeviceInformation.h"
-#include "platform/linux/LinuxNotificationCenter.h"
-#include "platform/linux/LinuxPreferenceStore.h"
-#include "platform/linux/LinuxProcessInfo.h"
-#include "platform/linux/LinuxSystemCondition.h"
-#include "session/QVReportingLog.h"
+#include "BenchPlatform.h"
 #include "session/QVReportingSession.h"
 #include "session/QVReportingWorkerRegistry.h"
 #include "values/ValueJson.h"
@@ -36,27 +29,11 @@ using namespace qv;
 
 constexpr std::int64_t kMessagesPerRun = 200000;
 
-// The real Linux platform on a temporary state directory; a session with no workers touches only
-// its clock.
-struct Env {
-    Env() {
-        setLogLevel(LogLevel::Error);
+// A session with no workers touches only its clock.
+struct Env : bench::BenchPlatform {
+    Env() : BenchPlatform("qv-session-bench") {
         QVReportingWorkerRegistry::setAllWorkerClasses({});  // a session with no workers
     }
-    ~Env() { std::filesystem::remove_all(stateDir); }
-    std::string stateDir = (std::filesystem::temp_directory_path() /
-                            ("qv-session-bench-" + std::to_string(::getpid())))
-                               .string();
-    LinuxClock clock;
-    LinuxDeviceInformation device{"/nonexistent", std::filesystem::temp_directory_path()};
-    LinuxProcessInfo process;
-    LinuxPreferenceStore preferences{stateDir};
-    LinuxNotificationCenter notifications;
-    LinuxAnalyticsService::Created analytics =
-        LinuxAnalyticsService::create(stateDir, clock, "", SinkCallbacks{});
-    LinuxSystemCondition condition;
-    Platform platform{clock,    device, process, preferences, notifications, *analytics.service,
-                      condition};
 };
 
 Env& env() {
