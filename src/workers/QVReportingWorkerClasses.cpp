@@ -3,6 +3,7 @@
 #include "monitoring/QVReportingSessionSystemMonitorWorker.h"
 #include "workers/backends/QVReportingSessionMetricsHubWorker.h"
 #include "workers/derived/QVReportingSessionOrbitMessagesWorker.h"
+#include "workers/derived/QVReportingSessionVolumeMessagesWorker.h"
 
 namespace qv {
 
@@ -11,6 +12,7 @@ QVReportingWorkerRegistry::ClassList QVReportingAllWorkerClasses() {
     // driver snapshot, system monitor, ICX, Pulsar, summary JSON file, audio registration, Convo,
     // IssueFiler. Only the classes that exist are listed.
     return {
+        &makeWorkerClass<QVReportingSessionVolumeMessagesWorker>(),
         &makeWorkerClass<QVReportingSessionOrbitMessagesWorker>(),
         &makeWorkerClass<QVReportingSessionMetricsHubWorker>(),
         &makeWorkerClass<QVReportingSessionSystemMonitorWorker>(),
