@@ -2,6 +2,7 @@
 
 #include "monitoring/QVReportingSessionSystemMonitorWorker.h"
 #include "workers/backends/QVReportingSessionMetricsHubWorker.h"
+#include "workers/derived/QVReportingSessionInputMessagesWorker.h"
 #include "workers/derived/QVReportingSessionOrbitMessagesWorker.h"
 #include "workers/derived/QVReportingSessionVolumeMessagesWorker.h"
 
@@ -14,6 +15,7 @@ QVReportingWorkerRegistry::ClassList QVReportingAllWorkerClasses() {
     return {
         &makeWorkerClass<QVReportingSessionVolumeMessagesWorker>(),
         &makeWorkerClass<QVReportingSessionOrbitMessagesWorker>(),
+        &makeWorkerClass<QVReportingSessionInputMessagesWorker>(),
         &makeWorkerClass<QVReportingSessionMetricsHubWorker>(),
         &makeWorkerClass<QVReportingSessionSystemMonitorWorker>(),
     };

@@ -249,7 +249,8 @@ TEST_F(Workers, TheDaemonTableListsOnlyBuiltClassesInTheirFixedOrder) {
     // The derived-message producers: made at start, never for single-message sessions, and
     // without a start of their own.
     for (const std::string_view name :
-         {"QVReportingSessionVolumeMessagesWorker", "QVReportingSessionOrbitMessagesWorker"}) {
+         {"QVReportingSessionVolumeMessagesWorker", "QVReportingSessionOrbitMessagesWorker",
+          "QVReportingSessionInputMessagesWorker"}) {
         auto it = std::find_if(classes.begin(), classes.end(),
                                [&](const auto* cls) { return cls->name == name; });
         ASSERT_NE(it, classes.end()) << name;
