@@ -2,9 +2,11 @@
 
 #include "monitoring/QVReportingSessionSystemMonitorWorker.h"
 #include "workers/backends/QVReportingSessionMetricsHubWorker.h"
+#include "workers/derived/QVReportingSessionInputMessagesWorker.h"
 #include "workers/derived/QVReportingSessionOrbitMessagesWorker.h"
 #include "workers/derived/QVReportingSessionSummaryJsonFileWorker.h"
 #include "workers/derived/QVReportingSessionSummaryWorker.h"
+#include "workers/derived/QVReportingSessionVolumeMessagesWorker.h"
 
 namespace qv {
 
@@ -13,8 +15,10 @@ QVReportingWorkerRegistry::ClassList QVReportingAllWorkerClasses() {
     // driver snapshot, system monitor, ICX, Pulsar, summary JSON file, audio registration, Convo,
     // IssueFiler. Only the classes that exist are listed.
     return {
+        &makeWorkerClass<QVReportingSessionVolumeMessagesWorker>(),
         &makeWorkerClass<QVReportingSessionOrbitMessagesWorker>(),
         &makeWorkerClass<QVReportingSessionSummaryWorker>(),
+        &makeWorkerClass<QVReportingSessionInputMessagesWorker>(),
         &makeWorkerClass<QVReportingSessionMetricsHubWorker>(),
         &makeWorkerClass<QVReportingSessionSystemMonitorWorker>(),
         &makeWorkerClass<QVReportingSessionSummaryJsonFileWorker>(),

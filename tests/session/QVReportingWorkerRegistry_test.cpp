@@ -246,10 +246,20 @@ TEST_F(Workers, TheDaemonTableListsOnlyBuiltClassesInTheirFixedOrder) {
         last = place;
         EXPECT_NE(cls->initWithSession, nullptr);
     }
-    const auto& orbit = *classes[0];
-    EXPECT_EQ(orbit.name, "QVReportingSessionOrbitMessagesWorker");
-    EXPECT_TRUE(orbit.isProducer);
-    EXPECT_FALSE(orbit.isConsumer || orbit.startOnInit || orbit.handleSingleMessageSession);
+    // The derived-message producers: made at start, never for single-message sessions, and
+    // without a start of their own.
+    for (const std::string_view name :
+         {"QVReportingSessionVolumeMessagesWorker", "QVReportingSessionOrbitMessagesWorker",
+          "QVReportingSessionInputMessagesWorker"}) {
+        auto it = std::find_if(classes.begin(), classes.end(),
+                               [&](const auto* cls) { return cls->name == name; });
+        ASSERT_NE(it, classes.end()) << name;
+        const auto& producer = **it;
+        EXPECT_TRUE(producer.isProducer) << name;
+        EXPECT_FALSE(producer.isConsumer || producer.startOnInit ||
+                     producer.handleSingleMessageSession || producer.implementsStart)
+            << name;
+    }
 }
 
 }  // namespace
