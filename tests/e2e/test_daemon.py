@@ -1,5 +1,6 @@
 """qvreportd driven over a private bus by an independent client (python3-dbus)."""
 
+import json
 import os
 import signal
 import subprocess
@@ -13,7 +14,7 @@ sys.path.insert(0, os.path.dirname(__file__))
 from harness import (BUS_NAME, Bus, Client, Daemon, DaemonTestCase, OBJECT_PATH, INTERFACE,
                      wait_until)  # noqa: E402
 
-PLAYBACK, START = 4, 1
+PLAYBACK, RECORD, INPUT, START, STOP, STATE = 4, 2, 3, 1, 2, 18
 GENERIC_CATEGORY, GENERIC_TYPE = 1, 0
 
 
@@ -175,6 +176,61 @@ class Notifications(DaemonTestCase):
                            what="the ringer state in the session")
         self.assertIs(setup[0]["payload"]["ringerstate"], True)
         self.assertIn("last_updated", setup[0]["payload"])
+
+
+class DerivedMessages(DaemonTestCase):
+    def test_a_test_session_derives_volume_input_and_summary_and_writes_its_file(self):
+        c = self.client()
+        c.create(31, service_type=11, config={"KXHostApplicationDisplayID": "../e2e\napp"})
+        c.start(31)
+        now = time.time()
+        playing = {"qvreporting_timestamp": now - 30, "session_output_running": True,
+                   "KXSessionVolume": 0.5, "active_devices": "Speaker", "mFormatID": "lpcm",
+                   "nested": dbus.Dictionary({"rate": 48000, "list": dbus.Array(
+                       [dbus.Int64(1), "two", 3.5], signature="v")}, signature="sv")}
+        c.send(playing, PLAYBACK, START, [31])
+        c.send({"qvreporting_timestamp": now - 18, "session_output_running": False}, PLAYBACK,
+               STOP, [31])
+        c.send({"qvreporting_timestamp": now - 20, "session_input_running": True,
+                "vp_config_primary_vocoder": "opus", "vp_config_primary_vocoderFs": "16000"},
+               RECORD, START, [31])
+        c.send({"qvreporting_timestamp": now - 17, "vp_config_primary_vocoder": "aac",
+                "vp_config_primary_vocoderFs": "24000"}, INPUT, STATE, [31])
+        c.send({"qvreporting_timestamp": now - 15, "session_input_running": False}, RECORD, STOP,
+               [31])
+        self.assertTrue(c.stop(31))
+
+        summary = wait_until(lambda: self.daemon.events("com.korvane.test.Session_Generic.Summary"),
+                             what="the summary in the analytics sink")
+        volume = self.daemon.events("com.korvane.qvsound.Volume.Summary")
+        self.assertEqual(len(volume), 1)
+        self.assertAlmostEqual(volume[0]["payload"]["play_seconds"], 12.0, places=3)
+        self.assertEqual(volume[0]["payload"]["play_secondsBucketed"], "10")
+        self.assertEqual(volume[0]["payload"]["KXSessionVolumeBucketed"], "0.5")
+        inputs = self.daemon.events("com.korvane.qvsound.Input.Summary")
+        self.assertEqual(len(inputs), 1)
+        self.assertEqual(inputs[0]["payload"]["inputrunning_secondsBucketed"], "5")
+        self.assertEqual(inputs[0]["payload"]["vocoders"], "aac:24000,opus:16000")
+        self.assertEqual(len(summary), 1)
+        # The five sent, and the volume message, derived and received before the summary.
+        self.assertEqual(summary[0]["payload"]["num_messages"], 6)
+        self.assertEqual(summary[0]["payload"]["summaryServiceName"], "test")
+
+        # One file, inside the directory whatever the application's name, that python reads back.
+        directory = os.path.join(self.daemon.state_dir, "logs", "Audio", "Reporting")
+        files = os.listdir(directory)
+        self.assertEqual(len(files), 1)
+        self.assertTrue(files[0].endswith("-31-%2E.%2Fe2e%0Aapp-test.json"), files[0])
+        with open(os.path.join(directory, files[0])) as f:
+            members = json.load(f)
+        by_name = {name: payload for member in members for name, payload in member.items()}
+        self.assertIn("Volume_Summary_1", by_name)
+        self.assertIn("Input_Summary_1", by_name)
+        self.assertIn("Session_Generic_Summary_1", by_name)
+        start = by_name["Playback_Start_1"]
+        for key, value in playing.items():
+            self.assertEqual(start[key], value, key)
+        self.assertEqual(start["isSessionStarted"], "YES")
 
 
 class Shutdown(DaemonTestCase):
