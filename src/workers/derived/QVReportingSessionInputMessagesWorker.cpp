@@ -8,13 +8,12 @@
 #include "session/QVReportingSession.h"
 #include "session/QVReportingSessionWorkerUtility.h"
 #include "session/QVReportingUtility.h"
+#include "workers/derived/QVReportingDerivedMessages.h"
 #include "workers/derived/QVReportingMessageKeys.h"
 
 namespace qv {
 
 namespace {
-
-using Worker = QVReportingSessionVolumeMessagesWorker;
 
 constexpr std::string_view kFunction = "createInputMessages";
 // Shorter than for playback: recording settings that belong together arrive closer together.
@@ -78,19 +77,11 @@ void QVReportingSessionInputMessagesWorker::stop() {
     if (!owner || owner->messages().empty()) {
         return;
     }
-    const std::string process = QVReportingUtilityRetrieveAppName(owner->configuration());
-    const MessageList results =
-        createInputMessages(owner->messages(), process,
-                            QVReportingUtilityVolumeMinimumPlayingTime(owner->serviceType()));
-    if (results.empty()) {
-        return;
-    }
-    QVLOG_DEFAULT(QVReportingSessionCategory(), "sending input summary event for reporter {}",
-                  owner->reporterID());
-    // Sending stores each message in the session's list: the results are a list of their own.
-    for (const auto& message : results) {
-        owner->sendMessage(message);
-    }
+    QVReportingSendDerivedMessages(
+        *owner, "input summary event",
+        createInputMessages(owner->messages(),
+                            QVReportingUtilityRetrieveAppName(owner->configuration()),
+                            QVReportingUtilityVolumeMinimumPlayingTime(owner->serviceType())));
 }
 
 QVReportingSessionInputMessagesWorker::MessageList
@@ -155,10 +146,10 @@ QVReportingSessionInputMessagesWorker::createInputMessages(const MessageList& me
                       hasDuration;
             if (QVReportingUtilityKeyIsPresentAndHasChanged(
                     QVReportingMessageKeyVpConfigPrimaryVocoder, &payload, &state)) {
-                const std::string rate =
-                    Worker::textValue(payload.find(QVReportingMessageKeyVpConfigPrimaryVocoderFs));
+                const std::string rate = QVReportingDerivedTextValue(
+                    payload.find(QVReportingMessageKeyVpConfigPrimaryVocoderFs));
                 if (!rate.starts_with(kIdleRatePrefix)) {
-                    codecs.insert(Worker::textValue(
+                    codecs.insert(QVReportingDerivedTextValue(
                                       payload.find(QVReportingMessageKeyVpConfigPrimaryVocoder)) +
                                   ":" + rate);
                 }
@@ -167,15 +158,17 @@ QVReportingSessionInputMessagesWorker::createInputMessages(const MessageList& me
         }
 
         if (wasRunning && changed) {
-            const std::optional<double> end = Worker::timeValue(ts);
-            const std::optional<double> begin = Worker::timeValue(start ? &*start : nullptr);
+            const std::optional<double> end = QVReportingDerivedTimeValue(ts);
+            const std::optional<double> begin =
+                QVReportingDerivedTimeValue(start ? &*start : nullptr);
             const double runningTime = end.value_or(0.0) - begin.value_or(0.0);
             QVLOG_DEBUG(log,
                         "runningTime {{ func={}, runningTime={:f}, qvTimestamp={}, "
                         "qvTimestamp_double={:f}, startQvTimestamp={}, "
                         "startQvTimestamp_double={:f} }}",
-                        kFunction, runningTime, Worker::textValue(ts), end.value_or(0.0),
-                        Worker::textValue(start ? &*start : nullptr), begin.value_or(0.0));
+                        kFunction, runningTime, QVReportingDerivedTextValue(ts), end.value_or(0.0),
+                        QVReportingDerivedTextValue(start ? &*start : nullptr),
+                        begin.value_or(0.0));
             if (end && begin && process && runningTime > minimumRunningtime) {
                 results.push_back(makeInputMessage(state, *process, runningTime, index, codecs));
                 ++index;

@@ -8,6 +8,7 @@
 #include "session/QVReportingSession.h"
 #include "session/QVReportingSessionWorkerUtility.h"
 #include "session/QVReportingUtility.h"
+#include "workers/derived/QVReportingDerivedMessages.h"
 #include "workers/derived/QVReportingMessageKeys.h"
 
 namespace qv {
@@ -51,8 +52,7 @@ bool watchedKeysChanged(const Dictionary& payload, const Dictionary& state) {
         const Value* now = payload.find(key);
         const Value* before = state.find(key);
         if (now && before &&
-            QVReportingSessionVolumeMessagesWorker::textValue(now) !=
-                QVReportingSessionVolumeMessagesWorker::textValue(before)) {
+            QVReportingDerivedTextValue(now) != QVReportingDerivedTextValue(before)) {
             return true;
         }
     }
@@ -109,32 +109,6 @@ std::shared_ptr<QVReportingSessionMessage> makeVolumeMessage(const Dictionary& s
 
 }  // namespace
 
-std::optional<double> QVReportingSessionVolumeMessagesWorker::timeValue(const Value* value) {
-    if (value == nullptr) {
-        return std::nullopt;
-    }
-    switch (value->kind()) {
-        case Value::Kind::Int:
-        case Value::Kind::UInt:
-        case Value::Kind::Double: {
-            const double t = value->doubleValue();
-            return std::isnan(t) ? std::nullopt : std::optional<double>(t);
-        }
-        default:
-            return std::nullopt;
-    }
-}
-
-std::string QVReportingSessionVolumeMessagesWorker::textValue(const Value* value) {
-    if (value == nullptr) {
-        return "(null)";
-    }
-    if (const std::string* s = value->asString()) {
-        return *s;
-    }
-    return value->description();
-}
-
 std::shared_ptr<QVReportingSessionVolumeMessagesWorker>
 QVReportingSessionVolumeMessagesWorker::initWithSession(
     const std::shared_ptr<QVReportingSession>& session) {
@@ -148,19 +122,11 @@ void QVReportingSessionVolumeMessagesWorker::stop() {
     if (!owner || owner->messages().empty()) {
         return;
     }
-    const std::string process = QVReportingUtilityRetrieveAppName(owner->configuration());
-    const MessageList results =
-        createVolumeMessages(owner->messages(), process,
-                             QVReportingUtilityVolumeMinimumPlayingTime(owner->serviceType()));
-    if (results.empty()) {
-        return;
-    }
-    QVLOG_DEFAULT(QVReportingSessionCategory(), "sending volume event for reporter {}",
-                  owner->reporterID());
-    // Sending stores each message in the session's list: the results are a list of their own.
-    for (const auto& message : results) {
-        owner->sendMessage(message);
-    }
+    QVReportingSendDerivedMessages(
+        *owner, "volume event",
+        createVolumeMessages(owner->messages(),
+                             QVReportingUtilityRetrieveAppName(owner->configuration()),
+                             QVReportingUtilityVolumeMinimumPlayingTime(owner->serviceType())));
 }
 
 QVReportingSessionVolumeMessagesWorker::MessageList
@@ -233,15 +199,17 @@ QVReportingSessionVolumeMessagesWorker::createVolumeMessages(
         }
 
         if (wasRunning && changed) {
-            const std::optional<double> end = timeValue(ts);
-            const std::optional<double> begin = timeValue(start ? &*start : nullptr);
+            const std::optional<double> end = QVReportingDerivedTimeValue(ts);
+            const std::optional<double> begin =
+                QVReportingDerivedTimeValue(start ? &*start : nullptr);
             const double playingTime = end.value_or(0.0) - begin.value_or(0.0);
             QVLOG_DEBUG(log,
                         "playingTime {{ func={}, playingTime={:f}, qvTimestamp={}, "
                         "qvTimestamp_double={:f}, startQvTimestamp={}, "
                         "startQvTimestamp_double={:f} }}",
-                        kFunction, playingTime, textValue(ts), end.value_or(0.0),
-                        textValue(start ? &*start : nullptr), begin.value_or(0.0));
+                        kFunction, playingTime, QVReportingDerivedTextValue(ts), end.value_or(0.0),
+                        QVReportingDerivedTextValue(start ? &*start : nullptr),
+                        begin.value_or(0.0));
             if (end && begin && playingTime > minimumPlaytime && process &&
                 state.contains(QVReportingMessageKeyVolume)) {
                 results.push_back(makeVolumeMessage(state, *process, playingTime, index));

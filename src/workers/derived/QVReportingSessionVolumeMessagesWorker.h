@@ -49,14 +49,6 @@ class QVReportingSessionVolumeMessagesWorker final
     MessageList createVolumeMessages(const MessageList& messages,
                                      std::optional<std::string_view> process,
                                      double minimumPlaytime) const;
-
-    // How both derived-message workers read payload values.
-    //
-    // The time a value holds, by the session's own rule: an integer or a double that is not NaN.
-    // Anything else (a string, a boolean, no value) is no time at all.
-    static std::optional<double> timeValue(const Value* value);
-    // A value as text: a string as it is, any other kind by its printed form, "(null)" when absent.
-    static std::string textValue(const Value* value);
 };
 
 }  // namespace qv
