@@ -1,7 +1,6 @@
 // Device information set by the test.
 #pragma once
 
-#include <map>
 #include <optional>
 #include <string>
 
@@ -18,16 +17,12 @@ class FakeDeviceInformation : public DeviceInformation {
         }
         return std::nullopt;
     }
-    bool hasCapability(std::string_view capability) const override {
-        auto it = capabilities.find(std::string(capability));
-        return it != capabilities.end() && it->second;
-    }
+    bool hasCapability(std::string_view) const override { return false; }
 
     std::filesystem::path diagnosticLogsDirectory() const override { return logsDirectory; }
 
     std::optional<bool> internalBuild;
     std::filesystem::path logsDirectory = "/nonexistent/logs";
-    std::map<std::string, bool> capabilities;
     mutable int questions = 0;  // how often the device was asked
 };
 

@@ -50,20 +50,14 @@ class FakePreferenceStore : public PreferenceStore {
     }
     bool setValue(std::string_view suite, std::string_view key, const Value& value) override {
         std::lock_guard lock(mutex_);
-        if (failWrites)
-            return false;
         suites_[std::string(suite)].set(key, value);
         return true;
     }
     bool removeValue(std::string_view suite, std::string_view key) override {
         std::lock_guard lock(mutex_);
-        if (failWrites)
-            return false;
         suites_[std::string(suite)].erase(key);
         return true;
     }
-
-    bool failWrites = false;
 
   private:
     mutable std::mutex mutex_;
@@ -106,7 +100,6 @@ class FakeNotificationCenter : public NotificationCenter {
         {
             std::lock_guard lock(mutex_);
             states_[std::string(name)] = state;
-            posts.emplace_back(std::string(name), state);
             for (const auto& [token, r] : registrations_) {
                 if (r.name == name)
                     targets.emplace_back(token, r);
@@ -119,7 +112,6 @@ class FakeNotificationCenter : public NotificationCenter {
 
     bool failRegistrations = false;
     std::vector<Token> cancelled;
-    std::vector<std::pair<std::string, std::uint64_t>> posts;
 
   private:
     struct Registration {

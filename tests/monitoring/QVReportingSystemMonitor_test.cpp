@@ -141,7 +141,6 @@ TEST_F(ASystemMonitor, ReadsItsFeaturesAtStartAndRegistersForEachNotificationInO
 
     EXPECT_TRUE(log->contains("populateInitialValues {"));
     EXPECT_TRUE(log->contains("listening for features {"));
-    EXPECT_TRUE(log->contains("getting feature spatial-audio-accessory-feature"));
     EXPECT_EQ(log->count("notify setup result 0 token "), 3u);
     EXPECT_TRUE(log->contains("notify setup result 0 token 3"));
 
@@ -220,54 +219,36 @@ TEST_F(ASystemMonitor, CancelsItsRegistrationsWhenReset) {
     EXPECT_FALSE(dictionary->valueForKey(kRinger));
 }
 
-TEST_F(ASystemMonitor, HasAWorkerClassThatProducesAndStartsOnlyWithTheSession) {
+TEST_F(ASystemMonitor, GivesAStartedSessionOneUnstampedSetupMessagePerStateInDeclaredOrder) {
     const QVReportingWorkerClass& cls = makeWorkerClass<QVReportingSessionSystemMonitorWorker>();
-    EXPECT_EQ(cls.name, "QVReportingSessionSystemMonitorWorker");
-    EXPECT_TRUE(cls.isProducer);
-    EXPECT_FALSE(cls.isConsumer);
-    EXPECT_FALSE(cls.startOnInit);
-    EXPECT_FALSE(cls.handleSingleMessageSession);
-    EXPECT_TRUE(cls.implementsStart);
-
+    EXPECT_FALSE(cls.startOnInit || cls.handleSingleMessageSession);
     // Without a monitor in the process the worker does not apply.
     startSession();
     queue.sync([this] {
         EXPECT_TRUE(session->messageWorkers().empty());
         EXPECT_FALSE(QVReportingSessionSystemMonitorWorker::initWithSession(session));
+        session.reset();
     });
-}
 
-TEST_F(ASystemMonitor, GivesAStartedSessionOneSetupMessagePerFeatureWithAState) {
-    fake.preferences.setValue("com.korvane.deskhost", kSpatial, Value(true));
-    const double readTime = fake.clock.now();
-    initialize();
-    fake.clock.advance(30);
-    startSession();
-
-    // No device name is set and the ringer was never posted: only the spatial-audio state.
-    const auto payloads = setupPayloads();
-    ASSERT_EQ(payloads.size(), 1u);
-    const Dictionary& p = payloads[0];
-    EXPECT_EQ(*p.find(kSpatial), Value(true));
-    EXPECT_EQ(*p.find("last_updated"), Value(readTime));
-    EXPECT_FALSE(p.contains("systemuptime_sec"));
-    // The session stamps what arrives without a time: proof that the worker sent none.
-    EXPECT_EQ(*p.find("invalid_timestamp"), Value("nil"));
-    EXPECT_EQ(*p.find("qvreporting_timestamp"), Value(readTime + 30));
-    EXPECT_EQ(*p.find("audiotag"), Value("SetupSetup"));
-}
-
-TEST_F(ASystemMonitor, SendsFeaturesInTheirDeclaredOrderAtStart) {
     fake.preferences.setValue("com.korvane.qvsound", "device_name", Value("Den"));
     fake.preferences.setValue("com.korvane.deskhost", kSpatial, Value(0));
+    const double readTime = fake.clock.now();
     initialize();
     post("com.korvane.deskhost.ringerstate", 1);
+    fake.clock.advance(30);
     startSession();
     const auto payloads = setupPayloads();
     ASSERT_EQ(payloads.size(), 3u);
     EXPECT_EQ(*payloads[0].find(kSpatial), Value(0));
     EXPECT_EQ(*payloads[1].find(kDeviceName), Value("Den"));
     EXPECT_EQ(*payloads[2].find(kRinger), Value(true));
+    const Dictionary& p = payloads[0];
+    EXPECT_EQ(*p.find("last_updated"), Value(readTime));
+    EXPECT_FALSE(p.contains("systemuptime_sec"));
+    // The session stamps what arrives without a time: proof that the worker sent none.
+    EXPECT_EQ(*p.find("invalid_timestamp"), Value("nil"));
+    EXPECT_EQ(*p.find("qvreporting_timestamp"), Value(readTime + 30));
+    EXPECT_EQ(*p.find("audiotag"), Value("SetupSetup"));
 }
 
 TEST_F(ASystemMonitor, ForwardsChangesToARunningSessionAndNoneAfterItsWorkerStops) {

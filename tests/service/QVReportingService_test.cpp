@@ -176,7 +176,7 @@ TEST_F(AService, HoldsTheStartReplyUntilTheSessionStops) {
     EXPECT_TRUE(unknown.replied && zero.replied);
 }
 
-TEST_F(AService, AnswersATestSessionsStartAtOnceOnInternalBuildsAndOnlyOnce) {
+TEST_F(AService, OnInternalBuildsAnswersATestSessionsStartAtOnceAndMarksSingleMessages) {
     fake.device.internalBuild = true;
     makeService();
     auto a = connect(100);
@@ -189,6 +189,10 @@ TEST_F(AService, AnswersATestSessionsStartAtOnceOnInternalBuildsAndOnlyOnce) {
     a->stopReportingSessionForID(8, into(stop));
     drain();
     EXPECT_EQ(start.count, 1);
+
+    send(*a, {{"k", 1}});
+    ASSERT_TRUE(service->singleMessageSession());
+    EXPECT_TRUE(holds(*service->singleMessageSession(), "sendSingleMessage"));
 }
 
 TEST_F(AService, ReplacesTheSessionOnANewServiceTypeKeepingConfigurationAndPreviousValues) {
@@ -292,15 +296,6 @@ TEST_F(AService, RefusesMessagesWhileReportingIsDisabled) {
     EXPECT_EQ(lastSendError->name, "com.korvane.audio.reporting.ReportingDisabled");
     EXPECT_NE(lastSendError->message.find("code 1"), std::string::npos);
     EXPECT_EQ(service->findReportingSessionForID(1234), nullptr);
-}
-
-TEST_F(AService, MarksSingleMessagesOnInternalBuilds) {
-    fake.device.internalBuild = true;
-    makeService();
-    auto a = connect(100);
-    send(*a, {{"k", 1}});
-    ASSERT_TRUE(service->singleMessageSession());
-    EXPECT_TRUE(holds(*service->singleMessageSession(), "sendSingleMessage"));
 }
 
 TEST_F(AService, EnforcesItsClientAndSessionLimitsAndCountsThem) {

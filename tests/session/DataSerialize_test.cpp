@@ -5,6 +5,7 @@
 
 #include <cmath>
 #include <cstdint>
+#include <cstring>
 #include <limits>
 #include <memory>
 #include <string>
@@ -15,39 +16,38 @@
 namespace qv {
 namespace {
 
+// A node read by the library, as a Value (integers come back signed).
 Value fromPlist(plist_t node) {
+    // The library hands out malloc'd strings and buffers.
+    const auto take = [](char* p, std::size_t n) {
+        std::string out(p, n);
+        free(p);
+        return out;
+    };
+    char* p = nullptr;
     switch (plist_get_node_type(node)) {
         case PLIST_DICT: {
             Dictionary d;
             plist_dict_iter it = nullptr;
             plist_dict_new_iter(node, &it);
-            for (;;) {
-                char* key = nullptr;
-                plist_t item = nullptr;
-                plist_dict_next_item(node, it, &key, &item);
-                if (!key) {
-                    break;
-                }
+            plist_t item = nullptr;
+            for (plist_dict_next_item(node, it, &p, &item); p;
+                 plist_dict_next_item(node, it, &p, &item)) {
+                const std::string key = take(p, strlen(p));
                 d.set(key, fromPlist(item));
-                free(key);
             }
             free(it);
             return Value(std::move(d));
         }
         case PLIST_ARRAY: {
             Array a;
-            for (std::uint32_t i = 0; i < plist_array_get_size(node); ++i) {
+            for (std::uint32_t i = 0; i < plist_array_get_size(node); ++i)
                 a.push_back(fromPlist(plist_array_get_item(node, i)));
-            }
             return Value(std::move(a));
         }
-        case PLIST_STRING: {
-            char* s = nullptr;
-            plist_get_string_val(node, &s);
-            Value v{std::string(s)};
-            free(s);
-            return v;
-        }
+        case PLIST_STRING:
+            plist_get_string_val(node, &p);
+            return Value(take(p, strlen(p)));
         case PLIST_BOOLEAN: {
             std::uint8_t b = 0;
             plist_get_bool_val(node, &b);
@@ -64,16 +64,13 @@ Value fromPlist(plist_t node) {
             return Value(d);
         }
         case PLIST_DATA: {
-            char* data = nullptr;
-            std::uint64_t length = 0;
-            plist_get_data_val(node, &data, &length);
-            Value v(Bytes(data, data + length));
-            free(data);
-            return v;
+            std::uint64_t n = 0;
+            plist_get_data_val(node, &p, &n);
+            const std::string data = take(p, n);
+            return Value(Bytes(data.begin(), data.end()));
         }
         case PLIST_DATE: {
-            std::int32_t sec = 0;
-            std::int32_t usec = 0;
+            std::int32_t sec = 0, usec = 0;
             plist_get_date_val(node, &sec, &usec);
             return Value(Date{978307200.0 + sec + usec / 1e6});
         }
@@ -82,7 +79,7 @@ Value fromPlist(plist_t node) {
     }
 }
 
-// The XML read back by the library, as a Value again (integers come back signed).
+// The XML read back by the library, as a Value again.
 std::optional<Value> readBack(const Bytes& xml) {
     plist_t root = nullptr;
     plist_from_xml(reinterpret_cast<const char*>(xml.data()),

@@ -17,9 +17,6 @@ TEST(AMessage, OwnsItsTopLevelKeysButSharesNestedContainers) {
     EXPECT_EQ(*m.message().find("a"), Value(1));
     EXPECT_FALSE(m.message().contains("b"));
     EXPECT_EQ(m.message().find("nested")->asDictionary(), payload.find("nested")->asDictionary());
-    EXPECT_FALSE(m.isRedundant());
-    EXPECT_FALSE(m.isSessionStarted());
-    EXPECT_TRUE(m.destinationWorkers().empty());
 }
 
 TEST(AMessage, CopiesFlagsAndPayloadButNotDestinations) {

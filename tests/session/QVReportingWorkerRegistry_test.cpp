@@ -82,12 +82,6 @@ TEST_F(Workers, RegistryDerivesItsListsInOrderAndSkipsClassesWithoutAFactory) {
               (std::vector<std::string>{"TestOnInitConsumer"}));
     EXPECT_TRUE(log->contains("Worker does not implement initWithSession! TestWithoutInit"));
     EXPECT_EQ(QVReportingSession::getAllWorkerClasses()[1], &kNoFactory);
-
-    const auto& pc = makeWorkerClass<TestProducerConsumer>();
-    EXPECT_FALSE(pc.implementsStart);
-    EXPECT_TRUE(makeWorkerClass<TestProducer>().implementsStart);
-    EXPECT_TRUE(makeWorkerClass<TestOnInitConsumer>().startOnInit);
-    EXPECT_FALSE(makeWorkerClass<TestRedundantConsumer>().handleSingleMessageSession);
 }
 
 TEST_F(Workers, StartConsumersFirstAndStopProducersFirstSoDerivedMessagesReachConsumers) {
