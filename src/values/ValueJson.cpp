@@ -2,6 +2,7 @@
 
 #include <nlohmann/json.hpp>
 
+#include <charconv>
 #include <cmath>
 #include <limits>
 
@@ -118,6 +119,207 @@ nlohmann::ordered_json QVReportingDictionaryToJson(const Dictionary& dictionary)
         entries.emplace_back(key, QVReportingValueToJson(value));
     }
     return object;
+}
+
+namespace {
+
+// Escapes as nlohmann does with ensure_ascii off: quote, backslash and control characters only.
+// False when text is not valid UTF-8.
+bool appendJsonString(std::string& out, std::string_view text) {
+    static constexpr char kHex[] = "0123456789abcdef";
+    out += '"';
+    std::size_t i = 0;
+    while (i < text.size()) {
+        // Plain characters go across in runs.
+        std::size_t plain = i;
+        while (plain < text.size()) {
+            const auto p = static_cast<unsigned char>(text[plain]);
+            if (p < 0x20 || p >= 0x80 || p == '"' || p == '\\') {
+                break;
+            }
+            ++plain;
+        }
+        out.append(text.data() + i, plain - i);
+        i = plain;
+        if (i == text.size()) {
+            break;
+        }
+        const auto c = static_cast<unsigned char>(text[i]);
+        if (c >= 0x80) {
+            // A whole, minimal, non-surrogate UTF-8 sequence is copied as it is.
+            const std::size_t length = c >= 0xF0 ? 4 : c >= 0xE0 ? 3 : c >= 0xC2 ? 2 : 0;
+            if (length == 0 || c > 0xF4 || i + length > text.size()) {
+                return false;
+            }
+            std::uint32_t code = c & (0x3F >> (length - 1));
+            for (std::size_t k = 1; k < length; ++k) {
+                const auto next = static_cast<unsigned char>(text[i + k]);
+                if ((next & 0xC0) != 0x80) {
+                    return false;
+                }
+                code = (code << 6) | (next & 0x3F);
+            }
+            if ((length == 3 && (code < 0x800 || (code >= 0xD800 && code <= 0xDFFF))) ||
+                (length == 4 && (code < 0x10000 || code > 0x10FFFF))) {
+                return false;
+            }
+            out.append(text.substr(i, length));
+            i += length;
+            continue;
+        }
+        switch (c) {
+            case '"':
+                out += "\\\"";
+                break;
+            case '\\':
+                out += "\\\\";
+                break;
+            case '\b':
+                out += "\\b";
+                break;
+            case '\f':
+                out += "\\f";
+                break;
+            case '\n':
+                out += "\\n";
+                break;
+            case '\r':
+                out += "\\r";
+                break;
+            case '\t':
+                out += "\\t";
+                break;
+            default:
+                if (c < 0x20) {
+                    out += "\\u00";
+                    out += kHex[c >> 4];
+                    out += kHex[c & 0xF];
+                } else {
+                    out += static_cast<char>(c);
+                }
+        }
+        ++i;
+    }
+    out += '"';
+    return true;
+}
+
+void appendJsonNumber(std::string& out, double d) {
+    if (!std::isfinite(d)) {
+        out += "null";
+        return;
+    }
+    // nlohmann's own shortest round-trip form, so that both writers agree to the byte.
+    char buffer[64];
+    char* end = nlohmann::detail::to_chars(buffer, buffer + sizeof buffer, d);
+    out.append(buffer, end);
+}
+
+template <typename Integer>
+void appendInteger(std::string& out, Integer n) {
+    char buffer[24];
+    const auto result = std::to_chars(buffer, buffer + sizeof buffer, n);
+    out.append(buffer, result.ptr);
+}
+
+void appendNewline(std::string& out, int indent, int depth) {
+    out += '\n';
+    out.append(static_cast<std::size_t>(indent * depth), ' ');
+}
+
+bool appendJsonText(std::string& out, const Value& value, int indent, int depth) {
+    using K = Value::Kind;
+    switch (value.kind()) {
+        case K::Null:
+            out += "null";
+            return true;
+        case K::Bool:
+            out += value.boolValue() ? "true" : "false";
+            return true;
+        case K::Int:
+            appendInteger(out, *value.asInt64());
+            return true;
+        case K::UInt:
+            appendInteger(out, *value.asUInt64());
+            return true;
+        case K::Double:
+            appendJsonNumber(out, *value.asDouble());
+            return true;
+        case K::Date:
+            appendJsonNumber(out, value.asDate()->secondsSince1970);
+            return true;
+        case K::String:
+            return appendJsonString(out, *value.asString());
+        case K::Bytes:
+            return appendJsonString(out, QVReportingBase64Encode(*value.asBytes()));
+        case K::Array: {
+            const Array& array = *value.asArray();
+            if (array.empty()) {
+                out += "[]";
+                return true;
+            }
+            out += '[';
+            for (std::size_t i = 0; i < array.size(); ++i) {
+                if (i > 0) {
+                    out += ',';
+                }
+                if (indent >= 0) {
+                    appendNewline(out, indent, depth + 1);
+                }
+                if (!appendJsonText(out, array[i], indent, depth + 1)) {
+                    return false;
+                }
+            }
+            if (indent >= 0) {
+                appendNewline(out, indent, depth);
+            }
+            out += ']';
+            return true;
+        }
+        case K::Dictionary: {
+            const Dictionary& dictionary = *value.asDictionary();
+            if (dictionary.empty()) {
+                out += "{}";
+                return true;
+            }
+            out += '{';
+            bool first = true;
+            for (const auto& [key, item] : dictionary) {
+                if (!first) {
+                    out += ',';
+                }
+                first = false;
+                if (indent >= 0) {
+                    appendNewline(out, indent, depth + 1);
+                }
+                if (!appendJsonString(out, key)) {
+                    return false;
+                }
+                out += indent >= 0 ? ": " : ":";
+                if (!appendJsonText(out, item, indent, depth + 1)) {
+                    return false;
+                }
+            }
+            if (indent >= 0) {
+                appendNewline(out, indent, depth);
+            }
+            out += '}';
+            return true;
+        }
+    }
+    out += "null";
+    return true;
+}
+
+}  // namespace
+
+bool QVReportingAppendJsonText(std::string& out, const Value& value, int indent) {
+    const std::size_t before = out.size();
+    if (!appendJsonText(out, value, indent, 0)) {
+        out.resize(before);
+        return false;
+    }
+    return true;
 }
 
 Value QVReportingValueFromJson(const nlohmann::ordered_json& json) {

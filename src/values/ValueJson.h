@@ -26,6 +26,12 @@ namespace qv {
 nlohmann::ordered_json QVReportingValueToJson(const Value& value);
 nlohmann::ordered_json QVReportingDictionaryToJson(const Dictionary& dictionary);
 
+// Appends the JSON text of value to out, exactly as nlohmann's dump(indent) writes
+// QVReportingValueToJson(value), without building that JSON value first (the writers of large
+// files and of every sink line spend most of their time there). indent < 0 is the compact form.
+// False, with out as it was, when a string is not valid UTF-8: the caller decides what to do.
+bool QVReportingAppendJsonText(std::string& out, const Value& value, int indent = -1);
+
 Value QVReportingValueFromJson(const nlohmann::ordered_json& json);
 Value QVReportingValueFromJson(const nlohmann::json& json);
 // The object as a dictionary; an empty dictionary when json is not an object.

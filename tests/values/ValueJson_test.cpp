@@ -1,12 +1,14 @@
 #include "values/ValueJson.h"
 
 #include <fmt/format.h>
+#include <fmt/ranges.h>
 #include <gtest/gtest.h>
 #include <nlohmann/json.hpp>
 
 #include <cmath>
 #include <cstdint>
 #include <limits>
+#include <random>
 #include <string>
 #include <vector>
 
@@ -131,6 +133,123 @@ TEST(ValueJson, LargeDictionariesKeepTheirOrderBothWays) {
         ASSERT_EQ(it->first, key);
         EXPECT_EQ(it->second, value);
         ++it;
+    }
+}
+
+// A value of every kind, random in shape and content, for the writers to agree on.
+Value randomValue(std::mt19937& random, int depth) {
+    const int kind = static_cast<int>(random() % (depth > 3 ? 8 : 10));
+    const auto text = [&] {
+        static const std::vector<std::string> pieces = {
+            "a",    " ",    "\"", "\\", "\n", "\t", std::string(1, '\0'),
+            "\x1f", "\x7f", "é",  "€",  "😀",  "/",  "key"};
+        std::string s;
+        for (auto n = random() % 5; n > 0; --n) {
+            s += pieces[random() % pieces.size()];
+        }
+        return s;
+    };
+    switch (kind) {
+        case 0:
+            return Value();
+        case 1:
+            return Value(random() % 2 == 0);
+        case 2:
+            return Value(static_cast<std::int64_t>(random()) - (std::int64_t{1} << 31));
+        case 3:
+            return Value(std::numeric_limits<std::uint64_t>::max() - random());
+        case 4: {
+            // Doubles across the whole range, integral ones included.
+            const double mantissa = static_cast<double>(random()) / 7.0;
+            const int exponent = static_cast<int>(random() % 80) - 40;
+            return Value(random() % 3 == 0 ? std::floor(mantissa) : std::ldexp(mantissa, exponent));
+        }
+        case 5:
+            return Value(text());
+        case 6:
+            return Value(Bytes{static_cast<std::uint8_t>(random()), 0xff, 0x00});
+        case 7:
+            return Value(Date{static_cast<double>(random()) / 3.0});
+        case 8: {
+            Array array;
+            for (auto n = random() % 4; n > 0; --n) {
+                array.push_back(randomValue(random, depth + 1));
+            }
+            return Value(std::move(array));
+        }
+        default: {
+            Dictionary dictionary;
+            for (auto n = random() % 4; n > 0; --n) {
+                dictionary.set(text() + std::to_string(n), randomValue(random, depth + 1));
+            }
+            return Value(std::move(dictionary));
+        }
+    }
+}
+
+TEST(ValueJson, WritesTextByteForByteAsNlohmannDoes) {
+    const std::vector<Value> edges = {Value(0.1),
+                                      Value(1.0),
+                                      Value(-0.0),
+                                      Value(1e20),
+                                      Value(1e-5),
+                                      Value(5e-324),
+                                      Value(std::numeric_limits<double>::max()),
+                                      Value(123456789012345678.0),
+                                      Value(std::nan("")),
+                                      Value(-std::numeric_limits<double>::infinity()),
+                                      Value(std::numeric_limits<std::int64_t>::min()),
+                                      Value(Dictionary{}),
+                                      Value(Array{}),
+                                      Value(Dictionary{{"", Array{Dictionary{}, Array{}}}}),
+                                      Value(std::string("\x01\x1b"))};
+    std::mt19937 random(20261123);
+    std::vector<Value> values = edges;
+    for (int i = 0; i < 400; ++i) {
+        values.push_back(randomValue(random, 0));
+    }
+    for (const Value& value : values) {
+        for (const int indent : {-1, 2, 4}) {
+            std::string ours = "prefix";
+            ASSERT_TRUE(QVReportingAppendJsonText(ours, value, indent));
+            EXPECT_EQ(ours, "prefix" + QVReportingValueToJson(value).dump(indent))
+                << value.description();
+        }
+    }
+}
+
+TEST(ValueJson, RefusesTheTextsNlohmannRefusesAndLeavesItsOutputAlone) {
+    const std::vector<std::string> invalid = {"\x80",
+                                              "\xc0\xaf",
+                                              "\xc3",
+                                              "\xe2\x82",
+                                              "\xed\xa0\x80" /* a surrogate */,
+                                              "\xf4\x90\x80\x80" /* beyond U+10FFFF */,
+                                              "\xf8\x88\x80\x80\x80",
+                                              "ok\xff"};
+    std::mt19937 random(7);
+    std::vector<std::string> texts = invalid;
+    for (int i = 0; i < 2000; ++i) {
+        std::string bytes;
+        for (auto n = random() % 4; n > 0; --n) {
+            bytes += static_cast<char>(0x80 + random() % 0x80);
+        }
+        texts.push_back(bytes);
+    }
+    for (const std::string& text : texts) {
+        bool nlohmannAccepts = true;
+        try {
+            (void)ordered_json(text).dump();
+        } catch (const nlohmann::json::exception&) {
+            nlohmannAccepts = false;
+        }
+        std::string out = "kept";
+        EXPECT_EQ(QVReportingAppendJsonText(out, Value(Dictionary{{"k", Array{text}}})),
+                  nlohmannAccepts)
+            << fmt::format("{:02x}", fmt::join(text, " "));
+        if (!nlohmannAccepts) {
+            EXPECT_EQ(out, "kept");
+        }
     }
 }
 

@@ -11,7 +11,6 @@
 #include <system_error>
 
 #include <fmt/format.h>
-#include <nlohmann/json.hpp>
 
 #include "platform/Clock.h"
 #include "platform/DeviceInformation.h"
@@ -26,6 +25,9 @@
 namespace qv {
 
 namespace {
+
+// Each message is written as a pretty-printed object, this many blanks a level.
+constexpr int kJsonIndent = 2;
 
 const QVReportingLogCategory& logCategory() {
     return QVReportingSessionCategory();
@@ -100,9 +102,19 @@ void QVReportingSessionSummaryJsonFileWorker::openFile() {
 }
 
 void QVReportingSessionSummaryJsonFileWorker::writeLine(std::string_view line) {
-    std::string text(line);
-    text += '\n';
-    if (!writeAll(reportFileHandle_, text)) {
+    pending_.append(line);
+    pending_ += '\n';
+    // Lines are gathered and written in large pieces: a session of many messages would otherwise
+    // cost two system calls a message. Without an open file each line fails, and says so, at once.
+    if (pending_.size() >= kWriteChunk || reportFileHandle_ < 0) {
+        writePending();
+    }
+}
+
+void QVReportingSessionSummaryJsonFileWorker::writePending() {
+    const bool written = writeAll(reportFileHandle_, pending_);
+    pending_.clear();
+    if (!written) {
         QVLOG_ERROR(
             logCategory(),
             "SummaryJsonFileWorker failed to write line. action=writeline file={} error=\"{}\"",
@@ -112,6 +124,7 @@ void QVReportingSessionSummaryJsonFileWorker::writeLine(std::string_view line) {
 
 void QVReportingSessionSummaryJsonFileWorker::closeFile() {
     writeLine("]");
+    writePending();
     const int result = ::close(reportFileHandle_);
     reportFileHandle_ = -1;
     if (result != 0) {
@@ -142,17 +155,19 @@ void QVReportingSessionSummaryJsonFileWorker::stop() {
         } else {
             openFile();
         }
-        const std::string key =
-            fmt::format("{}_{}", QVReportingUtilityCategoryString(message.category()),
-                        QVReportingUtilityTypeString(message.type()));
+        std::string key = QVReportingUtilityCategoryString(message.category());
+        key += '_';
+        key += QVReportingUtilityTypeString(message.type());
         const std::uint64_t n = ++counters[key];
         message.message().set("isSessionStarted", message.isSessionStarted() ? "YES" : "NO");
-        nlohmann::ordered_json member;
-        member[fmt::format("{}_{}", key, n)] = QVReportingDictionaryToJson(message.message());
-        try {
-            writeLine(member.dump(2));
-        } catch (const nlohmann::json::exception& e) {
-            QVLOG_ERROR(logCategory(), "dataWithJSONObject: {}", e.what());
+        const Value member(Dictionary{{key + '_' + std::to_string(n), Value(message.message())}});
+        std::string text;
+        text.reserve(1024);
+        if (QVReportingAppendJsonText(text, member, kJsonIndent)) {
+            writeLine(text);
+        } else {
+            QVLOG_ERROR(logCategory(), "dataWithJSONObject: {}",
+                        "a string of the message is not valid UTF-8");
         }
     }
     if (!reportPath_.empty()) {

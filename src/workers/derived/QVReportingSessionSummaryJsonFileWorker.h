@@ -44,8 +44,13 @@ class QVReportingSessionSummaryJsonFileWorker final : public QVReportingSessionW
     const std::string& reportPath() const { return reportPath_; }
 
   private:
+    static constexpr std::size_t kWriteChunk = 256 * 1024;
+
+    void writePending();
+
     std::string reportPath_;
     int reportFileHandle_ = -1;
+    std::string pending_;  // lines not yet written
 };
 
 }  // namespace qv
