@@ -293,6 +293,7 @@ int trivialServer(const std::string& address) {
 int main(int argc, char** argv) {
     std::string daemon;
     std::int64_t total = 200000;
+    bool memoryOnly = false;
     for (int i = 1; i < argc; ++i) {
         const std::string a = argv[i];
         if (a == "--trivial-server" && i + 1 < argc) {
@@ -302,11 +303,14 @@ int main(int argc, char** argv) {
             daemon = argv[++i];
         } else if (a == "--messages" && i + 1 < argc) {
             total = std::stoll(argv[++i]);
+        } else if (a == "--memory-only") {
+            memoryOnly = true;
         } else {
             std::fprintf(stderr,
-                         "usage: %s --daemon PATH/qvreportd [--messages N]\n"
+                         "usage: %s --daemon PATH/qvreportd [--messages N] [--memory-only]\n"
                          "  N: messages per pipelined workload (default 200000; serial ones "
-                         "send a tenth)\n",
+                         "send a tenth)\n"
+                         "  --memory-only: only the memory check, not the throughput table\n",
                          argv[0]);
             return 2;
         }
@@ -352,6 +356,9 @@ int main(int argc, char** argv) {
     bool allMet = true;
     for (int clients : {1, 4, 16}) {
         for (bool pipelined : {false, true}) {
+            if (memoryOnly) {
+                break;
+            }
             const std::int64_t perClient = (pipelined ? total : total / 10) / clients;
             const Result t = run(address, trivialTarget, clients, pipelined, perClient, nextID);
             const Result d = run(address, daemonTarget, clients, pipelined, perClient, nextID);
@@ -367,31 +374,41 @@ int main(int argc, char** argv) {
         }
     }
 
-    // Memory: 10^6 messages through sessions that are stopped and destroyed.
-    const long before = rssKiB(qv);
+    // Memory: 10^6 messages through sessions that are stopped and destroyed. The daemon hands
+    // freed memory back to the system on a timer of 5 s: both readings wait a little longer.
+    const auto settledRss = [qv] {
+        std::this_thread::sleep_for(std::chrono::seconds(6));
+        return rssKiB(qv);
+    };
     const int clients = 16;
     const std::int64_t perSession = 10000;
     const std::int64_t rounds = 1000000 / (clients * perSession);
+    // One round first, so that "before" is a daemon that has served sessions (its thread arenas,
+    // worker registry and sink buffers exist), not one that has never been used.
+    const long untouched = rssKiB(qv);
+    run(address, daemonTarget, clients, true, perSession, nextID);
+    nextID += clients;
+    const long before = settledRss();
     for (std::int64_t r = 0; r < rounds; ++r) {
         run(address, daemonTarget, clients, true, perSession, nextID);
         nextID += clients;
     }
-    // The daemon hands freed memory back to the system on a timer of a few seconds: give it ten.
     const long atOnce = rssKiB(qv);
-    long after = atOnce;
-    for (int i = 0; i < 20 && after > before * 11 / 10; ++i) {
-        std::this_thread::sleep_for(std::chrono::milliseconds(500));
-        after = rssKiB(qv);
-    }
+    const long after = settledRss();
     std::printf(
-        "\nRSS before %ld KiB; after %lld messages in stopped sessions %ld KiB at once, "
-        "%ld KiB settled (%+.1f%%)\n",
-        before, static_cast<long long>(rounds * clients * perSession), atOnce, after,
+        "\nRSS %ld KiB when the memory check began, %ld KiB after one round (before); after "
+        "%lld messages in stopped sessions %ld KiB at once, %ld KiB settled (%+.1f%%)\n",
+        untouched, before, static_cast<long long>(rounds * clients * perSession), atOnce, after,
         100.0 * static_cast<double>(after - before) / static_cast<double>(before));
-    std::printf(
-        "targets (pipelined: >= 0.7x trivial msg/s, p99 <= 2x trivial; RSS within 10%%): "
-        "%s\n",
-        allMet && after <= before * 11 / 10 ? "met" : "NOT met");
+    const bool memoryMet = after <= before * 11 / 10;
+    if (memoryOnly) {
+        std::printf("target (RSS within 10%%): %s\n", memoryMet ? "met" : "NOT met");
+    } else {
+        std::printf(
+            "targets (pipelined: >= 0.7x trivial msg/s, p99 <= 2x trivial; RSS within 10%%): "
+            "%s\n",
+            allMet && memoryMet ? "met" : "NOT met");
+    }
 
     kill(trivial, SIGTERM);
     kill(qv, SIGTERM);

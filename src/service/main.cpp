@@ -52,7 +52,7 @@ std::unique_ptr<sdbus::IConnection> connectTo(const std::string& bus) {
 // Stopped sessions free their messages in bulk, but the allocator keeps freed pages inside its
 // arenas. Once this much lies free, it is handed back to the system, so that the daemon's
 // footprint follows its load instead of its busiest moment.
-constexpr std::size_t kFreeBytesWorthReturning = 16u << 20;
+constexpr std::size_t kFreeBytesWorthReturning = 1u << 20;
 
 void returnFreeMemory() {
     if (mallinfo2().fordblks > kFreeBytesWorthReturning) {
