@@ -4,6 +4,8 @@
 #include <cstdint>
 #include <vector>
 
+#include "values/Utf8.h"
+
 namespace qv {
 
 namespace {
@@ -11,44 +13,6 @@ namespace {
 constexpr char kHex[] = "0123456789ABCDEF";
 // "~" and 16 hex digits mark a cut result.
 constexpr std::size_t kHashSuffixLength = 17;
-
-bool isContinuation(unsigned char c) {
-    return (c & 0xC0) == 0x80;
-}
-
-// Length of the well-formed UTF-8 sequence that starts at text[i], or 0 when there is none
-// (overlong forms, surrogates and code points above U+10FFFF are not well-formed).
-std::size_t utf8SequenceLength(std::string_view text, std::size_t i) {
-    const auto byte = [&](std::size_t k) { return static_cast<unsigned char>(text[i + k]); };
-    const unsigned char c = byte(0);
-    const std::size_t left = text.size() - i;
-    if (c < 0x80) {
-        return 1;
-    }
-    if (c >= 0xC2 && c <= 0xDF) {
-        return left >= 2 && isContinuation(byte(1)) ? 2 : 0;
-    }
-    if (c >= 0xE0 && c <= 0xEF) {
-        if (left < 3 || !isContinuation(byte(1)) || !isContinuation(byte(2))) {
-            return 0;
-        }
-        if ((c == 0xE0 && byte(1) < 0xA0) || (c == 0xED && byte(1) > 0x9F)) {
-            return 0;
-        }
-        return 3;
-    }
-    if (c >= 0xF0 && c <= 0xF4) {
-        if (left < 4 || !isContinuation(byte(1)) || !isContinuation(byte(2)) ||
-            !isContinuation(byte(3))) {
-            return 0;
-        }
-        if ((c == 0xF0 && byte(1) < 0x90) || (c == 0xF4 && byte(1) > 0x8F)) {
-            return 0;
-        }
-        return 4;
-    }
-    return 0;
-}
 
 std::string escaped(unsigned char c) {
     return {'%', kHex[c >> 4], kHex[c & 0x0F]};
@@ -81,7 +45,7 @@ std::string QVReportingSafeFileComponent(std::string_view text, std::size_t maxL
         std::size_t consumed = 1;
         if (c < 0x20 || c == 0x7F || c == '/' || c == '%' || (i == 0 && c == '.')) {
             piece = escaped(c);
-        } else if (const std::size_t n = utf8SequenceLength(text, i); n == 0) {
+        } else if (const std::size_t n = QVReportingUtf8SequenceLength(text, i); n == 0) {
             piece = escaped(c);
         } else {
             piece.assign(text.substr(i, n));

@@ -11,6 +11,7 @@
 #include <fmt/format.h>
 
 #include "values/Base64.h"
+#include "values/Utf8.h"
 
 namespace qv {
 
@@ -136,53 +137,6 @@ PlistPtr toPlist(const Value& value) {
     return nullptr;
 }
 
-// Strict UTF-8: no overlong forms, no surrogates, nothing above U+10FFFF.
-bool isValidUtf8(const Bytes& bytes) {
-    std::size_t i = 0;
-    const std::size_t n = bytes.size();
-    while (i < n) {
-        const std::uint8_t c = bytes[i];
-        std::size_t length = 0;
-        std::uint8_t low = 0x80;
-        std::uint8_t high = 0xBF;
-        if (c < 0x80) {
-            ++i;
-            continue;
-        } else if (c >= 0xC2 && c <= 0xDF) {
-            length = 2;
-        } else if (c >= 0xE0 && c <= 0xEF) {
-            length = 3;
-            if (c == 0xE0) {
-                low = 0xA0;  // overlong below U+0800
-            } else if (c == 0xED) {
-                high = 0x9F;  // surrogates
-            }
-        } else if (c >= 0xF0 && c <= 0xF4) {
-            length = 4;
-            if (c == 0xF0) {
-                low = 0x90;  // overlong below U+10000
-            } else if (c == 0xF4) {
-                high = 0x8F;  // above U+10FFFF
-            }
-        } else {
-            return false;
-        }
-        if (n - i < length) {
-            return false;
-        }
-        if (bytes[i + 1] < low || bytes[i + 1] > high) {
-            return false;
-        }
-        for (std::size_t k = 2; k < length; ++k) {
-            if (bytes[i + k] < 0x80 || bytes[i + k] > 0xBF) {
-                return false;
-            }
-        }
-        i += length;
-    }
-    return true;
-}
-
 }  // namespace
 
 std::optional<Bytes> DataSerialize::getPlistBlob(const Value& value) {
@@ -217,7 +171,8 @@ std::optional<std::string> DataSerialize::getXMLInfo(const Value& value) {
 
 std::optional<std::string> DataSerialize::getDataXMLInfo(const Value& value) {
     const auto blob = getPlistBlob(value);
-    if (!blob || !isValidUtf8(*blob)) {
+    if (!blob || !QVReportingIsValidUtf8(
+                     std::string_view(reinterpret_cast<const char*>(blob->data()), blob->size()))) {
         return std::nullopt;
     }
     return std::string(blob->begin(), blob->end());

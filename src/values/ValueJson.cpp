@@ -7,6 +7,7 @@
 #include <limits>
 
 #include "values/Base64.h"
+#include "values/Utf8.h"
 
 namespace qv {
 
@@ -146,21 +147,8 @@ bool appendJsonString(std::string& out, std::string_view text) {
         }
         const auto c = static_cast<unsigned char>(text[i]);
         if (c >= 0x80) {
-            // A whole, minimal, non-surrogate UTF-8 sequence is copied as it is.
-            const std::size_t length = c >= 0xF0 ? 4 : c >= 0xE0 ? 3 : c >= 0xC2 ? 2 : 0;
-            if (length == 0 || c > 0xF4 || i + length > text.size()) {
-                return false;
-            }
-            std::uint32_t code = c & (0x3F >> (length - 1));
-            for (std::size_t k = 1; k < length; ++k) {
-                const auto next = static_cast<unsigned char>(text[i + k]);
-                if ((next & 0xC0) != 0x80) {
-                    return false;
-                }
-                code = (code << 6) | (next & 0x3F);
-            }
-            if ((length == 3 && (code < 0x800 || (code >= 0xD800 && code <= 0xDFFF))) ||
-                (length == 4 && (code < 0x10000 || code > 0x10FFFF))) {
+            const std::size_t length = QVReportingUtf8SequenceLength(text, i);
+            if (length == 0) {
                 return false;
             }
             out.append(text.substr(i, length));
