@@ -215,6 +215,32 @@ void appendNewline(std::string& out, int indent, int depth) {
     out.append(static_cast<std::size_t>(indent * depth), ' ');
 }
 
+// The items between open and close, one a line when indenting; an empty container stays on
+// its line ("[]", "{}"), as nlohmann lays them out.
+template <typename Items, typename WriteItem>
+bool appendContainer(std::string& out, char open, char close, const Items& items, int indent,
+                     int depth, WriteItem writeItem) {
+    out += open;
+    bool first = true;
+    for (const auto& item : items) {
+        if (!first) {
+            out += ',';
+        }
+        first = false;
+        if (indent >= 0) {
+            appendNewline(out, indent, depth + 1);
+        }
+        if (!writeItem(item)) {
+            return false;
+        }
+    }
+    if (indent >= 0 && !first) {
+        appendNewline(out, indent, depth);
+    }
+    out += close;
+    return true;
+}
+
 bool appendJsonText(std::string& out, const Value& value, int indent, int depth) {
     using K = Value::Kind;
     switch (value.kind()) {
@@ -240,60 +266,19 @@ bool appendJsonText(std::string& out, const Value& value, int indent, int depth)
             return appendJsonString(out, *value.asString());
         case K::Bytes:
             return appendJsonString(out, QVReportingBase64Encode(*value.asBytes()));
-        case K::Array: {
-            const Array& array = *value.asArray();
-            if (array.empty()) {
-                out += "[]";
-                return true;
-            }
-            out += '[';
-            for (std::size_t i = 0; i < array.size(); ++i) {
-                if (i > 0) {
-                    out += ',';
-                }
-                if (indent >= 0) {
-                    appendNewline(out, indent, depth + 1);
-                }
-                if (!appendJsonText(out, array[i], indent, depth + 1)) {
-                    return false;
-                }
-            }
-            if (indent >= 0) {
-                appendNewline(out, indent, depth);
-            }
-            out += ']';
-            return true;
-        }
-        case K::Dictionary: {
-            const Dictionary& dictionary = *value.asDictionary();
-            if (dictionary.empty()) {
-                out += "{}";
-                return true;
-            }
-            out += '{';
-            bool first = true;
-            for (const auto& [key, item] : dictionary) {
-                if (!first) {
-                    out += ',';
-                }
-                first = false;
-                if (indent >= 0) {
-                    appendNewline(out, indent, depth + 1);
-                }
-                if (!appendJsonString(out, key)) {
-                    return false;
-                }
-                out += indent >= 0 ? ": " : ":";
-                if (!appendJsonText(out, item, indent, depth + 1)) {
-                    return false;
-                }
-            }
-            if (indent >= 0) {
-                appendNewline(out, indent, depth);
-            }
-            out += '}';
-            return true;
-        }
+        case K::Array:
+            return appendContainer(
+                out, '[', ']', *value.asArray(), indent, depth,
+                [&](const Value& item) { return appendJsonText(out, item, indent, depth + 1); });
+        case K::Dictionary:
+            return appendContainer(out, '{', '}', *value.asDictionary(), indent, depth,
+                                   [&](const auto& entry) {
+                                       if (!appendJsonString(out, entry.first)) {
+                                           return false;
+                                       }
+                                       out += indent >= 0 ? ": " : ":";
+                                       return appendJsonText(out, entry.second, indent, depth + 1);
+                                   });
     }
     out += "null";
     return true;
