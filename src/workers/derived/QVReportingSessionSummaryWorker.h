@@ -28,9 +28,6 @@ class QVReportingSessionSummaryWorker final : public QVReportingSessionWorkerPro
     // Sends the summary, whether or not start was called.
     void stop() override;
 
-    // The summary's payload as it would be sent now.
-    Dictionary summary(const QVReportingSession& session) const;
-
     double totalActiveTime() const { return totalActiveTime_; }
     std::uint32_t activeCount() const { return activeCount_; }
     std::uint32_t overloadCount() const { return overloadCount_; }
@@ -40,6 +37,9 @@ class QVReportingSessionSummaryWorker final : public QVReportingSessionWorkerPro
     std::uint32_t numRedundantMessages() const { return 0; }
 
   private:
+    // The summary's payload as it would be sent now.
+    Dictionary summary(const QVReportingSession& session) const;
+
     double totalActiveTime_ = 0.0;
     std::uint32_t activeCount_ = 0;
     std::uint32_t overloadCount_ = 0;
