@@ -161,13 +161,7 @@ void QVReportingUtilityTEST_resetInternalBuild() {
 
 std::string QVReportingUtilityRetrieveAppName(const Dictionary& dictionary) {
     const Value* name = dictionary.find(kAppNameKey);
-    if (name == nullptr) {
-        return "Unknown";
-    }
-    if (const std::string* s = name->asString()) {
-        return *s;
-    }
-    return name->description();
+    return name ? QVReportingValueText(name) : "Unknown";
 }
 
 double QVReportingUtilityVolumeMinimumPlayingTime(AudioServiceType /*serviceType*/) {

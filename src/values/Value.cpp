@@ -306,6 +306,16 @@ std::string Value::description() const {
     return out;
 }
 
+std::string QVReportingValueText(const Value* value) {
+    if (value == nullptr) {
+        return "(null)";
+    }
+    if (const std::string* s = value->asString()) {
+        return *s;
+    }
+    return value->description();
+}
+
 Value Value::deepCopy() const {
     if (const Array* a = asArray()) {
         Array copy;

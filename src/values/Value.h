@@ -162,4 +162,8 @@ class Dictionary {
     std::vector<std::uint32_t> slots_;
 };
 
+// A possibly absent value as a format's "%@" puts it in text: a string as it is (unquoted),
+// any other kind by its description, "(null)" when absent.
+std::string QVReportingValueText(const Value* value);
+
 }  // namespace qv

@@ -23,16 +23,6 @@ std::optional<double> QVReportingDerivedTimeValue(const Value* value) {
     }
 }
 
-std::string QVReportingDerivedTextValue(const Value* value) {
-    if (value == nullptr) {
-        return "(null)";
-    }
-    if (const std::string* s = value->asString()) {
-        return *s;
-    }
-    return value->description();
-}
-
 void QVReportingSendDerivedMessages(QVReportingSession& session, std::string_view what,
                                     const QVReportingMessageList& derived) {
     if (derived.empty()) {

@@ -6,7 +6,6 @@
 
 #include <memory>
 #include <optional>
-#include <string>
 #include <string_view>
 #include <vector>
 
@@ -22,8 +21,6 @@ using QVReportingMessageList = std::vector<std::shared_ptr<QVReportingSessionMes
 // The time a value holds, by the session's own rule: an integer or a double that is not NaN.
 // Anything else (a string, a boolean, no value) is no time at all.
 std::optional<double> QVReportingDerivedTimeValue(const Value* value);
-// A value as text: a string as it is, any other kind by its printed form, "(null)" when absent.
-std::string QVReportingDerivedTextValue(const Value* value);
 
 // Sends each derived message, in order, into the session, after the default-level line
 // "sending <what> for reporter <ID>"; nothing, not even the line, when there is none.

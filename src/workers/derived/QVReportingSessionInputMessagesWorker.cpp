@@ -146,10 +146,10 @@ QVReportingSessionInputMessagesWorker::createInputMessages(const MessageList& me
                       hasDuration;
             if (QVReportingUtilityKeyIsPresentAndHasChanged(
                     QVReportingMessageKeyVpConfigPrimaryVocoder, &payload, &state)) {
-                const std::string rate = QVReportingDerivedTextValue(
+                const std::string rate = QVReportingValueText(
                     payload.find(QVReportingMessageKeyVpConfigPrimaryVocoderFs));
                 if (!rate.starts_with(kIdleRatePrefix)) {
-                    codecs.insert(QVReportingDerivedTextValue(
+                    codecs.insert(QVReportingValueText(
                                       payload.find(QVReportingMessageKeyVpConfigPrimaryVocoder)) +
                                   ":" + rate);
                 }
@@ -166,9 +166,8 @@ QVReportingSessionInputMessagesWorker::createInputMessages(const MessageList& me
                         "runningTime {{ func={}, runningTime={:f}, qvTimestamp={}, "
                         "qvTimestamp_double={:f}, startQvTimestamp={}, "
                         "startQvTimestamp_double={:f} }}",
-                        kFunction, runningTime, QVReportingDerivedTextValue(ts), end.value_or(0.0),
-                        QVReportingDerivedTextValue(start ? &*start : nullptr),
-                        begin.value_or(0.0));
+                        kFunction, runningTime, QVReportingValueText(ts), end.value_or(0.0),
+                        QVReportingValueText(start ? &*start : nullptr), begin.value_or(0.0));
             if (end && begin && process && runningTime > minimumRunningtime) {
                 results.push_back(makeInputMessage(state, *process, runningTime, index, codecs));
                 ++index;

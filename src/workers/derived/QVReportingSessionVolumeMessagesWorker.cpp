@@ -51,8 +51,7 @@ bool watchedKeysChanged(const Dictionary& payload, const Dictionary& state) {
          {QVReportingMessageKeySelectedFormat, QVReportingMessageKeyActiveDevices}) {
         const Value* now = payload.find(key);
         const Value* before = state.find(key);
-        if (now && before &&
-            QVReportingDerivedTextValue(now) != QVReportingDerivedTextValue(before)) {
+        if (now && before && QVReportingValueText(now) != QVReportingValueText(before)) {
             return true;
         }
     }
@@ -207,9 +206,8 @@ QVReportingSessionVolumeMessagesWorker::createVolumeMessages(
                         "playingTime {{ func={}, playingTime={:f}, qvTimestamp={}, "
                         "qvTimestamp_double={:f}, startQvTimestamp={}, "
                         "startQvTimestamp_double={:f} }}",
-                        kFunction, playingTime, QVReportingDerivedTextValue(ts), end.value_or(0.0),
-                        QVReportingDerivedTextValue(start ? &*start : nullptr),
-                        begin.value_or(0.0));
+                        kFunction, playingTime, QVReportingValueText(ts), end.value_or(0.0),
+                        QVReportingValueText(start ? &*start : nullptr), begin.value_or(0.0));
             if (end && begin && playingTime > minimumPlaytime && process &&
                 state.contains(QVReportingMessageKeyVolume)) {
                 results.push_back(makeVolumeMessage(state, *process, playingTime, index));
