@@ -22,21 +22,17 @@ TEST(ASerialQueue, RunsTasksOneAtATimeInPostOrderAndSyncRunsInlineOnItself) {
     std::atomic<bool> overlapped{false};
     {
         SerialQueue queue("test.queue");
-        std::vector<std::thread> posters;
-        for (int t = 0; t < 4; ++t) {
-            posters.emplace_back([&, t] {
-                for (int i = 0; i < 250; ++i) {
-                    queue.async([&, t, i] {
-                        if (running.fetch_add(1) != 0)
-                            overlapped = true;
-                        seen.push_back(t * 1000 + i);
-                        running.fetch_sub(1);
-                    });
-                }
-            });
-        }
-        for (auto& p : posters)
-            p.join();
+        auto post = [&](int t) {
+            for (int i = 0; i < 250; ++i) {
+                queue.async([&, t, i] {
+                    overlapped = overlapped || running.fetch_add(1) != 0;
+                    seen.push_back(t * 1000 + i);
+                    running = 0;
+                });
+            }
+        };
+        std::jthread p1(post, 1), p2(post, 2), p3(post, 3);
+        post(0);
         bool nested = false;
         queue.sync([&] { queue.sync([&] { nested = queue.isCurrent(); }); });  // no deadlock
         EXPECT_TRUE(nested);

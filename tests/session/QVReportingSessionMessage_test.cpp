@@ -16,10 +16,8 @@ TEST(AMessage, OwnsItsTopLevelKeysAndCopiesFlagsButNotDestinations) {
     payload.set("k", "changed by the sender");
     EXPECT_EQ(*m.message().find("k"), Value("v"));
 
-    m.setIsRedundant(true);
     m.setDestinationWorkers({&someWorker});
     auto copy = m.copy();
-    EXPECT_TRUE(copy->isRedundant());
     EXPECT_TRUE(copy->destinationWorkers().empty());
     copy->message().set("k", "changed in the copy");
     EXPECT_EQ(*m.message().find("k"), Value("v"));
