@@ -126,12 +126,11 @@ TEST_F(TheClientLibrary, ServesTwoClientsSendingAtOnce) {
         }
         return waitUntil([&] { return done.load() >= 300; }) && done.load() == 300;
     };
-    bool okA = false, okB = false;
+    std::atomic<bool> okA = false;
     std::thread ta([&] { okA = sendMany(*a, 1, forA); });
-    std::thread tb([&] { okB = sendMany(*b, 2, forB); });
+    EXPECT_TRUE(sendMany(*b, 2, forB));  // at the same time as a
     ta.join();
-    tb.join();
-    EXPECT_TRUE(okA && okB);
+    EXPECT_TRUE(okA);
     EXPECT_TRUE(a->stopReportingSession(1));
     EXPECT_TRUE(b->stopReportingSession(2));
     EXPECT_EQ(stopDaemon(), 0);
@@ -144,9 +143,8 @@ TEST_F(TheClientLibrary, ServesTwoClientsSendingAtOnce) {
 
 TEST_F(TheClientLibrary, SaysClearlyWhenTheDaemonIsNotRunning) {
     stopDaemon();
-    auto client = QVReportingClient::connectToAddress(address_);
     try {
-        client->getAllReporters();
+        QVReportingClient::connectToAddress(address_)->getAllReporters();
         FAIL() << "a call without a daemon succeeded";
     } catch (const QVReportingClientError& e) {
         EXPECT_TRUE(e.isDaemonNotRunning()) << e.name() << ": " << e.message();
