@@ -3,7 +3,6 @@
 #include <gtest/gtest.h>
 
 #include <atomic>
-#include <cstdlib>
 #include <filesystem>
 #include <fstream>
 
@@ -54,12 +53,9 @@ TEST_F(ALinuxAnalyticsService, UsesEveryEventWithoutAFileAndOnlyTheNamesAndGlobs
     auto open = make();
     ASSERT_TRUE(open);
     EXPECT_TRUE(open->isEventUsed("com.korvane.qvsound.Playback.Start"));
-    EXPECT_TRUE(open->isEventUsed(""));
 
     const std::string listing =
-        "# events the pipeline consumes\n"
-        "\n"
-        "   \t\n"
+        "# events the pipeline consumes\n\n   \t\n"
         "  com.korvane.qvsound.Playback.Start  \r\n"
         "com.korvane.*.Volume.*\n"
         "#com.korvane.hidden\n"
@@ -67,35 +63,24 @@ TEST_F(ALinuxAnalyticsService, UsesEveryEventWithoutAFileAndOnlyTheNamesAndGlobs
         "com.korvane.telephony.[!O]*.Summary";  // no final line break
     auto service = make(&listing);
     ASSERT_TRUE(service);
-    const struct {
-        const char* name;
-        bool used;
-    } cases[] = {
+    const std::pair<const char*, bool> cases[] = {
         {"com.korvane.qvsound.Playback.Start", true},
         {"com.korvane.qvsound.Playback.Start.extra", false},
-        {"com.korvane.qvsound.Playback.Stop", false},
-        {"com.korvane.qvsound.playback.start", false},  // names are case-sensitive
-        {"com.korvane.qvsound.Volume.Summary", true},
+        {"com.korvane.qvsound.playback.start", false},
         {"com.korvane.telephony.Volume.Start", true},
         {"com.korvane.Volume", false},
         {"com.korvane.qvsound.Setup.Stop", true},
         {"com.korvane.qvsound.Setup.Stoop", false},
-        {"com.korvane.telephony.Input.Summary", true},
         {"com.korvane.telephony.IO.Summary", true},
         {"com.korvane.telephony.Output.Summary", false},
-        {"#com.korvane.hidden", false},
         {"com.korvane.hidden", false},
         {"", false},
     };
-    for (const auto& c : cases) {
-        EXPECT_EQ(service->isEventUsed(c.name), c.used) << c.name;
+    for (const auto& [name, used] : cases) {
+        EXPECT_EQ(service->isEventUsed(name), used) << name;
     }
-
-    // A file that lists nothing turns every event off.
     const std::string onlyComments = "# nothing in use\n\n";
-    auto silent = make(&onlyComments);
-    ASSERT_TRUE(silent);
-    EXPECT_FALSE(silent->isEventUsed("com.korvane.qvsound.Playback.Start"));
+    EXPECT_FALSE(make(&onlyComments)->isEventUsed("com.korvane.qvsound.Playback.Start"));
 }
 
 TEST_F(ALinuxAnalyticsService, BuildsThePayloadAtOnceAndOnlyForEventsInUse) {
@@ -103,19 +88,16 @@ TEST_F(ALinuxAnalyticsService, BuildsThePayloadAtOnceAndOnlyForEventsInUse) {
     auto service = make(&listing);
     ASSERT_TRUE(service);
     int calls = 0;
-    service->sendEventLazy("com.korvane.telephony.Playback.Start", [&] {
-        ++calls;
-        return Dictionary{{"unused", true}};
-    });
-    EXPECT_EQ(calls, 0);
-
     Dictionary source{{"v", 1}};
-    service->sendEventLazy("com.korvane.qvsound.Playback.Start", [&] {
+    const auto producer = [&] {
         ++calls;
         return source;
-    });
+    };
+    service->sendEventLazy("com.korvane.telephony.Playback.Start", producer);
+    EXPECT_EQ(calls, 0);
+    service->sendEventLazy("com.korvane.qvsound.Playback.Start", producer);
     EXPECT_EQ(calls, 1) << "called before sendEventLazy returns";
-    source.set("v", 2);  // a later change must not reach the recorded event
+    source.set("v", 2);
     service->sendEventLazy("com.korvane.qvsound.Playback.Stop", {});  // no producer: ignored
     service->flush();
 
@@ -127,18 +109,13 @@ TEST_F(ALinuxAnalyticsService, BuildsThePayloadAtOnceAndOnlyForEventsInUse) {
 }
 
 TEST_F(ALinuxAnalyticsService, RefusesAnEventsFileItCannotRead) {
-    const SinkCallbacks none;
-    auto missing = LinuxAnalyticsService::create((root / "state").string(), clock,
-                                                 (root / "no-such-file").string(), none);
-    EXPECT_FALSE(missing.service);
-    EXPECT_NE(missing.error.find("no-such-file"), std::string::npos) << missing.error;
-
-    // A directory opens but cannot be read: an error, not an empty list of events.
-    fs::create_directories(root / "adir");
-    auto directory = LinuxAnalyticsService::create((root / "state").string(), clock,
-                                                   (root / "adir").string(), none);
-    EXPECT_FALSE(directory.service);
-    EXPECT_NE(directory.error.find("adir"), std::string::npos) << directory.error;
+    for (const char* name : {"no-such-file", "adir"}) {  // a directory opens but cannot be read
+        fs::create_directories(root / "adir");
+        auto created = LinuxAnalyticsService::create((root / "state").string(), clock,
+                                                     (root / name).string(), {});
+        EXPECT_FALSE(created.service) << name;
+        EXPECT_NE(created.error.find(name), std::string::npos) << created.error;
+    }
 }
 
 }  // namespace

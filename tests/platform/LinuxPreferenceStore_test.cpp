@@ -6,7 +6,7 @@
 
 #include <sys/stat.h>
 
-#include <cstdlib>
+#include <algorithm>
 #include <filesystem>
 #include <fstream>
 #include <limits>
@@ -62,23 +62,17 @@ class ALinuxPreferenceStore : public ::testing::Test {
 
 TEST_F(ALinuxPreferenceStore, WritesAtomicallyAndASecondStoreReadsEveryKindOfValue) {
     LinuxPreferenceStore writer(stateDir.string(), recordErrors());
-    EXPECT_TRUE(fs::is_directory(stateDir / "defaults"));
-    Dictionary nested{{"inner", Value(Array{Value(1), Value("two")})}};
-    const std::pair<std::string, Value> entries[] = {
-        {"flag", Value(true)},
-        {"count", Value(std::int64_t{-7})},
-        {"big", Value(std::numeric_limits<std::uint64_t>::max())},
-        {"ratio", Value(0.1 + 0.2)},
-        {"device_name", Value("Den")},
-        {"nested", Value(nested)},
-    };
+    const Dictionary entries{{"flag", Value(true)},
+                             {"count", Value(std::int64_t{-7})},
+                             {"big", Value(std::numeric_limits<std::uint64_t>::max())},
+                             {"ratio", Value(0.1 + 0.2)},
+                             {"nested", Value(Dictionary{{"inner", Value(Array{1, "two"})}})}};
     for (const auto& [key, value] : entries) {
         ASSERT_TRUE(writer.setValue("com.korvane.qvsound", key, value));
     }
-    // Replacing a key keeps its place.
-    ASSERT_TRUE(writer.setValue("com.korvane.qvsound", "flag", Value(false)));
+    ASSERT_TRUE(writer.setValue("com.korvane.qvsound", "flag", Value(true)));  // keeps its place
 
-    // Nothing but the suite's file is left behind: no temporary files.
+    // No temporary file is left behind.
     EXPECT_EQ(filesBelowRoot(), (std::set<std::string>{"state/defaults/com.korvane.qvsound.json"}));
     struct stat info {};
     ASSERT_EQ(::stat((stateDir / "defaults/com.korvane.qvsound.json").c_str(), &info), 0);
@@ -86,19 +80,12 @@ TEST_F(ALinuxPreferenceStore, WritesAtomicallyAndASecondStoreReadsEveryKindOfVal
 
     LinuxPreferenceStore reader(stateDir.string(), recordErrors());
     const Dictionary read = reader.values("com.korvane.qvsound");
-    ASSERT_EQ(read.size(), std::size(entries));
-    auto it = read.begin();
-    EXPECT_EQ(it->first, "flag");
-    EXPECT_EQ(it->second, Value(false));
-    for (std::size_t i = 1; i < std::size(entries); ++i) {
-        ++it;
-        EXPECT_EQ(it->first, entries[i].first);
-        EXPECT_EQ(it->second, entries[i].second) << entries[i].first;
-        EXPECT_EQ(it->second.kind(), entries[i].second.kind()) << entries[i].first;
-    }
-    EXPECT_EQ(reader.value("com.korvane.qvsound", "device_name"), Value("Den"));
+    EXPECT_EQ(read, entries);
+    ASSERT_TRUE(std::equal(read.begin(), read.end(), entries.begin(), entries.end(),
+                           [](const auto& x, const auto& y) {
+                               return x.first == y.first && x.second.kind() == y.second.kind();
+                           }));
     EXPECT_FALSE(reader.value("com.korvane.qvsound", "absent"));
-    EXPECT_TRUE(reader.values("com.korvane.other").empty());
     EXPECT_TRUE(errorsSoFar().empty());
 }
 
@@ -107,26 +94,20 @@ TEST_F(ALinuxPreferenceStore, SeesChangesMadeByOtherWritersEvenWithinOneTimestam
     LinuxPreferenceStore other(stateDir.string(), recordErrors());
     ASSERT_TRUE(store.setValue("suite", "k", Value(1)));
     EXPECT_EQ(store.value("suite", "k"), Value(1));
-
-    // Another store (as another process would) replaces the file.
     ASSERT_TRUE(other.setValue("suite", "k", Value(2)));
     EXPECT_EQ(store.value("suite", "k"), Value(2));
 
-    // A hand edit that rewrites the same file in place with contents of the same size, right
-    // after a read: inode and size stay, and the time may too.
+    // Rewritten in place with the same size right after a read, within one file-clock tick.
     const fs::path file = store.pathForSuite("suite");
     writeText(file, R"({"k": 3})");
     const auto tick = fs::last_write_time(file);
     EXPECT_EQ(store.value("suite", "k"), Value(3));
     writeText(file, R"({"k": 4})");
-    fs::last_write_time(file, tick);  // as if both writes fell in one tick of the file clock
+    fs::last_write_time(file, tick);
     EXPECT_EQ(store.value("suite", "k"), Value(4));
 
-    // The file going away empties the suite.
     fs::remove(file);
     EXPECT_TRUE(store.values("suite").empty());
-
-    // Removing keys: a missing key changes nothing and succeeds.
     ASSERT_TRUE(other.setValue("suite", "a", Value("x")));
     ASSERT_TRUE(other.setValue("suite", "b", Value("y")));
     EXPECT_TRUE(store.removeValue("suite", "a"));
@@ -135,53 +116,36 @@ TEST_F(ALinuxPreferenceStore, SeesChangesMadeByOtherWritersEvenWithinOneTimestam
     EXPECT_TRUE(errorsSoFar().empty());
 }
 
-TEST_F(ALinuxPreferenceStore, ReadsMalformedOrUnreadableFilesAsEmptyAndLeavesThemAlone) {
+TEST_F(ALinuxPreferenceStore, ReadsMalformedFilesAsEmptyReportsEachVersionOnceAndLeavesThemAlone) {
     LinuxPreferenceStore store(stateDir.string(), recordErrors());
     const fs::path bad = store.pathForSuite("bad");
     writeText(bad, "{\"k\": 1, oops");
-    EXPECT_TRUE(store.values("bad").empty());
-    EXPECT_FALSE(store.value("bad", "k"));
+    for (int i = 0; i < 3; ++i) {
+        EXPECT_FALSE(store.value("bad", "k"));
+    }
     ASSERT_EQ(errorsSoFar().size(), 1u);
     EXPECT_NE(errorsSoFar()[0].find(bad.string()), std::string::npos);
     EXPECT_NE(errorsSoFar()[0].find("not valid JSON"), std::string::npos);
-
+    // An older time is another version of the file.
+    fs::last_write_time(bad, fs::last_write_time(bad) - std::chrono::seconds(10));
+    EXPECT_TRUE(store.values("bad").empty());
+    EXPECT_EQ(errorsSoFar().size(), 2u);
     // A change would throw the rest of the file away: refused, file untouched.
     EXPECT_FALSE(store.setValue("bad", "k", Value(2)));
     EXPECT_EQ(readText(bad), "{\"k\": 1, oops");
 
-    // Other shapes that are not a suite.
     writeText(store.pathForSuite("array"), "[1, 2]");
-    EXPECT_TRUE(store.values("array").empty());
     writeText(store.pathForSuite("deep"), std::string(100000, '[') + std::string(100000, ']'));
-    EXPECT_TRUE(store.values("deep").empty());
-    writeText(store.pathForSuite("empty"), "");
-    EXPECT_TRUE(store.values("empty").empty());
     fs::create_directory(store.pathForSuite("directory"));
-    EXPECT_TRUE(store.values("directory").empty());
+    for (const char* suite : {"array", "deep", "directory"}) {
+        EXPECT_TRUE(store.values(suite).empty()) << suite;
+    }
     EXPECT_FALSE(store.setValue("directory", "k", Value(1)));
     EXPECT_TRUE(fs::is_directory(store.pathForSuite("directory")));
 
-    // Once fixed, the file is read again.
     writeText(bad, R"({"k": 5, "ok": true})");
-    EXPECT_EQ(store.value("bad", "k"), Value(5));
     EXPECT_TRUE(store.setValue("bad", "k", Value(6)));
     EXPECT_EQ(store.values("bad"), (Dictionary{{"k", Value(6)}, {"ok", Value(true)}}));
-}
-
-TEST_F(ALinuxPreferenceStore, ReportsAMalformedFileOncePerVersionOfIt) {
-    LinuxPreferenceStore store(stateDir.string(), recordErrors());
-    const fs::path bad = store.pathForSuite("bad");
-    writeText(bad, "not json");
-    for (int i = 0; i < 3; ++i) {
-        EXPECT_TRUE(store.values("bad").empty());
-    }
-    EXPECT_EQ(errorsSoFar().size(), 1u);
-    // An older time is another version of the file; it is old enough for its copy to be kept.
-    fs::last_write_time(bad, fs::last_write_time(bad) - std::chrono::seconds(10));
-    for (int i = 0; i < 3; ++i) {
-        EXPECT_TRUE(store.values("bad").empty());
-    }
-    EXPECT_EQ(errorsSoFar().size(), 2u);
 }
 
 TEST_F(ALinuxPreferenceStore, KeepsHostileSuiteNamesInsideItsDirectoryAndApart) {

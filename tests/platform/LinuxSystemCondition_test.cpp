@@ -39,8 +39,6 @@ class ALinuxSystemCondition : public ::testing::Test {
 };
 
 TEST_F(ALinuxSystemCondition, TakesTheHottestVerdictOfTheZonesItCanRead) {
-    EXPECT_EQ(condition.thermalState(), ThermalState::Unknown) << "no thermal zones at all";
-    write("sys/class/thermal/cooling_device0/type", "Fan\n");
     write("sys/class/thermal/thermal_zone9/type", "x86_pkg_temp\n");  // no temperature to read
     EXPECT_EQ(condition.thermalState(), ThermalState::Unknown);
 
@@ -55,7 +53,6 @@ TEST_F(ALinuxSystemCondition, TakesTheHottestVerdictOfTheZonesItCanRead) {
 }
 
 TEST_F(ALinuxSystemCondition, SavesPowerWhenTheProfileSaysSo) {
-    EXPECT_FALSE(condition.lowPowerModeEnabled());
     write("sys/firmware/acpi/platform_profile", "low-power\n");
     EXPECT_TRUE(condition.lowPowerModeEnabled());
     // The profile daemon's choice wins over the firmware's.
@@ -80,9 +77,6 @@ TEST_F(ALinuxSystemCondition, ReadsItsFootprintAndTheLoadOrSaysWhyNot) {
 
     write("proc/self/statm", "garbage\n");
     EXPECT_FALSE(condition.ownMemoryFootprint(error));
-    // The real files of this machine read too.
-    LinuxSystemCondition real;
-    EXPECT_GT(real.ownMemoryFootprint(error).value_or(0), 0u);
 }
 
 }  // namespace
