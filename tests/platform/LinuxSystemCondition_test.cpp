@@ -15,7 +15,7 @@ namespace {
 
 namespace fs = std::filesystem;
 
-// A tree shaped like / with only the files a test writes.
+// A root directory holding only the files a test writes.
 class ALinuxSystemCondition : public ::testing::Test {
   protected:
     void write(const std::string& relative, const std::string& text) {
@@ -52,29 +52,21 @@ TEST_F(ALinuxSystemCondition, TakesTheHottestVerdictOfTheZonesItCanRead) {
     EXPECT_EQ(condition.thermalState(), ThermalState::Critical);
 }
 
-TEST_F(ALinuxSystemCondition, SavesPowerWhenTheProfileSaysSo) {
+TEST_F(ALinuxSystemCondition, ReadsPowerProfileFootprintAndLoadOrSaysWhyNot) {
+    std::string error;
+    EXPECT_FALSE(condition.ownMemoryFootprint(error));
+    EXPECT_FALSE(error.empty());
     write("sys/firmware/acpi/platform_profile", "low-power\n");
     EXPECT_TRUE(condition.lowPowerModeEnabled());
     // The profile daemon's choice wins over the firmware's.
     write("var/lib/power-profiles-daemon/state.ini", "[State]\nProfile=balanced\n");
     EXPECT_FALSE(condition.lowPowerModeEnabled());
-    write("var/lib/power-profiles-daemon/state.ini", "[State]\nProfile=power-saver\n");
-    EXPECT_TRUE(condition.lowPowerModeEnabled());
-}
-
-TEST_F(ALinuxSystemCondition, ReadsItsFootprintAndTheLoadOrSaysWhyNot) {
-    std::string error;
-    EXPECT_FALSE(condition.ownMemoryFootprint(error));
-    EXPECT_FALSE(error.empty());
-    EXPECT_EQ(condition.loadAverages(), (std::array<double, 3>{0.0, 0.0, 0.0}));
 
     write("proc/self/statm", "1000 25 10 5 0 100 0\n");
     write("proc/loadavg", "0.52 1.50 2.25 1/234 5678\n");
-    error.clear();
     EXPECT_EQ(condition.ownMemoryFootprint(error),
               std::uint64_t{25} * static_cast<std::uint64_t>(::sysconf(_SC_PAGESIZE)));
     EXPECT_EQ(condition.loadAverages(), (std::array<double, 3>{0.52, 1.5, 2.25}));
-
     write("proc/self/statm", "garbage\n");
     EXPECT_FALSE(condition.ownMemoryFootprint(error));
 }
