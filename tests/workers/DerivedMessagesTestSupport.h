@@ -28,8 +28,4 @@ inline std::shared_ptr<QVReportingSession> sessionWith(const Platform& platform,
     return session;
 }
 
-inline std::vector<Dictionary::Entry> entriesOf(const QVReportingSessionMessage& message) {
-    return {message.message().begin(), message.message().end()};
-}
-
 }  // namespace qv::test

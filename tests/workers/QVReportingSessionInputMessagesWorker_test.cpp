@@ -77,6 +77,7 @@ TEST(AnInputMessagesWorker, ReportsStretchesClosedOnlyByStopDurationOrDevices) {
           off(nullptr), on(10), off(true)},
          {{2, "1", "7:16000", "unknown"}}},
     };
+    EXPECT_TRUE(derive(fake.platform, {}, cases[0].in, std::nullopt).empty()) << "no process";
     for (const auto& c : cases) {
         SCOPED_TRACE(c.name);
         const Messages out = derive(fake.platform, c.previous, c.in);
@@ -94,27 +95,6 @@ TEST(AnInputMessagesWorker, ReportsStretchesClosedOnlyByStopDurationOrDevices) {
             EXPECT_EQ(*p.find("active_devices"), devices);
         }
     }
-}
-
-TEST(AnInputMessagesWorker, BuildsItsPayloadInAFixedOrder) {
-    FakePlatform fake;
-    const Messages in{codec(0, "A", "16000", true), set(0.5, "active_devices", "hs"), off(9.3)};
-    EXPECT_TRUE(derive(fake.platform, {}, in, std::nullopt).empty()) << "no process, no message";
-
-    const Messages out = derive(fake.platform, {{"vp_config_operation_mode", "voice"}}, in);
-    ASSERT_EQ(out.size(), 1u);
-    EXPECT_EQ(out[0]->category(), category::kInput);
-    EXPECT_EQ(out[0]->type(), type::kSummary);
-    EXPECT_EQ(entriesOf(*out[0]),
-              (std::vector<Dictionary::Entry>{{"HostApplicationDisplayID", "recorder"},
-                                              {"inputrunning_seconds", double{9.3f}},
-                                              {"inputrunning_secondsBucketed", "10"},
-                                              {"msgidx", 1},
-                                              {"vp_config_operation_mode", "voice"},
-                                              {"vp_config_input_port", "unknown"},
-                                              {"active_devices", "hs"},
-                                              {"vocoders", "A:16000"},
-                                              {"msgcnt", 1u}}));
 }
 
 }  // namespace

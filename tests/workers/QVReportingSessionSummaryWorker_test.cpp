@@ -17,7 +17,7 @@ namespace {
 
 constexpr const char* kSummaryEvent = "com.korvane.qvsound.Session_Generic.Summary";
 
-// Sessions with the summary worker and MetricsHub, which hands the summary to the fake analytics.
+// MetricsHub hands the summary to the fake analytics.
 class ASummaryWorker : public ::testing::Test {
   protected:
     void SetUp() override {
@@ -87,14 +87,16 @@ TEST_F(ASummaryWorker, DescribesTheSessionAndTheDeviceInItsFixedKeyOrder) {
     fake.condition.loads = {0.5, 1.25, 2.0};
 
     const Dictionary summary = stopAndGetSummary();
+    // No activity: an average of zero, not a division by zero; the two state messages are stored
+    // without being received.
     const std::vector<Dictionary::Entry> expected = {
         {"total_active_time", 0.0},
         {"active_count", 0u},
         {"overload_count", 0u},
-        {"average_active_time", 0.0},  // not a division by zero
+        {"average_active_time", 0.0},
         {"num_messages", 0},
         {"num_unique_messages", 2u},
-        {"num_redundant_messages", 0u},  // the two state messages are stored, never received
+        {"num_redundant_messages", 0u},
         {"singleMessageSession", false},
         {"summaryServiceName", "longformaudio"},
         {"HostApplicationDisplayID", "com.example.music"},
