@@ -2,7 +2,6 @@
 
 #include <filesystem>
 #include <fstream>
-#include <map>
 #include <string>
 
 #include <gtest/gtest.h>
@@ -39,36 +38,6 @@ TEST(TheCtlVocabulary, ReadsNumbersAtTheirLimitsAndOnlyNamesThatStandForOneValue
     EXPECT_EQ(QVReportingCtlParseReporterID("-9223372036854775808"), INT64_MIN);
     EXPECT_EQ(QVReportingCtlParseReporterID("9223372036854775808"), std::nullopt);
     EXPECT_EQ(QVReportingCtlParseReporterID("5x"), std::nullopt);
-}
-
-TEST(TheCtlStateDirectory, FollowsTheDaemonsOrderOfChoices) {
-    std::map<std::string, std::string> env;
-    const auto lookup = [&](const char* name) -> const char* {
-        auto it = env.find(name);
-        return it == env.end() ? nullptr : it->second.c_str();
-    };
-    env = {{"STATE_DIRECTORY", "/var/lib/a:/var/lib/b"}, {"HOME", "/home/u"}};
-    EXPECT_EQ(QVReportingCtlDefaultStateDirectory(lookup, 0), "/var/lib/a");
-    env = {{"STATE_DIRECTORY", ""}, {"XDG_STATE_HOME", "/x"}, {"HOME", "/home/u"}};
-    EXPECT_EQ(QVReportingCtlDefaultStateDirectory(lookup, 0), "/var/lib/qvreportd");
-    EXPECT_EQ(QVReportingCtlDefaultStateDirectory(lookup, 1000), "/x/qvreportd");
-    env = {};
-    EXPECT_EQ(QVReportingCtlDefaultStateDirectory(lookup, 1000), "/tmp/.local/state/qvreportd");
-}
-
-TEST(ASinkLineFormatter, ShowsUTCTimesRoundedDownAndDecodesOnlyMTXRecords) {
-    EXPECT_EQ(QVReportingCtlFormatUTC(1.9999), "1970-01-01T00:00:01.999Z");
-    EXPECT_EQ(QVReportingCtlFormatUTC(-0.5), "1969-12-31T23:59:59.500Z");
-    const std::string mtx = R"({"time":0.5,"metric":"AudioIssueDetected","record":"CAH/"})";
-    EXPECT_EQ(
-        QVReportingCtlFormatSinkLine("mtx", mtx, false),
-        R"(1970-01-01T00:00:00.500Z mtx {"metric":"AudioIssueDetected","record_hex":"0801ff"})");
-    EXPECT_EQ(QVReportingCtlFormatSinkLine("analytics", R"({"time":0,"record":"CAH/"})", true),
-              R"({"sink":"analytics","time":0,"record":"CAH/"})");
-    EXPECT_EQ(QVReportingCtlFormatSinkLine("mtx", R"({"time":0,"record":"CAH"})", false),
-              R"(1970-01-01T00:00:00.000Z mtx {"record":"CAH"})");  // bad base64 left alone
-    EXPECT_EQ(QVReportingCtlFormatSinkLine("convo", "[1]", true),
-              R"({"sink":"convo","unreadable":"[1]"})");
 }
 
 TEST(ASinkTail, HoldsBackPartialLinesAndStartsOverWhenTheFileIsTruncatedOrReplaced) {

@@ -78,40 +78,16 @@ TEST(AReplayScriptParser, RefusesMalformedLinesAndArgumentsOutsideTheirRange) {
     }
 }
 
-TEST(AReplayScriptParser, NumbersLinesFromTheFileAndStopsAtTheFirstBadOne) {
-    std::istringstream script(
-        "{\"op\":\"create\",\"id\":5}\n"
-        "\n"
-        "   \r\n"
-        "{\"op\":\"start\",\"id\":5}\n"
-        "{\"op\":\"stop\"}\n"
-        "{\"op\":\"nonsense\"}\n");
+TEST(AReplayScriptParser, NumbersLinesStopsAtTheFirstBadOneAndAcceptsTheShippedExamples) {
+    std::istringstream script("{\"op\":\"create\",\"id\":5}\n\n   \r\n{\"op\":\"stop\"}\n");
     auto result = QVReportingParseReplayScript(script);
     ASSERT_TRUE(std::holds_alternative<QVReportingReplayError>(result));
-    EXPECT_EQ(std::get<QVReportingReplayError>(result).line, 5u);
-
-    std::istringstream good("{\"op\":\"create\",\"id\":5}\n\n{\"op\":\"destroy\",\"id\":5}");
-    auto ops = QVReportingParseReplayScript(good);
-    ASSERT_TRUE(std::holds_alternative<std::vector<QVReportingReplayOperation>>(ops));
-    const auto& list = std::get<0>(ops);
-    ASSERT_EQ(list.size(), 2u);
-    EXPECT_EQ(list[1].line, 3u);  // a last line without a newline counts too
-    EXPECT_EQ(list[1].kind, Kind::Destroy);
-}
-
-TEST(AReplayScriptParser, AcceptsTheShippedExamples) {
+    EXPECT_EQ(std::get<QVReportingReplayError>(result).line, 4u);
     for (const char* name : {"playback.jsonl", "recording.jsonl"}) {
         std::ifstream in(std::string(QV_SOURCE_DIR) + "/examples/" + name);
-        ASSERT_TRUE(in) << name;
-        auto result = QVReportingParseReplayScript(in);
-        if (auto* error = std::get_if<QVReportingReplayError>(&result)) {
-            ADD_FAILURE() << name << ":" << error->line << ": " << error->message;
-            continue;
-        }
-        const auto& ops = std::get<0>(result);
-        ASSERT_FALSE(ops.empty()) << name;
-        EXPECT_EQ(ops.front().kind, Kind::Create) << name;
-        EXPECT_EQ(ops.back().kind, Kind::Destroy) << name;
+        auto ops = QVReportingParseReplayScript(in);
+        ASSERT_TRUE(std::holds_alternative<std::vector<QVReportingReplayOperation>>(ops)) << name;
+        EXPECT_EQ(std::get<0>(ops).back().kind, Kind::Destroy) << name;
     }
 }
 

@@ -83,8 +83,6 @@ class Bus:
         self.process = subprocess.Popen(args, stdout=subprocess.PIPE, stderr=subprocess.DEVNULL,
                                         text=True)
         self.address = self.process.stdout.readline().strip()
-        if not self.address:
-            raise RuntimeError("dbus-daemon did not start")
 
     def connect(self):
         return dbus.bus.BusConnection(self.address)
@@ -111,8 +109,6 @@ class Daemon:
             raise RuntimeError("qvreportd exited: " + self.log_text())
 
     def log_text(self):
-        if not self.log.closed:
-            self.log.flush()
         with open(self.log_path, errors="replace") as f:
             return f.read()
 
@@ -124,11 +120,11 @@ class Daemon:
             lines = [json.loads(line) for line in f if line.strip()]
         return [l for l in lines if l["event"].startswith(prefix)]
 
-    def stop(self, sig=signal.SIGTERM, timeout=10):
+    def stop(self):
         if self.process.poll() is None:
-            self.process.send_signal(sig)
+            self.process.send_signal(signal.SIGTERM)
         try:
-            return self.process.wait(timeout=timeout)
+            return self.process.wait(timeout=10)
         finally:
             self.log.close()
 
@@ -161,9 +157,6 @@ class Client:
     def stop(self, rid):
         return bool(self.reporting.StopReportingSession(dbus.Int64(rid)))
 
-    def close(self):
-        self.connection.close()
-
 
 class DaemonTestCase(unittest.TestCase):
     system_like = False
@@ -175,16 +168,11 @@ class DaemonTestCase(unittest.TestCase):
         state = os.path.join(self.workdir, "state")
         os.makedirs(state)
         self.daemon = Daemon(self.bus, state, *self.daemon_args)
-        self.clients = []
 
     def tearDown(self):
-        for c in self.clients:
-            c.close()
         self.daemon.stop()
         self.bus.stop()
         shutil.rmtree(self.workdir, ignore_errors=True)
 
     def client(self):
-        c = Client(self.bus)
-        self.clients.append(c)
-        return c
+        return Client(self.bus)

@@ -166,7 +166,7 @@ class Shutdown(DaemonTestCase):
         c.start(11)
         for i in range(200):
             c.send({"i": i}, PLAYBACK, START, [11])
-        self.assertEqual(self.daemon.stop(signal.SIGTERM), 0)
+        self.assertEqual(self.daemon.stop(), 0)
         self.assertEqual(len(self.daemon.events("com.korvane.qvsound.Playback.Start")), 200)
 
     def test_losing_the_bus_amid_a_sigterm_still_stops_cleanly(self):

@@ -80,26 +80,6 @@ TEST(ALinuxNotificationCenter, TellsThePostObserverAfterEveryPostAndLetsHandlers
     EXPECT_EQ(observed.size(), 3u);
 }
 
-TEST(ALinuxNotificationCenter, BoundsTheNamesItKeepsButAlwaysKeepsWatchedOnes) {
-    LinuxNotificationCenter center(/*maxNames=*/2);
-    ASSERT_TRUE(center.registerNotification("watched", inlineRunner(), [](Token) {}));
-    center.post("a", 1);
-    center.post("b", 2);
-    center.post("c", 3);  // table full: not kept
-    center.post("a", 4);  // known names still change
-    center.post("watched", 5);
-    EXPECT_EQ(center.stateOf("a"), 4u);
-    EXPECT_EQ(center.stateOf("c"), 0u);
-    EXPECT_EQ(center.stateOf("watched"), 5u);
-    EXPECT_EQ(center.droppedStates(), 1u);
-
-    // Overlong names are not kept even while there is room.
-    const std::string longest(LinuxNotificationCenter::kMaxNameLength, 'n');
-    LinuxNotificationCenter roomy;
-    roomy.post(longest + "n", 2);
-    EXPECT_EQ(roomy.droppedStates(), 1u);
-}
-
 TEST(ALinuxNotificationCenter, StaysConsistentUnderConcurrentPostsRegistrationsAndCancels) {
     LinuxNotificationCenter center;
     std::atomic<int> handled{0};
