@@ -6,9 +6,7 @@ import sys
 import unittest
 
 sys.path.insert(0, os.path.dirname(__file__))
-from harness import BUS_NAME, DaemonTestCase, INTERFACE, OBJECT_PATH, wait_until  # noqa: E402
-
-UNPRIVILEGED = "nobody"
+from harness import BUS_NAME, DaemonTestCase, INTERFACE, OBJECT_PATH  # noqa: E402
 
 CLIENT = """
 import dbus, sys
@@ -21,7 +19,6 @@ try:
     print("kill allowed")
 except dbus.exceptions.DBusException as e:
     print("kill refused", e.get_dbus_name())
-print("still there", bool(r.CreateReportingSession(dbus.Int64(32))))
 """.format(name=BUS_NAME, path=OBJECT_PATH, iface=INTERFACE)
 
 
@@ -30,19 +27,13 @@ class BusPolicy(DaemonTestCase):
     system_like = True
 
     def test_an_unprivileged_user_reports_but_cannot_kill_while_root_can(self):
-        out = subprocess.run(["runuser", "-u", UNPRIVILEGED, "--", "/usr/bin/python3", "-c", CLIENT,
+        out = subprocess.run(["runuser", "-u", "nobody", "--", "/usr/bin/python3", "-c", CLIENT,
                               self.bus.address], capture_output=True, text=True, timeout=60)
         self.assertEqual(out.returncode, 0, out.stderr)
-        lines = out.stdout.splitlines()
-        self.assertIn("create True", lines)
-        self.assertIn("reporters [31]", lines)
-        self.assertIn("kill refused org.freedesktop.DBus.Error.AccessDenied", lines)
-        self.assertIn("still there True", lines)
-
-        root = self.client()
-        root.reporting.KillService(ignore_reply=True)
+        self.assertEqual(out.stdout.splitlines(), [
+            "create True", "reporters [31]", "kill refused org.freedesktop.DBus.Error.AccessDenied"])
+        self.client().reporting.KillService(ignore_reply=True)
         self.assertEqual(self.daemon.process.wait(timeout=10), 2)
-        self.assertIn("DESTROYING SERVICE", self.daemon.log_text())
 
 
 if __name__ == "__main__":

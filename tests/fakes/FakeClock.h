@@ -20,7 +20,6 @@ class FakeClock : public Clock {
     double systemUptime() const override { return uptime_.load(); }
     long processCPUTime() const override { return cpu_.load(); }
 
-    // Moves every clock forward by the same amount.
     void advance(double seconds) {
         wall_.store(wall_.load() + seconds);
         steady_.store(steady_.load() + seconds);

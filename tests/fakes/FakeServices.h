@@ -1,6 +1,4 @@
-// In-memory fakes of the platform services that carry data: processes, preferences, named
-// notifications, analytics events and the device condition. Each records what it was asked, for the
-// test to check.
+// In-memory fakes of the platform services; each records what it was asked.
 #pragma once
 
 #include <map>
@@ -24,10 +22,9 @@ class FakeProcessInfo : public ProcessInfo {
         auto it = names.find(pid);
         return it == names.end() ? std::nullopt : std::optional<std::string>(it->second);
     }
-    std::int64_t ownProcessIdentifier() const override { return ownPid; }
+    std::int64_t ownProcessIdentifier() const override { return 4242; }
 
     std::map<std::int64_t, std::string> names;
-    std::int64_t ownPid = 4242;
 
   private:
     mutable std::mutex mutex_;
@@ -64,8 +61,7 @@ class FakePreferenceStore : public PreferenceStore {
     std::map<std::string, Dictionary> suites_;
 };
 
-// Handlers run through their runner at once, on the poster's thread; tests pass a runner that
-// posts to the queue they want.
+// Handlers run through their runner on the poster's thread.
 class FakeNotificationCenter : public NotificationCenter {
   public:
     std::optional<Token> registerNotification(std::string_view name, TaskRunner runner,
@@ -125,7 +121,7 @@ class FakeNotificationCenter : public NotificationCenter {
     std::map<std::string, std::uint64_t> states_;
 };
 
-// Records events; a name is used unless listed in unused. Producers run at once.
+// A name is used unless listed in unused; producers run at once.
 class FakeAnalyticsService : public AnalyticsService {
   public:
     struct Event {
@@ -145,7 +141,6 @@ class FakeAnalyticsService : public AnalyticsService {
     void sendEventLazy(std::string_view eventName, PayloadProducer producer) override {
         Dictionary payload = producer();
         std::lock_guard lock(mutex_);
-        ++producerCalls;
         events.push_back({std::string(eventName), std::move(payload)});
     }
     std::vector<Event> eventsNamed(std::string_view name) const {
@@ -161,13 +156,12 @@ class FakeAnalyticsService : public AnalyticsService {
     std::vector<std::string> unused;
     std::vector<Event> events;
     mutable std::vector<std::string> queried;
-    int producerCalls = 0;
 
   private:
     mutable std::mutex mutex_;
 };
 
-// A device condition set by the test; footprintError makes the memory query fail.
+// footprintError makes the memory query fail.
 class FakeSystemCondition : public SystemCondition {
   public:
     ThermalState thermalState() const override { return thermal; }

@@ -1,5 +1,4 @@
-// A log sink that keeps every line, for tests that check what was logged. Install it with
-// ScopedMemoryLog, which also turns debug lines on and restores the previous sink and level.
+// Keeps every logged line; ScopedMemoryLog installs it (debug on) and restores the previous sink.
 #pragma once
 
 #include <algorithm>
@@ -29,7 +28,6 @@ class MemoryLogSink : public LogSink {
         std::lock_guard lock(mutex_);
         return lines_;
     }
-    // Lines whose message (the text after the prefix) contains needle.
     std::size_t count(std::string_view needle) const {
         std::lock_guard lock(mutex_);
         return static_cast<std::size_t>(

@@ -1,5 +1,4 @@
-// A fresh directory under the system's temporary directory, removed with everything in it when
-// the object goes.
+// A fresh temporary directory, removed with its contents when the object goes.
 #pragma once
 
 #include <stdlib.h>

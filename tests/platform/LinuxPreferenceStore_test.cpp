@@ -1,12 +1,10 @@
 #include "platform/linux/LinuxPreferenceStore.h"
-#include "fakes/TempDirectory.h"
 
 #include <fmt/format.h>
 #include <gtest/gtest.h>
 
 #include <sys/stat.h>
 
-#include <cstdlib>
 #include <filesystem>
 #include <fstream>
 #include <limits>
@@ -15,6 +13,8 @@
 #include <thread>
 #include <vector>
 
+#include "fakes/TempDirectory.h"
+
 namespace qv {
 namespace {
 
@@ -22,166 +22,94 @@ namespace fs = std::filesystem;
 
 class ALinuxPreferenceStore : public ::testing::Test {
   protected:
-    void SetUp() override { stateDir = root / "state"; }
-
     LinuxPreferenceStore::ErrorCallback recordErrors() {
         return [this](const std::string& message) {
             std::lock_guard lock(errorsMutex);
             errors.push_back(message);
         };
     }
-    std::vector<std::string> errorsSoFar() {
-        std::lock_guard lock(errorsMutex);
-        return errors;
-    }
     static void writeText(const fs::path& path, const std::string& text) {
-        std::ofstream out(path, std::ios::binary | std::ios::trunc);
-        out << text;
+        std::ofstream(path, std::ios::binary | std::ios::trunc) << text;
     }
-    static std::string readText(const fs::path& path) {
-        std::ifstream in(path, std::ios::binary);
-        return std::string(std::istreambuf_iterator<char>(in), {});
-    }
-    // Every file below root, as paths relative to it.
     std::set<std::string> filesBelowRoot() const {
         std::set<std::string> files;
-        for (const auto& entry : fs::recursive_directory_iterator(root)) {
+        for (const auto& entry : fs::recursive_directory_iterator(tmp.path())) {
             if (!entry.is_directory()) {
-                files.insert(fs::relative(entry.path(), root).string());
+                files.insert(fs::relative(entry.path(), tmp.path()).string());
             }
         }
         return files;
     }
 
     test::TempDirectory tmp{"qvprefs"};
-    const fs::path root = tmp.path();
-    fs::path stateDir;
+    const fs::path stateDir = tmp.path() / "state";
     std::mutex errorsMutex;
-    std::vector<std::string> errors;
+    std::vector<std::string> errors;  // guarded by errorsMutex
 };
 
-TEST_F(ALinuxPreferenceStore, WritesAtomicallyAndASecondStoreReadsEveryKindOfValue) {
+TEST_F(ALinuxPreferenceStore, WritesAtomicallyAndOthersSeeEveryChangeEvenWithinOneTick) {
     LinuxPreferenceStore writer(stateDir.string(), recordErrors());
-    EXPECT_TRUE(fs::is_directory(stateDir / "defaults"));
-    Dictionary nested{{"inner", Value(Array{Value(1), Value("two")})}};
-    const std::pair<std::string, Value> entries[] = {
-        {"flag", Value(true)},
-        {"count", Value(std::int64_t{-7})},
-        {"big", Value(std::numeric_limits<std::uint64_t>::max())},
-        {"ratio", Value(0.1 + 0.2)},
-        {"device_name", Value("Den")},
-        {"nested", Value(nested)},
-    };
+    const Dictionary entries{{"flag", Value(true)},
+                             {"count", Value(std::int64_t{-7})},
+                             {"big", Value(std::numeric_limits<std::uint64_t>::max())},
+                             {"ratio", Value(0.1 + 0.2)},
+                             {"nested", Value(Dictionary{{"inner", Value(Array{1, "two"})}})}};
     for (const auto& [key, value] : entries) {
         ASSERT_TRUE(writer.setValue("com.korvane.qvsound", key, value));
     }
-    // Replacing a key keeps its place.
-    ASSERT_TRUE(writer.setValue("com.korvane.qvsound", "flag", Value(false)));
-
-    // Nothing but the suite's file is left behind: no temporary files.
-    EXPECT_EQ(filesBelowRoot(), (std::set<std::string>{"state/defaults/com.korvane.qvsound.json"}));
+    ASSERT_TRUE(writer.setValue("com.korvane.qvsound", "flag", Value(true)));  // keeps its place
+    EXPECT_EQ(filesBelowRoot(), (std::set<std::string>{"state/defaults/com.korvane.qvsound.json"}))
+        << "no temporary file left behind";
     struct stat info {};
     ASSERT_EQ(::stat((stateDir / "defaults/com.korvane.qvsound.json").c_str(), &info), 0);
     EXPECT_EQ(info.st_mode & 0777, 0644u);
 
     LinuxPreferenceStore reader(stateDir.string(), recordErrors());
     const Dictionary read = reader.values("com.korvane.qvsound");
-    ASSERT_EQ(read.size(), std::size(entries));
-    auto it = read.begin();
-    EXPECT_EQ(it->first, "flag");
-    EXPECT_EQ(it->second, Value(false));
-    for (std::size_t i = 1; i < std::size(entries); ++i) {
-        ++it;
-        EXPECT_EQ(it->first, entries[i].first);
-        EXPECT_EQ(it->second, entries[i].second) << entries[i].first;
-        EXPECT_EQ(it->second.kind(), entries[i].second.kind()) << entries[i].first;
-    }
-    EXPECT_EQ(reader.value("com.korvane.qvsound", "device_name"), Value("Den"));
-    EXPECT_FALSE(reader.value("com.korvane.qvsound", "absent"));
-    EXPECT_TRUE(reader.values("com.korvane.other").empty());
-    EXPECT_TRUE(errorsSoFar().empty());
-}
+    EXPECT_EQ(read, entries);
+    EXPECT_TRUE(std::equal(read.begin(), read.end(), entries.begin(), entries.end(),
+                           [](const auto& x, const auto& y) {
+                               return x.first == y.first && x.second.kind() == y.second.kind();
+                           }));
 
-TEST_F(ALinuxPreferenceStore, SeesChangesMadeByOtherWritersEvenWithinOneTimestampTick) {
-    LinuxPreferenceStore store(stateDir.string(), recordErrors());
-    LinuxPreferenceStore other(stateDir.string(), recordErrors());
-    ASSERT_TRUE(store.setValue("suite", "k", Value(1)));
-    EXPECT_EQ(store.value("suite", "k"), Value(1));
-
-    // Another store (as another process would) replaces the file.
-    ASSERT_TRUE(other.setValue("suite", "k", Value(2)));
-    EXPECT_EQ(store.value("suite", "k"), Value(2));
-
-    // A hand edit that rewrites the same file in place with contents of the same size, right
-    // after a read: inode and size stay, and the time may too.
-    const fs::path file = store.pathForSuite("suite");
+    // Rewritten in place with the same size right after a read, within one file-clock tick.
+    const fs::path file = reader.pathForSuite("suite");
+    ASSERT_TRUE(writer.setValue("suite", "k", Value(1)));
+    EXPECT_EQ(reader.value("suite", "k"), Value(1));
     writeText(file, R"({"k": 3})");
     const auto tick = fs::last_write_time(file);
-    EXPECT_EQ(store.value("suite", "k"), Value(3));
+    EXPECT_EQ(reader.value("suite", "k"), Value(3));
     writeText(file, R"({"k": 4})");
-    fs::last_write_time(file, tick);  // as if both writes fell in one tick of the file clock
-    EXPECT_EQ(store.value("suite", "k"), Value(4));
-
-    // The file going away empties the suite.
-    fs::remove(file);
-    EXPECT_TRUE(store.values("suite").empty());
-
-    // Removing keys: a missing key changes nothing and succeeds.
-    ASSERT_TRUE(other.setValue("suite", "a", Value("x")));
-    ASSERT_TRUE(other.setValue("suite", "b", Value("y")));
-    EXPECT_TRUE(store.removeValue("suite", "a"));
-    EXPECT_TRUE(store.removeValue("suite", "never-there"));
-    EXPECT_EQ(other.values("suite"), (Dictionary{{"b", Value("y")}}));
-    EXPECT_TRUE(errorsSoFar().empty());
+    fs::last_write_time(file, tick);
+    EXPECT_EQ(reader.value("suite", "k"), Value(4));
+    EXPECT_TRUE(writer.removeValue("suite", "k"));
+    EXPECT_TRUE(reader.values("suite").empty());
+    EXPECT_TRUE(errors.empty());
 }
 
-TEST_F(ALinuxPreferenceStore, ReadsMalformedOrUnreadableFilesAsEmptyAndLeavesThemAlone) {
+TEST_F(ALinuxPreferenceStore, ReadsMalformedFilesAsEmptyReportsEachVersionOnceAndLeavesThemAlone) {
     LinuxPreferenceStore store(stateDir.string(), recordErrors());
     const fs::path bad = store.pathForSuite("bad");
     writeText(bad, "{\"k\": 1, oops");
+    for (int i = 0; i < 3; ++i) {
+        EXPECT_FALSE(store.value("bad", "k"));
+    }
+    ASSERT_EQ(errors.size(), 1u);
+    EXPECT_NE(errors[0].find(bad.string() + " is not valid JSON"), std::string::npos) << errors[0];
+    fs::last_write_time(bad, fs::last_write_time(bad) - std::chrono::seconds(10));
     EXPECT_TRUE(store.values("bad").empty());
-    EXPECT_FALSE(store.value("bad", "k"));
-    ASSERT_EQ(errorsSoFar().size(), 1u);
-    EXPECT_NE(errorsSoFar()[0].find(bad.string()), std::string::npos);
-    EXPECT_NE(errorsSoFar()[0].find("not valid JSON"), std::string::npos);
-
-    // A change would throw the rest of the file away: refused, file untouched.
+    EXPECT_EQ(errors.size(), 2u) << "an older time is another version";
+    // A change would throw the rest of the file away: refused.
     EXPECT_FALSE(store.setValue("bad", "k", Value(2)));
-    EXPECT_EQ(readText(bad), "{\"k\": 1, oops");
+    EXPECT_EQ(fs::file_size(bad), 13u);
 
-    // Other shapes that are not a suite.
-    writeText(store.pathForSuite("array"), "[1, 2]");
-    EXPECT_TRUE(store.values("array").empty());
     writeText(store.pathForSuite("deep"), std::string(100000, '[') + std::string(100000, ']'));
     EXPECT_TRUE(store.values("deep").empty());
-    writeText(store.pathForSuite("empty"), "");
-    EXPECT_TRUE(store.values("empty").empty());
     fs::create_directory(store.pathForSuite("directory"));
-    EXPECT_TRUE(store.values("directory").empty());
     EXPECT_FALSE(store.setValue("directory", "k", Value(1)));
-    EXPECT_TRUE(fs::is_directory(store.pathForSuite("directory")));
-
-    // Once fixed, the file is read again.
     writeText(bad, R"({"k": 5, "ok": true})");
-    EXPECT_EQ(store.value("bad", "k"), Value(5));
     EXPECT_TRUE(store.setValue("bad", "k", Value(6)));
     EXPECT_EQ(store.values("bad"), (Dictionary{{"k", Value(6)}, {"ok", Value(true)}}));
-}
-
-TEST_F(ALinuxPreferenceStore, ReportsAMalformedFileOncePerVersionOfIt) {
-    LinuxPreferenceStore store(stateDir.string(), recordErrors());
-    const fs::path bad = store.pathForSuite("bad");
-    writeText(bad, "not json");
-    for (int i = 0; i < 3; ++i) {
-        EXPECT_TRUE(store.values("bad").empty());
-    }
-    EXPECT_EQ(errorsSoFar().size(), 1u);
-    // An older time is another version of the file; it is old enough for its copy to be kept.
-    fs::last_write_time(bad, fs::last_write_time(bad) - std::chrono::seconds(10));
-    for (int i = 0; i < 3; ++i) {
-        EXPECT_TRUE(store.values("bad").empty());
-    }
-    EXPECT_EQ(errorsSoFar().size(), 2u);
 }
 
 TEST_F(ALinuxPreferenceStore, KeepsHostileSuiteNamesInsideItsDirectoryAndApart) {
@@ -207,49 +135,28 @@ TEST_F(ALinuxPreferenceStore, KeepsHostileSuiteNamesInsideItsDirectoryAndApart) 
     for (const auto& file : files) {
         EXPECT_EQ(fs::path(file).parent_path(), fs::path("state/defaults")) << file;
     }
-    EXPECT_TRUE(errorsSoFar().empty());
 }
 
-TEST_F(ALinuxPreferenceStore, CreatesItsDirectoryAgainAndFailsCleanlyWhenItCannot) {
-    LinuxPreferenceStore store(stateDir.string(), recordErrors());
-    fs::remove_all(stateDir);
-    EXPECT_TRUE(store.setValue("suite", "k", Value(1)));
-    EXPECT_EQ(store.value("suite", "k"), Value(1));
-
-    // A file where the directory should be: writes fail and say why; reads are empty.
-    const fs::path blocked = root / "blocked";
-    fs::create_directories(blocked);
-    writeText(blocked / "defaults", "a file, not a directory");
-    LinuxPreferenceStore broken(blocked.string(), recordErrors());
-    const std::size_t before = errorsSoFar().size();
-    EXPECT_GE(before, 1u);
-    EXPECT_FALSE(broken.setValue("suite", "k", Value(1)));
-    EXPECT_GT(errorsSoFar().size(), before);
-    EXPECT_TRUE(broken.values("suite").empty());
-}
-
-TEST_F(ALinuxPreferenceStore, LosesNoWriteWhenStoresWriteOneSuiteAtOnce) {
+TEST_F(ALinuxPreferenceStore, LosesNoWriteWhenTwoStoresWriteOneSuiteAtOnce) {
     // Two stores stand for two processes: only the lock on the directory keeps them apart.
     LinuxPreferenceStore first(stateDir.string(), recordErrors());
     LinuxPreferenceStore second(stateDir.string(), recordErrors());
-    constexpr int kKeysPerThread = 20;
     std::vector<std::thread> threads;
     for (int t = 0; t < 4; ++t) {
         threads.emplace_back([&, t] {
-            LinuxPreferenceStore& store = t % 2 == 0 ? first : second;
-            for (int i = 0; i < kKeysPerThread; ++i) {
-                EXPECT_TRUE(store.setValue("shared", fmt::format("t{}_{}", t, i), Value(i)));
-                (void)store.values("shared");
+            for (int i = 0; i < 20; ++i) {
+                EXPECT_TRUE(
+                    (t % 2 ? first : second).setValue("shared", fmt::format("{}_{}", t, i), i));
+                (void)first.values("shared");
             }
         });
     }
     for (auto& thread : threads) {
         thread.join();
     }
-    const Dictionary all = first.values("shared");
-    EXPECT_EQ(all.size(), 4u * kKeysPerThread);
-    EXPECT_EQ(all, second.values("shared"));
-    EXPECT_TRUE(errorsSoFar().empty());
+    EXPECT_EQ(first.values("shared").size(), 80u);
+    EXPECT_EQ(first.values("shared"), second.values("shared"));
+    EXPECT_TRUE(errors.empty());
 }
 
 }  // namespace

@@ -6,9 +6,7 @@
 #include <tuple>
 
 #include "fakes/FakePlatform.h"
-#include "session/QVReportingWorkerRegistry.h"
 #include "workers/DerivedMessagesTestSupport.h"
-#include "workers/backends/QVReportingSessionMetricsHubWorker.h"
 
 namespace qv::test {
 namespace {
@@ -79,6 +77,7 @@ TEST(AnInputMessagesWorker, ReportsStretchesClosedOnlyByStopDurationOrDevices) {
           off(nullptr), on(10), off(true)},
          {{2, "1", "7:16000", "unknown"}}},
     };
+    EXPECT_TRUE(derive(fake.platform, {}, cases[0].in, std::nullopt).empty()) << "no process";
     for (const auto& c : cases) {
         SCOPED_TRACE(c.name);
         const Messages out = derive(fake.platform, c.previous, c.in);
@@ -96,87 +95,6 @@ TEST(AnInputMessagesWorker, ReportsStretchesClosedOnlyByStopDurationOrDevices) {
             EXPECT_EQ(*p.find("active_devices"), devices);
         }
     }
-}
-
-TEST(AnInputMessagesWorker, BuildsItsPayloadInAFixedOrderAndLogsEachStep) {
-    FakePlatform fake;
-    const auto in = [] {
-        return Messages{codec(0, "A", "16000", true), set(0.5, "active_devices", "hs"), off(9.3)};
-    };
-    EXPECT_TRUE(derive(fake.platform, {}, in(), std::nullopt).empty()) << "no process, no message";
-
-    ScopedMemoryLog log;
-    const Messages out = derive(fake.platform, {{"vp_config_operation_mode", "voice"}}, in());
-    ASSERT_EQ(out.size(), 1u);
-    EXPECT_EQ(out[0]->category(), category::kInput);
-    EXPECT_EQ(out[0]->type(), type::kSummary);
-    EXPECT_EQ(entriesOf(*out[0]),
-              (std::vector<Dictionary::Entry>{{"HostApplicationDisplayID", "recorder"},
-                                              {"inputrunning_seconds", double{9.3f}},
-                                              {"inputrunning_secondsBucketed", "10"},
-                                              {"msgidx", 1},
-                                              {"vp_config_operation_mode", "voice"},
-                                              {"vp_config_input_port", "unknown"},
-                                              {"active_devices", "hs"},
-                                              {"vocoders", "A:16000"},
-                                              {"msgcnt", 1u}}));
-
-    const std::string f = "func=createInputMessages";
-    EXPECT_EQ(derivationLines(*log, "createInputMessages"),
-              (std::vector<std::string>{
-                  "entering createInputMessages createInputMessages",
-                  "runningTime { " + f +
-                      ", runningTime=0.500000, qvTimestamp=0.5, qvTimestamp_double=0.500000, "
-                      "startQvTimestamp=0, startQvTimestamp_double=0.000000 }",
-                  "skipped input message, too short { " + f + ", action=skip, count=0 }",
-                  "runningTime { " + f +
-                      ", runningTime=9.300000, qvTimestamp=9.3, qvTimestamp_double=9.300000, "
-                      "startQvTimestamp=0, startQvTimestamp_double=0.000000 }",
-                  "added input message { " + f + ", action=add, count=1 }",
-                  "returning input messages { " + f + ", action=return, count=1 }"}));
-}
-
-// Both derived-message workers in a session ahead of a consumer: at stop, what they derive goes
-// through the session and reaches the analytics service, volume first.
-TEST(AnInputMessagesWorker, SendsWhatItDerivesIntoTheSessionAfterTheVolumeWorker) {
-    FakePlatform fake;
-    QVReportingWorkerRegistry::TEST_reset(
-        {&makeWorkerClass<QVReportingSessionVolumeMessagesWorker>(),
-         &makeWorkerClass<QVReportingSessionInputMessagesWorker>(),
-         &makeWorkerClass<QVReportingSessionMetricsHubWorker>()});
-    ScopedMemoryLog log(LogLevel::Default);
-    auto session = QVReportingSession::initWithID(fake.platform, 42, {1});
-    // An empty store derives nothing and says nothing.
-    QVReportingSessionVolumeMessagesWorker::initWithSession(session)->stop();
-    QVReportingSessionInputMessagesWorker::initWithSession(session)->stop();
-    EXPECT_TRUE(log->lines().empty());
-
-    const Dictionary config{{"HostApplicationDisplayID", "com.example.app"}};
-    session->updateConfigurationWithContentsOfConfiguration(&config);
-    session->start();
-    const double now = fake.clock.now();
-    session->sendMessage(at(now + 1, {{"session_output_running", true},
-                                      {"session_input_running", true},
-                                      {"KXSessionVolume", 0.25}}));
-    session->sendMessage(at(now + 31, {{"session_output_running", false}}));
-    session->sendMessage(off(now + 61));
-    fake.clock.advance(100);
-    session->stop();
-    QVReportingWorkerRegistry::TEST_reset({});
-
-    std::vector<std::pair<std::string, Value>> summaries;
-    for (const auto& e : fake.analytics.events) {
-        if (e.name.starts_with("com.korvane.qvsound.") && e.name.ends_with(".Summary")) {
-            EXPECT_EQ(*e.payload.find("HostApplicationDisplayID"), "com.example.app");
-            const Value* t = e.payload.find("play_seconds");
-            summaries.emplace_back(e.name, t ? *t : *e.payload.find("inputrunning_seconds"));
-        }
-    }
-    EXPECT_EQ(summaries, (std::vector<std::pair<std::string, Value>>{
-                             {"com.korvane.qvsound.Volume.Summary", 30},
-                             {"com.korvane.qvsound.Input.Summary", 60}}));
-    EXPECT_EQ(log->count("sending volume event for reporter 42"), 1u);
-    EXPECT_EQ(log->count("sending input summary event for reporter 42"), 1u);
 }
 
 }  // namespace

@@ -32,7 +32,7 @@ TEST(AVolumeMessagesWorker, ReportsEachStretchClosedByStopDurationOrAWatchedChan
         const char* name;
         Dictionary previous;
         Messages in;
-        // Per derived message: play time, its label, and entries the payload must hold.
+        // Per derived message: play time, its label, entries the payload must hold.
         std::vector<std::tuple<double, std::string, Dictionary>> out;
     };
     const std::vector<Case> cases = {
@@ -85,6 +85,7 @@ TEST(AVolumeMessagesWorker, ReportsEachStretchClosedByStopDurationOrAWatchedChan
          {{10, "10", {{"KXSessionVolume", "loud"}, {"KXSessionVolumeBucketed", "0.0"}}},
           {10, "10", {}}}},
     };
+    EXPECT_TRUE(derive(fake.platform, {}, cases[0].in, std::nullopt).empty()) << "no process";
     for (const auto& c : cases) {
         SCOPED_TRACE(c.name);
         const Messages out = derive(fake.platform, c.previous, c.in);
@@ -101,50 +102,6 @@ TEST(AVolumeMessagesWorker, ReportsEachStretchClosedByStopDurationOrAWatchedChan
             }
         }
     }
-}
-
-TEST(AVolumeMessagesWorker, BuildsItsPayloadInAFixedOrderAndLogsEveryClosedStretch) {
-    FakePlatform fake;
-    const auto in = [] {
-        return Messages{on(10, 1), off(20.1), on(21), set(nullptr, "session_duration", 1)};
-    };
-    EXPECT_TRUE(derive(fake.platform, {}, in(), std::nullopt).empty()) << "no process, no message";
-
-    ScopedMemoryLog log;
-    const Messages out = derive(fake.platform, {{"mChannelsPerFrame", 2}, {"unrelated", 1}}, in());
-    ASSERT_EQ(out.size(), 1u);
-    EXPECT_EQ(out[0]->category(), category::kVolume);
-    EXPECT_EQ(out[0]->type(), type::kSummary);
-    EXPECT_EQ(entriesOf(*out[0]),
-              (std::vector<Dictionary::Entry>{{"session_selected_format", "unknown"},
-                                              {"mFormatID", "unknown"},
-                                              {"active_devices", "unknown"},
-                                              {"HostApplicationDisplayID", "player"},
-                                              {"KXSessionVolume", 1},
-                                              {"KXSessionVolumeBucketed", "1.0"},
-                                              {"play_seconds", double{10.1f}},
-                                              {"spatial-audio-accessory-feature", false},
-                                              {"spatializationEnabled", false},
-                                              {"ringerstate", false},
-                                              {"mChannelsPerFrame", 2},
-                                              {"play_secondsBucketed", "10"},
-                                              {"msgidx", 1},
-                                              {"msgcnt", 1u}}));
-    EXPECT_EQ(out[0]->message().find("msgcnt")->kind(), Value::Kind::UInt);
-
-    // The stop at 20.1 is reported; the duration without a time is logged and skipped.
-    const std::string f = "func=createVolumeMessages";
-    EXPECT_EQ(derivationLines(*log, "createVolumeMessages"),
-              (std::vector<std::string>{
-                  "entering createVolumeMessages createVolumeMessages",
-                  "playingTime { " + f +
-                      ", playingTime=10.100000, qvTimestamp=20.1, qvTimestamp_double=20.100000, "
-                      "startQvTimestamp=10, startQvTimestamp_double=10.000000 }",
-                  "added volume message { " + f + ", action=add, count=1 }",
-                  "playingTime { " + f +
-                      ", playingTime=-21.000000, qvTimestamp=(null), qvTimestamp_double=0.000000, "
-                      "startQvTimestamp=21, startQvTimestamp_double=21.000000 }",
-                  "skipped volume message, too short { " + f + ", action=skip, count=1 }"}));
 }
 
 }  // namespace
