@@ -4,6 +4,7 @@
 
 #include <cmath>
 #include <random>
+#include <vector>
 
 #include "fakes/FakePlatform.h"
 #include "session/QVReportingWorkerRegistry.h"
@@ -32,15 +33,19 @@ class ASession : public ::testing::Test {
 TEST_F(ASession, ReplacesStaleOrUnreadableTimestampsAndKeepsRecentAndFutureOnes) {
     auto s = make();
     const double day = 86400;
-    const std::pair<Value, bool> cases[] = {
-        {Value(now() - 366 * day), true}, {Value(now() - 365 * day), false},
-        {Value(now() + 10 * day), false}, {Value("yesterday"), true},
-        {Value(std::nan("")), true},      {Value(), true},
-    };
+    // Built one by one: gcc 12 warns falsely about an array of Value temporaries under -O2.
+    std::vector<std::pair<Value, bool>> cases;
+    cases.emplace_back(now() - 366 * day, true);
+    cases.emplace_back(now() - 365 * day, false);
+    cases.emplace_back(now() + 10 * day, false);
+    cases.emplace_back("yesterday", true);
+    cases.emplace_back(std::nan(""), true);
+    cases.emplace_back(Value(), true);
     for (const auto& [sent, replaced] : cases) {
         auto m = msg({{"n", sent.description()}});
-        if (!sent.isNull())
+        if (!sent.isNull()) {
             m->message().set("qvreporting_timestamp", sent);
+        }
         s->sendMessage(m);
         const Dictionary& p = m->message();
         SCOPED_TRACE(sent.description());
