@@ -10,6 +10,7 @@
 #include "platform/Platform.h"
 #include "platform/linux/LinuxAnalyticsService.h"
 #include "platform/linux/LinuxClock.h"
+#include "platform/linux/LinuxConvoService.h"
 #include "platform/linux/LinuxDeviceInformation.h"
 #include "platform/linux/LinuxNotificationCenter.h"
 #include "platform/linux/LinuxPreferenceStore.h"
@@ -37,8 +38,11 @@ struct BenchPlatform {
     LinuxAnalyticsService::Created analytics =
         LinuxAnalyticsService::create(stateDir, clock, "", SinkCallbacks{});
     LinuxSystemCondition condition;
-    Platform platform{clock,    device, process, preferences, notifications, *analytics.service,
-                      condition};
+    LinuxConvoService convo{preferences, std::make_unique<JsonlSink>(
+                                             stateDir, std::string(LinuxConvoService::kSinkName),
+                                             clock, SinkCallbacks{})};
+    Platform platform{clock,     device, process, preferences, notifications, *analytics.service,
+                      condition, convo};
 };
 
 }  // namespace qv::bench

@@ -7,6 +7,7 @@ namespace qv {
 
 class AnalyticsService;
 class Clock;
+class ConvoService;
 class DeviceInformation;
 class NotificationCenter;
 class PreferenceStore;
@@ -21,6 +22,7 @@ struct Platform {
     NotificationCenter& notifications;
     AnalyticsService& analytics;
     SystemCondition& condition;
+    ConvoService& convo;
 };
 
 }  // namespace qv

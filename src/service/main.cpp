@@ -16,6 +16,7 @@
 #include "monitoring/QVReportingSystemMonitor.h"
 #include "platform/linux/LinuxAnalyticsService.h"
 #include "platform/linux/LinuxClock.h"
+#include "platform/linux/LinuxConvoService.h"
 #include "platform/linux/LinuxDeviceInformation.h"
 #include "platform/linux/LinuxNotificationCenter.h"
 #include "platform/linux/LinuxPreferenceStore.h"
@@ -111,8 +112,12 @@ int main(int argc, char** argv) {
         return 1;
     }
     LinuxSystemCondition condition;
+    LinuxConvoService convo(
+        preferences,
+        std::make_unique<JsonlSink>(options->stateDir, std::string(LinuxConvoService::kSinkName),
+                                    clock, sinkCallbacks));
     const Platform platform{
-        clock, device, process, preferences, notifications, *analytics.service, condition};
+        clock, device, process, preferences, notifications, *analytics.service, condition, convo};
 
     QVReportingWorkerRegistry::setAllWorkerClasses(QVReportingAllWorkerClasses());
     SerialQueue& queue = QVReportingUtilityGetReportingServerQueue();
@@ -141,6 +146,7 @@ int main(int argc, char** argv) {
     server->flush();
     server.reset();
     analytics.service->flush();
+    convo.flush();
     QVReportingSystemMonitor::reset();
     QVLOG_DEFAULT(logCategory(), "stopped");
     if (auto sink = logSink()) {

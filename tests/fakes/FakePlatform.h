@@ -2,6 +2,7 @@
 #pragma once
 
 #include "fakes/FakeClock.h"
+#include "fakes/FakeConvoService.h"
 #include "fakes/FakeDeviceInformation.h"
 #include "fakes/FakeServices.h"
 #include "platform/Platform.h"
@@ -9,6 +10,20 @@
 namespace qv::test {
 
 struct FakePlatform {
+    // Services a test puts in place of the fakes; those left null stay the fakes.
+    struct Replacements {
+        AnalyticsService* analytics = nullptr;
+        ConvoService* convo = nullptr;
+    };
+
+    // The fakes' platform with some services replaced, for a test that brings its own.
+    Platform with(const Replacements& r) {
+        return Platform{clock,         device,
+                        process,       preferences,
+                        notifications, r.analytics ? *r.analytics : analytics,
+                        condition,     r.convo ? *r.convo : convo};
+    }
+
     FakeClock clock;
     FakeDeviceInformation device;
     FakeProcessInfo process;
@@ -16,7 +31,8 @@ struct FakePlatform {
     FakeNotificationCenter notifications;
     FakeAnalyticsService analytics;
     FakeSystemCondition condition;
-    Platform platform{clock, device, process, preferences, notifications, analytics, condition};
+    FakeConvoService convo;
+    Platform platform = with({});
 };
 
 }  // namespace qv::test

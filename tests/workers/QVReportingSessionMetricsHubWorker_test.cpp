@@ -92,8 +92,7 @@ TEST_F(AMetricsHubWorker, OffersEachMessageUnchangedUnderTheQVSoundNameThenTheSe
 
 TEST_F(AMetricsHubWorker, GivesEachEventItsOwnCopyTakenWhenTheBackendAsks) {
     DeferringAnalytics analytics;
-    const Platform platform{fake.clock,         fake.device, fake.process,  fake.preferences,
-                            fake.notifications, analytics,   fake.condition};
+    const Platform platform = fake.with({.analytics = &analytics});
     auto session = make(platform);
     auto sent = message({{"level", 3}}, category::kOutput, type::kSetup);
     session->sendMessage(sent);
