@@ -3,11 +3,13 @@
 #include <fmt/format.h>
 
 #include <algorithm>
+#include <charconv>
 #include <cmath>
 #include <ctime>
 #include <functional>
 #include <iterator>
 #include <limits>
+#include <system_error>
 
 namespace qv {
 
@@ -219,6 +221,123 @@ std::optional<std::uint64_t> Value::asUInt64() const {
         return *u;
     }
     return std::nullopt;
+}
+
+namespace {
+
+bool isBlank(char c) {
+    return c == ' ' || c == '\t' || c == '\n' || c == '\r' || c == '\v' || c == '\f';
+}
+
+bool isDigit(char c) {
+    return c >= '0' && c <= '9';
+}
+
+// The decimal number text starts with, after white space: [sign] digits [. digits] [exponent];
+// empty when text does not start with one.
+std::string_view leadingNumber(std::string_view text, bool integerOnly) {
+    std::size_t i = 0;
+    while (i < text.size() && isBlank(text[i])) {
+        ++i;
+    }
+    const std::size_t start = i;
+    if (i < text.size() && (text[i] == '+' || text[i] == '-')) {
+        ++i;
+    }
+    std::size_t digits = 0;
+    while (i < text.size() && isDigit(text[i])) {
+        ++i;
+        ++digits;
+    }
+    if (!integerOnly && i < text.size() && text[i] == '.') {
+        ++i;
+        while (i < text.size() && isDigit(text[i])) {
+            ++i;
+            ++digits;
+        }
+    }
+    if (digits == 0) {
+        return {};
+    }
+    if (!integerOnly && i < text.size() && (text[i] == 'e' || text[i] == 'E')) {
+        std::size_t j = i + 1;
+        if (j < text.size() && (text[j] == '+' || text[j] == '-')) {
+            ++j;
+        }
+        if (j < text.size() && isDigit(text[j])) {
+            while (j < text.size() && isDigit(text[j])) {
+                ++j;
+            }
+            i = j;
+        }
+    }
+    return text.substr(start, i - start);
+}
+
+double leadingDouble(std::string_view text) {
+    std::string_view number = leadingNumber(text, /*integerOnly=*/false);
+    if (number.empty()) {
+        return 0.0;
+    }
+    const bool negative = number.front() == '-';
+    if (number.front() == '+' || negative) {
+        number.remove_prefix(1);  // from_chars takes no '+', and reads the sign below
+    }
+    double d = 0.0;
+    const auto [end, error] = std::from_chars(number.data(), number.data() + number.size(), d);
+    if (error == std::errc::result_out_of_range) {
+        // Too large reads as infinity; too small to hold reads as zero.
+        const bool tooLarge = [&] {
+            const auto e = number.find_first_of("eE");
+            return e == std::string_view::npos || number[e + 1] != '-';
+        }();
+        d = tooLarge ? std::numeric_limits<double>::infinity() : 0.0;
+    }
+    return negative ? -d : d;
+}
+
+std::int64_t leadingInteger(std::string_view text) {
+    std::string_view number = leadingNumber(text, /*integerOnly=*/true);
+    if (number.empty()) {
+        return 0;
+    }
+    const bool negative = number.front() == '-';
+    if (number.front() == '+') {
+        number.remove_prefix(1);
+    }
+    std::int64_t n = 0;
+    const auto [end, error] = std::from_chars(number.data(), number.data() + number.size(), n);
+    if (error == std::errc::result_out_of_range) {
+        return negative ? std::numeric_limits<std::int64_t>::min()
+                        : std::numeric_limits<std::int64_t>::max();
+    }
+    return n;
+}
+
+}  // namespace
+
+double Value::doubleValue() const {
+    if (const auto* s = asString()) {
+        return leadingDouble(*s);
+    }
+    return asDouble().value_or(0.0);
+}
+
+std::int64_t Value::longLongValue() const {
+    if (const auto* s = asString()) {
+        return leadingInteger(*s);
+    }
+    return asInt64().value_or(0);
+}
+
+std::int32_t Value::intValue() const {
+    if (const auto* s = asString()) {
+        return static_cast<std::int32_t>(
+            std::clamp<std::int64_t>(leadingInteger(*s), std::numeric_limits<std::int32_t>::min(),
+                                     std::numeric_limits<std::int32_t>::max()));
+    }
+    return static_cast<std::int32_t>(
+        static_cast<std::uint32_t>(static_cast<std::uint64_t>(asInt64().value_or(0))));
 }
 
 bool Value::boolValue() const {

@@ -79,8 +79,19 @@ class Value {
     // Truthiness as a boolean value reads: numbers are true when nonzero, a string is true when
     // it starts with Y, y, T, t or a nonzero digit; anything else is false.
     bool boolValue() const;
-    // Number read as a double, 0 for anything that is not a number.
-    double doubleValue() const { return asDouble().value_or(0.0); }
+    // The readers payload rules use, which take text as well as numbers: a string reads as the
+    // number it starts with (white space before it skipped; "0.5 dB" is 0.5, "3.9" as an integer
+    // is 3), and anything that is neither a number nor such a string reads as 0.
+    //
+    // doubleValue: numbers as they are; a string's leading decimal number (no hexadecimal, no
+    // "inf" or "nan"), +-infinity when it overflows.
+    double doubleValue() const;
+    // longLongValue: integers as they are (unsigned ones clamped), doubles truncated toward zero
+    // (NaN is 0, clamped at the ends); a string's leading integer, clamped on overflow.
+    std::int64_t longLongValue() const;
+    // intValue: a string's leading integer clamped to 32 bits; a number as longLongValue reads it,
+    // then cut to its low 32 bits as a C conversion does.
+    std::int32_t intValue() const;
 
     // Numbers compare by value across kinds (1 == 1.0, and a bool is the number 0 or 1, as a
     // boxed number is); a string never equals a number; containers compare element by element.

@@ -2,6 +2,7 @@
 
 #include <gtest/gtest.h>
 
+#include <cmath>
 #include <cstdint>
 #include <limits>
 #include <string>
@@ -50,6 +51,48 @@ TEST(Value, ConvertsOutOfRangeAndTextValuesSafely) {
     EXPECT_TRUE(Value("  +007").boolValue());
     EXPECT_FALSE(Value("-0").boolValue());
     EXPECT_FALSE(Value(Array{1}).boolValue());
+}
+
+TEST(Value, ReadsTextByTheNumberItStartsWithAndEverythingElseAsZero) {
+    const double inf = std::numeric_limits<double>::infinity();
+    struct Case {
+        Value value;
+        double asDouble;
+        std::int64_t asLongLong;
+        std::int32_t asInt;
+    };
+    const Case cases[] = {
+        {"0.5", 0.5, 0, 0},
+        {" \t-2.75e1 dB", -27.5, -2, -2},
+        {"+42abc", 42, 42, 42},
+        {"3.9", 3.9, 3, 3},
+        {".5", 0.5, 0, 0},
+        {"1e", 1, 1, 1},  // an exponent without digits is not part of the number
+        {"abc", 0, 0, 0},
+        {"", 0, 0, 0},
+        {"-", 0, 0, 0},
+        {"0x10", 0, 0, 0},  // no hexadecimal
+        {"nan", 0, 0, 0},
+        {"1e999", inf, 1, 1},
+        {"-1e999", -inf, -1, -1},
+        {"1e-999", 0, 1, 1},
+        {"99999999999999999999", 1e20, std::numeric_limits<std::int64_t>::max(),
+         std::numeric_limits<std::int32_t>::max()},
+        {"-3000000000", -3e9, -3000000000LL, std::numeric_limits<std::int32_t>::min()},
+        {true, 1, 1, 1},
+        {-7.9, -7.9, -7, -7},
+        {std::int64_t{0x100000005}, 4294967301.0, 0x100000005, 5},  // C conversion: low bits
+        {Array{1}, 0, 0, 0},
+        {Value(), 0, 0, 0},
+    };
+    for (const auto& c : cases) {
+        SCOPED_TRACE(c.value.description());
+        EXPECT_EQ(c.value.doubleValue(), c.asDouble);
+        EXPECT_EQ(c.value.longLongValue(), c.asLongLong);
+        EXPECT_EQ(c.value.intValue(), c.asInt);
+    }
+    EXPECT_TRUE(std::isnan(Value(std::numeric_limits<double>::quiet_NaN()).doubleValue()));
+    EXPECT_EQ(Value(std::numeric_limits<double>::quiet_NaN()).intValue(), 0);
 }
 
 TEST(Dictionary, KeepsInsertionOrderWhenAKeyIsOverwrittenAndAppendsAfterErase) {

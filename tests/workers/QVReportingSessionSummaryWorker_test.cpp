@@ -51,9 +51,11 @@ TEST_F(ASummaryWorker, CountsActivityAndMessagesAndLeavesOutWhatCannotBeKnown) {
     fake.condition.thermal = ThermalState::Unknown;
     fake.condition.footprintError = "no such file";
     send({{"session_duration", 1}}, category::kPlayback, type::kStop);
-    // An overload with a duration counts as activity only; a duration as text adds no time.
+    // An overload with a duration counts as activity only; a duration as text adds the number
+    // it starts with, or nothing.
     send({{"session_duration", 2.5}, {"issue_type", "overload"}}, category::kPlayback, type::kStop);
     send({{"session_duration", "long"}}, category::kPlayback, type::kStop);
+    send({{"session_duration", "0.25 s"}}, category::kPlayback, type::kStop);
     send({{"issue_type", "overload"}});
     send({{"issue_type", "overload"}});  // redundant: never offered to the worker
     send({{"issue_type", "Overload"}});  // the match is exact
@@ -61,13 +63,13 @@ TEST_F(ASummaryWorker, CountsActivityAndMessagesAndLeavesOutWhatCannotBeKnown) {
         send({{"k", 1}});  // the first is stored, nine are redundant
     }
     const Dictionary summary = stopAndGetSummary();
-    EXPECT_EQ(*summary.find("total_active_time"), Value(3.5));
-    EXPECT_EQ(*summary.find("active_count"), Value(3u));
+    EXPECT_EQ(*summary.find("total_active_time"), Value(3.75));
+    EXPECT_EQ(*summary.find("active_count"), Value(4u));
     EXPECT_EQ(*summary.find("overload_count"), Value(1u));
-    EXPECT_DOUBLE_EQ(summary.find("average_active_time")->doubleValue(), 3.5 / 3);
-    // 16 received; stored: 6 of them plus the session's start and stop state messages.
-    EXPECT_EQ(*summary.find("num_messages"), Value(16));
-    EXPECT_EQ(*summary.find("num_unique_messages"), Value(8u));
+    EXPECT_DOUBLE_EQ(summary.find("average_active_time")->doubleValue(), 3.75 / 4);
+    // 17 received; stored: 7 of them plus the session's start and stop state messages.
+    EXPECT_EQ(*summary.find("num_messages"), Value(17));
+    EXPECT_EQ(*summary.find("num_unique_messages"), Value(9u));
     EXPECT_EQ(*summary.find("num_redundant_messages"), Value(8u));
 
     EXPECT_FALSE(summary.contains("clientProcessName"));

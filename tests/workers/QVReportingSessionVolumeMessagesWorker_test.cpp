@@ -76,14 +76,16 @@ TEST(AVolumeMessagesWorker, ReportsEachStretchClosedByStopDurationOrAWatchedChan
          {{"session_output_running", true}, {"qvreporting_timestamp", 0}, {"KXSessionVolume", 0.5}},
          {set(10, "KXSessionVolume", 0.8), off(20), on(30), off(40), on(45)},
          {{10, "10", {{"KXSessionVolumeBucketed", "0.8125"}}}}},
-        {"wrong kinds: flags as text or numbers, a text volume, NaN, unusable times",
+        {"wrong kinds: flags as text or numbers, text volumes, NaN, unusable times",
          {},
          {on(0, "loud"), off(10, 0),
           at(20, {{"session_output_running", "YES"}, {"KXSessionVolume", kNaN}}),
           set(25, "KXSessionVolume", kNaN), off(30, "NO"), on(40), off("50"), on(kNaN), off(60),
-          on(70), off(nullptr), on(80), off(true)},
+          on(70), off(nullptr), on(80), off(true), on(100, "0.5"), set(105, "KXSessionVolume", 0.5),
+          off(120)},
          {{10, "10", {{"KXSessionVolume", "loud"}, {"KXSessionVolumeBucketed", "0.0"}}},
-          {10, "10", {}}}},
+          {10, "10", {}},
+          {20, "30", {{"KXSessionVolume", 0.5}, {"KXSessionVolumeBucketed", "0.5"}}}}},
     };
     EXPECT_TRUE(derive(fake.platform, {}, cases[0].in, std::nullopt).empty()) << "no process";
     for (const auto& c : cases) {

@@ -30,7 +30,7 @@ namespace {
 constexpr int kJsonIndent = 2;
 
 const QVReportingLogCategory& logCategory() {
-    return QVReportingSessionCategory();
+    return QVReportingSummaryLogCategory();
 }
 
 // The local time of wallSeconds as "yyyyMMdd-HHmmssZ", e.g. "20240131-142501+0100".

@@ -47,7 +47,7 @@ void QVReportingSessionSummaryWorker::handleMessage(
     const Dictionary& payload = message->message();
     // A message that reports active time is counted for that alone.
     if (const Value* duration = payload.find(QVReportingMessageKeySessionDuration)) {
-        totalActiveTime_ += duration->asDouble().value_or(0.0);
+        totalActiveTime_ += duration->doubleValue();
         ++activeCount_;
         return;
     }

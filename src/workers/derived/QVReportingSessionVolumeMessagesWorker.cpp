@@ -35,8 +35,9 @@ Value stateValue(const Dictionary& state, std::string_view key) {
     return value ? *value : Value();
 }
 
-// Numbers compare by value, so a flag sent as true and later as 1 has not changed; a value that
-// is not a number reads 0. A repeated NaN is the same reading, not a change.
+// Numbers compare by value, so a flag sent as true and later as 1 has not changed; text reads as
+// the number it starts with ("0.5" is 0.5), anything else as 0. A repeated NaN is the same
+// reading, not a change.
 bool numbersDiffer(const Value& a, const Value& b) {
     const double x = a.doubleValue();
     const double y = b.doubleValue();
