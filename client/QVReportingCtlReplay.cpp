@@ -21,6 +21,7 @@ namespace {
 
 // How long a script waits, after stopping a session, for that session's held start reply.
 constexpr auto kStartReplyWait = std::chrono::seconds(5);
+constexpr std::uint16_t kUnknownServiceType = 65535;
 // How long a script's end waits for answers that it did not wait for on the way.
 constexpr auto kLateAnswerWait = std::chrono::milliseconds(200);
 
@@ -110,15 +111,28 @@ class ReplayRunner {
         try {
             switch (op.kind) {
                 case Kind::Create:
-                    endSession(op.reporterID, op.line);
-                    report(op.line, name, op.reporterID,
-                           client_.createReportingSession(op.reporterID));
+                    endSessionAnd(op,
+                                  [&] { return client_.createReportingSession(op.reporterID); });
+                    serviceTypes_[op.reporterID] = kUnknownServiceType;
                     break;
-                case Kind::SetType:
-                    endSession(op.reporterID, op.line);
-                    report(op.line, name, op.reporterID,
-                           client_.setServiceType(op.serviceType, op.reporterID));
+                case Kind::SetType: {
+                    // Only a new type replaces the session; the same type keeps it running.
+                    const auto known = serviceTypes_.find(op.reporterID);
+                    const bool replaces =
+                        known != serviceTypes_.end() && known->second != op.serviceType;
+                    const auto set = [&] {
+                        return client_.setServiceType(op.serviceType, op.reporterID);
+                    };
+                    if (replaces) {
+                        endSessionAnd(op, set);
+                    } else {
+                        report(op.line, name, op.reporterID, set());
+                    }
+                    if (known != serviceTypes_.end()) {
+                        known->second = op.serviceType;
+                    }
                     break;
+                }
                 case Kind::GetType: {
                     const auto serviceType = client_.getServiceNameForReporterID(op.reporterID);
                     report(op.line, name, op.reporterID,
@@ -145,21 +159,13 @@ class ReplayRunner {
                                                   qv::QVReportingUtilityTypeString(op.type),
                                                   idsText(op.reporterIDs))));
                     break;
-                case Kind::Stop: {
-                    const bool held = endSession(op.reporterID, op.line);
-                    const auto before = startAnswers(op.reporterID);
-                    report(op.line, name, op.reporterID,
-                           client_.stopReportingSession(op.reporterID));
-                    if (held) {
-                        awaitStartReply(op.reporterID, before);
-                    }
+                case Kind::Stop:
+                    endSessionAnd(op, [&] { return client_.stopReportingSession(op.reporterID); });
                     break;
-                }
                 case Kind::Destroy:
-                    // Destroying stops a started session without answering its start call.
-                    endSession(op.reporterID, op.line);
-                    report(op.line, name, op.reporterID,
-                           client_.destroyReportingSession(op.reporterID));
+                    endSessionAnd(op,
+                                  [&] { return client_.destroyReportingSession(op.reporterID); });
+                    serviceTypes_.erase(op.reporterID);
                     break;
                 case Kind::Valid:
                     report(op.line, name, op.reporterID,
@@ -206,9 +212,21 @@ class ReplayRunner {
                "waiting for the reply (held until the session stops)", true);
     }
 
-    // Whether the daemon holds a start call of this session: one made since the session was last
-    // stopped, destroyed or replaced (create, and set-type when the type changes, put a new
-    // session in its place, dropping a held call unanswered). Marks the session as ended here.
+    // Runs an operation that ends the session's run (stop, destroy, or a create or set-type that
+    // puts a new session in its place): the daemon answers a held start call of the session just
+    // before the operation's own reply, so the answer is awaited and printed first.
+    template <typename Call>
+    void endSessionAnd(const Op& op, Call call) {
+        const bool held = endSession(op.reporterID, op.line);
+        const auto before = startAnswers(op.reporterID);
+        report(op.line, qv::client::QVReportingReplayOperationName(op.kind), op.reporterID, call());
+        if (held) {
+            awaitStartReply(op.reporterID, before);
+        }
+    }
+
+    // Whether the daemon holds a start call of this session: one made since the session's run
+    // last ended here. Marks the run as ended.
     bool endSession(std::int64_t id, std::size_t line) {
         std::size_t& boundary = sessionBoundaries_[id];
         bool held = false;
@@ -264,6 +282,8 @@ class ReplayRunner {
     std::shared_ptr<Shared> shared_ = std::make_shared<Shared>();
     // Per session, the line that last stopped, destroyed or replaced it (script thread only).
     std::map<std::int64_t, std::size_t> sessionBoundaries_;
+    // Per session made by this script, its service type as set here (script thread only).
+    std::map<std::int64_t, std::uint16_t> serviceTypes_;
 };
 
 }  // namespace

@@ -4,6 +4,7 @@
 
 #include <algorithm>
 #include <mutex>
+#include <utility>
 
 #include "session/QVReportingLog.h"
 #include "session/QVReportingStats.h"
@@ -31,6 +32,16 @@ QVReportingClientServerInstance::BoolReply once(QVReportingClientServerInstance:
             reply(error, result);
         }
     };
+}
+
+// A session that leaves the map (destroyed, or replaced by a create or a new service type)
+// answers its held start call with true, as a stop does: left unanswered, the call would stay
+// pending until the client leaves the bus, and a connection's pending calls are limited.
+void answerHeldStart(QVReportingSession& session) {
+    if (auto held = std::move(session.transactionCompleteBlock())) {
+        session.setTransactionCompleteBlock(nullptr);
+        held(true);
+    }
 }
 
 }  // namespace
@@ -75,10 +86,14 @@ std::shared_ptr<QVReportingSession> QVReportingClientServerInstance::findReporti
 
 void QVReportingClientServerInstance::storeSession(ReporterID id,
                                                    std::shared_ptr<QVReportingSession> session) {
-    auto [it, inserted] = sessionMap_.insert_or_assign(id, std::move(session));
+    session->setClientProcessName(clientProcessName_);
+    auto [it, inserted] = sessionMap_.try_emplace(id, session);
     if (inserted) {
         order_.push_back(id);
+        return;
     }
+    const auto replaced = std::exchange(it->second, std::move(session));
+    answerHeldStart(*replaced);
 }
 
 void QVReportingClientServerInstance::createReportingSession(ReporterID id, BoolReply reply) {
@@ -95,10 +110,8 @@ void QVReportingClientServerInstance::createReportingSession(ReporterID id, Bool
                   false);
             return;
         }
-        auto session =
-            QVReportingSession::initWithID(self->platform_, id, {self->processIdentifier_});
-        session->setClientProcessName(self->clientProcessName_);
-        self->storeSession(id, std::move(session));
+        self->storeSession(
+            id, QVReportingSession::initWithID(self->platform_, id, {self->processIdentifier_}));
         QVLOG_DEFAULT(log, "session created for reporter {}", id);
         reply(std::nullopt, true);
     });
@@ -169,11 +182,7 @@ void QVReportingClientServerInstance::startReportingSessionForID(ReporterID id, 
             return;  // this call is never answered; the first start's reply is still held
         }
         session->start();
-        if (auto& held = session->transactionCompleteBlock()) {
-            auto earlier = std::move(held);
-            session->setTransactionCompleteBlock(nullptr);
-            earlier(true);
-        }
+        answerHeldStart(*session);
         session->setTransactionCompleteBlock([reply](bool result) { reply(std::nullopt, result); });
         if (session->serviceType() == service::kTest &&
             QVReportingUtilityIsInternalBuild(self->platform_)) {
@@ -217,10 +226,7 @@ void QVReportingClientServerInstance::stopReportingSessionForID(ReporterID id, B
         auto session = self->findReportingSessionForID(id, false);
         if (session && session->started()) {
             session->stop();
-            if (auto held = std::move(session->transactionCompleteBlock())) {
-                session->setTransactionCompleteBlock(nullptr);
-                held(true);
-            }
+            answerHeldStart(*session);
             self->delegate_.logReportingSessions();
         } else {
             QVLOG_DEFAULT(log,
@@ -247,6 +253,7 @@ void QVReportingClientServerInstance::destroyReportingSession(ReporterID id, Boo
             if (session->started()) {
                 session->stop();
             }
+            answerHeldStart(*session);
             self->sessionMap_.erase(it);
             std::erase(self->order_, id);
         }

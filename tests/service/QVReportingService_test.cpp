@@ -128,20 +128,34 @@ TEST_F(AService, RunsTheSingleMessageSessionFromFirstUseUntilMoreThanFiveIdleSec
     EXPECT_EQ(timersMade, 2);  // the reaper's timer lives as long as the session
 }
 
-TEST_F(AService, HoldsTheStartReplyUntilTheSessionStops) {
+TEST_F(AService, HoldsTheStartReplyUntilItsSessionStopsOrGoesAway) {
     makeService();
     auto a = connect(100);
-    Answer first, second, stopped;
-    auto s = startedSession(*a, 5, &first);
-    EXPECT_TRUE(s->started());
-    EXPECT_EQ(first.count, 0);
-    a->startReportingSessionForID(5, into(second));  // already started: never answered
-    a->stopReportingSessionForID(5, into(stopped));
-    drain();
-    EXPECT_EQ(first.count, 1);
-    EXPECT_TRUE(first.result);
-    EXPECT_EQ(second.count, 0);
-    EXPECT_TRUE(stopped.result);
+    using End = std::function<void(QVReportingClientServerInstance&)>;
+    const std::vector<std::pair<const char*, End>> ends = {
+        {"stop", [&](auto& c) { c.stopReportingSessionForID(5, into(ignored)); }},
+        {"destroy", [&](auto& c) { c.destroyReportingSession(5, into(ignored)); }},
+        {"create again", [&](auto& c) { c.createReportingSession(5, into(ignored)); }},
+        {"new service type",
+         [&](auto& c) { c.setServiceType(service::kAlarms, 5, into(ignored)); }},
+    };
+    for (const auto& [name, end] : ends) {
+        SCOPED_TRACE(name);
+        Answer first, second;
+        auto s = startedSession(*a, 5, &first);
+        EXPECT_TRUE(s->started());
+        a->startReportingSessionForID(5, into(second));  // already started: never answered
+        drain();
+        EXPECT_EQ(first.count, 0);
+        end(*a);
+        drain();
+        EXPECT_EQ(first.count, 1);
+        EXPECT_TRUE(first.result);
+        EXPECT_EQ(second.count, 0);
+        a->destroyReportingSession(5, into(ignored));
+        drain();
+        EXPECT_EQ(first.count, 1) << "answered once";
+    }
 }
 
 TEST_F(AService, OnInternalBuildsAnswersATestSessionsStartAtOnceAndMarksSingleMessages) {
@@ -173,6 +187,7 @@ TEST_F(AService, ReplacesTheSessionOnANewServiceTypeKeepingConfigurationAndPrevi
     drain();
     auto after = a->findReportingSessionForID(3, false);
     ASSERT_NE(after, before);
+    EXPECT_EQ(after->clientProcessName(), "player");
     EXPECT_TRUE(after->messages().empty());
     EXPECT_EQ(*after->configuration().find("HostApplicationDisplayID"), Value("com.example.app"));
     EXPECT_EQ(*after->previousValues().find("volume"), Value(0.5));
