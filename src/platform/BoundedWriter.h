@@ -6,6 +6,7 @@
 // on the writer's own thread, one item at a time, in push order.
 #pragma once
 
+#include <chrono>
 #include <condition_variable>
 #include <cstddef>
 #include <deque>
@@ -52,6 +53,13 @@ class BoundedWriter {
         std::unique_lock lock(mutex_);
         const std::size_t target = pushedCount();
         drained_.wait(lock, [&] { return written_ >= target; });
+    }
+
+    // As flush(), but gives up at deadline; true when everything was written by then.
+    bool flushUntil(std::chrono::steady_clock::time_point deadline) {
+        std::unique_lock lock(mutex_);
+        const std::size_t target = pushedCount();
+        return drained_.wait_until(lock, deadline, [&] { return written_ >= target; });
     }
 
   private:

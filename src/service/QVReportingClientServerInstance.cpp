@@ -6,6 +6,7 @@
 #include <mutex>
 #include <utility>
 
+#include "platform/linux/JsonlSink.h"
 #include "session/QVReportingLog.h"
 #include "session/QVReportingStats.h"
 #include "session/QVReportingUtility.h"
@@ -13,6 +14,9 @@
 namespace qv {
 
 namespace {
+
+// How long killService waits for the sinks before the process ends.
+constexpr auto kKillFlushTimeout = std::chrono::seconds(1);
 
 std::mutex gExitHookMutex;
 std::function<void(int)> gExitHook;  // guarded by gExitHookMutex
@@ -297,6 +301,14 @@ void QVReportingClientServerInstance::killService() {
     if (hook) {
         hook(2);
         return;
+    }
+    // What the sinks accepted goes to their files first, but a stalled disk does not keep the
+    // process alive: the flush is bounded.
+    if (!JsonlSink::flushAll(std::chrono::steady_clock::now() + kKillFlushTimeout)) {
+        QVLOG_ERROR(
+            QVReportingClientCategory(),
+            "sinks not flushed within {} ms; exiting with lines unwritten",
+            std::chrono::duration_cast<std::chrono::milliseconds>(kKillFlushTimeout).count());
     }
     if (auto sink = logSink()) {
         sink->flush();

@@ -55,6 +55,9 @@ std::unique_ptr<sdbus::IConnection> connectTo(const std::string& bus) {
 // footprint follows its load instead of its busiest moment.
 constexpr std::size_t kFreeBytesWorthReturning = 1u << 20;
 
+// The sinks' share of the 10 seconds a stop may take.
+constexpr auto kShutdownFlushTimeout = std::chrono::seconds(5);
+
 void returnFreeMemory() {
     if (mallinfo2().fordblks > kFreeBytesWorthReturning) {
         malloc_trim(0);
@@ -145,8 +148,7 @@ int main(int argc, char** argv) {
     service.stopAllSessions();
     server->flush();
     server.reset();
-    analytics.service->flush();
-    convo.flush();
+    JsonlSink::flushAll(std::chrono::steady_clock::now() + kShutdownFlushTimeout);
     QVReportingSystemMonitor::reset();
     QVLOG_DEFAULT(logCategory(), "stopped");
     if (auto sink = logSink()) {

@@ -5,13 +5,14 @@ import os
 import signal
 import subprocess
 import sys
+import tempfile
 import time
 import unittest
 
 import dbus
 
 sys.path.insert(0, os.path.dirname(__file__))
-from harness import (BUS_NAME, Client, DaemonTestCase, OBJECT_PATH, INTERFACE,
+from harness import (BUS_NAME, Bus, Client, Daemon, DaemonTestCase, OBJECT_PATH, INTERFACE,
                      wait_until)  # noqa: E402
 
 PLAYBACK, RECORD, INPUT, START, STOP, STATE = 4, 2, 3, 1, 2, 18
@@ -180,6 +181,50 @@ class Shutdown(DaemonTestCase):
         self.bus.process.kill()
         self.assertEqual(self.daemon.process.wait(timeout=10), 0)
         self.assertEqual(len(self.daemon.events("com.korvane.qvsound.Playback.Start")), 50)
+
+
+class KillService(DaemonTestCase):
+    """KillService ends the process with status 2 once the sinks wrote what they accepted, or
+    after a second when a sink cannot write."""
+
+    def setUp(self):
+        self.workdir = tempfile.mkdtemp(prefix="qv-e2e-")
+        self.bus = Bus(self.workdir)
+        state = os.path.join(self.workdir, "state")
+        os.makedirs(os.path.join(state, "sinks"))
+        # A pipe in the analytics sink's place: what the daemon writes waits for our reads.
+        self.fifo = os.path.join(state, "sinks", "analytics.jsonl")
+        os.mkfifo(self.fifo)
+        self.daemon = Daemon(self.bus, state)
+
+    def fill_the_pipe(self, messages):
+        c = self.client()
+        c.create(41)
+        c.start(41)
+        for i in range(messages):  # each answered once its events are in the sink's buffer
+            c.send({"i": i, "padding": "x" * 200}, PLAYBACK, START, [41])
+        return c
+
+    def test_writes_what_the_sinks_accepted_before_leaving(self):
+        # Opened without waiting for the writer, then read blocking once the kill is under way.
+        fd = os.open(self.fifo, os.O_RDONLY | os.O_NONBLOCK)
+        os.set_blocking(fd, True)
+        c = self.fill_the_pipe(300)  # 600 lines: more than a pipe holds, so some wait
+        c.reporting.KillService(ignore_reply=True)
+        time.sleep(0.2)
+        with os.fdopen(fd) as f:
+            lines = [json.loads(line) for line in f]
+        self.assertEqual(self.daemon.process.wait(timeout=10), 2)
+        self.assertEqual(len(lines), 600)
+        self.assertEqual([l["payload"]["i"] for l in lines[::2]], list(range(300)))
+
+    def test_leaves_after_a_second_when_a_sink_cannot_write(self):
+        c = self.fill_the_pipe(10)  # nobody reads: the sink's writer waits forever
+        started = time.monotonic()
+        c.reporting.KillService(ignore_reply=True)
+        self.assertEqual(self.daemon.process.wait(timeout=10), 2)
+        self.assertLess(time.monotonic() - started, 5)
+        self.assertIn("sinks not flushed within 1000 ms", self.daemon.log_text())
 
 
 if __name__ == "__main__":

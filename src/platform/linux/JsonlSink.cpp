@@ -7,7 +7,9 @@
 #include <cerrno>
 #include <exception>
 #include <filesystem>
+#include <mutex>
 #include <system_error>
+#include <vector>
 
 #include <fmt/format.h>
 #include <nlohmann/json.hpp>
@@ -24,6 +26,10 @@ std::string errnoText(int error) {
     return std::error_code(error, std::generic_category()).message();
 }
 
+// Every live sink, for flushAll(). Sinks come and go only at start-up, shutdown and in tests.
+std::mutex gSinksMutex;
+std::vector<JsonlSink*> gSinks;  // guarded by gSinksMutex
+
 }  // namespace
 
 JsonlSink::JsonlSink(std::string stateDir, std::string name, const Clock& clock,
@@ -36,11 +42,32 @@ JsonlSink::JsonlSink(std::string stateDir, std::string name, const Clock& clock,
       callbacks_(std::move(callbacks)),
       capacity_(std::max<std::size_t>(capacity, 1)),
       writer_(std::make_unique<BoundedWriter<Line>>(capacity_,
-                                                    [this](Line& line) { writeLine(line); })) {}
+                                                    [this](Line& line) { writeLine(line); })) {
+    std::lock_guard lock(gSinksMutex);
+    gSinks.push_back(this);
+}
 
 JsonlSink::~JsonlSink() {
+    {
+        std::lock_guard lock(gSinksMutex);
+        std::erase(gSinks, this);
+    }
     writer_.reset();  // writes what is queued and ends the thread before the file goes
     closeFile();
+}
+
+bool JsonlSink::flushUntil(std::chrono::steady_clock::time_point deadline) {
+    return writer_->flushUntil(deadline);
+}
+
+bool JsonlSink::flushAll(std::chrono::steady_clock::time_point deadline) {
+    // Under the lock, so no sink can go away meanwhile; a sink's writer never takes this lock.
+    std::lock_guard lock(gSinksMutex);
+    bool all = true;
+    for (JsonlSink* sink : gSinks) {
+        all = sink->flushUntil(deadline) && all;
+    }
+    return all;
 }
 
 bool JsonlSink::append(Dictionary members) {

@@ -21,6 +21,7 @@
 #pragma once
 
 #include <atomic>
+#include <chrono>
 #include <cstddef>
 #include <cstdint>
 #include <functional>
@@ -68,6 +69,12 @@ class JsonlSink {
 
     // Blocks until every line appended before this call has been written or given up.
     void flush();
+    // As flush(), but gives up at deadline; true when every line was written or given up by then.
+    bool flushUntil(std::chrono::steady_clock::time_point deadline);
+
+    // Flushes every sink of the process, all within one deadline: what an exit does first, so
+    // that what the sinks accepted is in their files. True when all of them made it.
+    static bool flushAll(std::chrono::steady_clock::time_point deadline);
 
     const std::string& name() const { return name_; }
     const std::string& path() const { return path_; }
