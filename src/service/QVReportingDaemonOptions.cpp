@@ -82,6 +82,15 @@ std::optional<QVReportingDaemonOptions> QVReportingParseDaemonOptions(int argc, 
     app.add_option("--max-clients", l.maxClients, "Most clients served at once")
         ->capture_default_str()
         ->check(CLI::PositiveNumber);
+    app.add_option("--max-session-store-bytes", l.maxSessionStoreBytes,
+                   "Memory one session's stored messages may take; past it, messages are "
+                   "forwarded to the workers but not stored")
+        ->capture_default_str()
+        ->check(CLI::PositiveNumber);
+    app.add_option("--max-store-bytes", l.maxStoreBytes,
+                   "Memory the stored messages of all sessions may take together")
+        ->capture_default_str()
+        ->check(CLI::PositiveNumber);
     try {
         app.parse(argc, argv);
     } catch (const CLI::ParseError& e) {

@@ -25,6 +25,8 @@ std::string describeSessions(const std::vector<std::shared_ptr<QVReportingSessio
 QVReportingService::QVReportingService(const Platform& platform, SerialQueue& queue,
                                        QVReportingLimits limits, TimerFactory timerFactory)
     : platform_(platform), queue_(queue), limits_(limits), timerFactory_(std::move(timerFactory)) {
+    // Sessions keep to the store budgets through the process-wide guardrails.
+    QVReportingStats::shared().setStoreBudgets(limits_.maxSessionStoreBytes, limits_.maxStoreBytes);
     if (!timerFactory_) {
         timerFactory_ = [](std::chrono::duration<double> interval, std::function<void()> tick) {
             return std::make_unique<RepeatingTimer>(interval, std::move(tick));

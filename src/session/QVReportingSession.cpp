@@ -6,6 +6,7 @@
 
 #include "platform/Clock.h"
 #include "session/QVReportingLog.h"
+#include "session/QVReportingStats.h"
 #include "session/QVReportingWorkerRegistry.h"
 
 namespace qv {
@@ -46,6 +47,14 @@ std::optional<double> timestampOf(const Value& v) {
     }
 }
 
+// Estimated memory of one stored message: the message in its shared block, its place in the
+// list, and its payload.
+std::size_t storedMessageBytes(const QVReportingSessionMessage& message) {
+    constexpr std::size_t kSharedBlock = sizeof(QVReportingSessionMessage) + 32;
+    return kSharedBlock + sizeof(std::shared_ptr<QVReportingSessionMessage>) +
+           message.message().approximateHeapBytes();
+}
+
 // The workers of the given lists in list order, each once, at its first place.
 template <typename... Lists>
 QVReportingSession::WorkerList orderedUnion(const Lists&... lists) {
@@ -81,6 +90,7 @@ std::shared_ptr<QVReportingSession> QVReportingSession::initWithID(
 }
 
 QVReportingSession::~QVReportingSession() {
+    releaseStore();
     QVLOG_INFO(QVReportingSessionCategory(), "deallocing this session {}", reporterID_);
 }
 
@@ -215,8 +225,61 @@ bool QVReportingSession::messageIsRedundant(const QVReportingSessionMessage& mes
 }
 
 void QVReportingSession::storeMessage(std::shared_ptr<QVReportingSessionMessage> message) {
+    const std::size_t bytes = storedMessageBytes(*message);
+    QVReportingStats::shared().forceStoreBytes(bytes);
+    storedBytes_ += bytes;
     newestByKind_[kindKey(message->category(), message->type())] = message.get();
     messages_.push_back(std::move(message));
+}
+
+void QVReportingSession::storeIfBudgetAllows(
+    const std::shared_ptr<QVReportingSessionMessage>& message) {
+    const std::size_t bytes = storedMessageBytes(*message);
+    if (!QVReportingStats::shared().reserveStoreBytes(storedBytes_, bytes)) {
+        QVReportingStats::shared().noteMessageNotStored();
+        if (messagesNotStored_++ == 0) {
+            QVLOG_ERROR(QVReportingSessionCategory(),
+                        "store budget used up: session {} holds {} bytes in {} messages (the "
+                        "daemon {} bytes); further messages of this run are forwarded but not "
+                        "stored",
+                        reporterID_, storedBytes_, messages_.size(),
+                        QVReportingStats::shared().storeBytes());
+        }
+        return;
+    }
+    storedBytes_ += bytes;
+    newestByKind_[kindKey(message->category(), message->type())] = message.get();
+    messages_.push_back(message);
+}
+
+void QVReportingSession::rememberPreviousValues(const Dictionary& payload) {
+    constexpr std::size_t kMaxKeys = QVReportingStats::kMaxPreviousValuesKeys;
+    if (previousValues_.size() + payload.size() <= kMaxKeys) {
+        previousValues_.merge(payload);
+        return;
+    }
+    std::size_t dropped = 0;
+    for (const auto& [key, value] : payload) {
+        if (Value* known = previousValues_.find(key)) {
+            *known = value;
+        } else if (previousValues_.size() < kMaxKeys) {
+            previousValues_.set(key, value);
+        } else {
+            ++dropped;
+            QVReportingStats::shared().notePreviousValueDropped();
+        }
+    }
+    if (dropped > 0 && !warnedPreviousValues_) {
+        warnedPreviousValues_ = true;
+        QVLOG_ERROR(QVReportingSessionCategory(),
+                    "session {} remembers {} distinct keys; new keys are no longer remembered",
+                    reporterID_, previousValues_.size());
+    }
+}
+
+void QVReportingSession::releaseStore() {
+    QVReportingStats::shared().releaseStoreBytes(storedBytes_);
+    storedBytes_ = 0;
 }
 
 void QVReportingSession::rebuildNewestIndex() {
@@ -246,9 +309,9 @@ void QVReportingSession::sendMessage(const std::shared_ptr<QVReportingSessionMes
             return app ? app->description() : std::string("(null)");
         }(),
         yesNo(message->isRedundant()), message->description());
-    previousValues_.merge(message->message());
+    rememberPreviousValues(message->message());
     if (!message->isRedundant()) {
-        storeMessage(message);
+        storeIfBudgetAllows(message);
     }
     offerToConsumers(message);
     if (reply) {
@@ -338,8 +401,10 @@ void QVReportingSession::stop() {
                     worker->workerClass()->name, reporterID_);
     }
     messages_.clear();
+    releaseStore();
     newestByKind_.clear();
     totalMessageCount_ = 0;
+    messagesNotStored_ = 0;
     started_ = false;
 }
 

@@ -79,6 +79,11 @@ class QVReportingSession : public std::enable_shared_from_this<QVReportingSessio
     const Dictionary& previousValues() const { return previousValues_; }
     Dictionary& previousValues() { return previousValues_; }
     std::int64_t totalMessageCount() const { return totalMessageCount_; }
+    // Messages of this run forwarded to the workers but not stored: the session's or the
+    // daemon's store budget was used up (QVReportingLimits).
+    std::uint64_t messagesNotStored() const { return messagesNotStored_; }
+    // Estimated memory of the stored messages.
+    std::size_t storedBytes() const { return storedBytes_; }
     const WorkerList& messageWorkers() const { return messageWorkers_; }
     const ConsumerList& consumingMessageWorkers() const { return consumingMessageWorkers_; }
     const WorkerList& producingMessageWorkers() const { return producingMessageWorkers_; }
@@ -116,8 +121,13 @@ class QVReportingSession : public std::enable_shared_from_this<QVReportingSessio
     QVReportingSession(const Platform& platform, ReporterID reporterID,
                        std::vector<std::int64_t> processIdentifiers);
 
-    // Appends to messages_ and keeps the redundancy index current.
+    // Appends to messages_ and keeps the redundancy index current, whatever the budget.
     void storeMessage(std::shared_ptr<QVReportingSessionMessage> message);
+    // Stores a received message when the store budgets allow; else counts it.
+    void storeIfBudgetAllows(const std::shared_ptr<QVReportingSessionMessage>& message);
+    void releaseStore();
+    // Merges a payload into previousValues_, within QVReportingStats::kMaxPreviousValuesKeys.
+    void rememberPreviousValues(const Dictionary& payload);
     void rebuildNewestIndex();
     std::shared_ptr<QVReportingSessionMessage> makeStateMessage(bool starting) const;
     void offerToConsumers(const std::shared_ptr<QVReportingSessionMessage>& message);
@@ -141,6 +151,9 @@ class QVReportingSession : public std::enable_shared_from_this<QVReportingSessio
     std::unordered_map<std::uint64_t, QVReportingSessionMessage*> newestByKind_;
     Dictionary previousValues_;
     std::int64_t totalMessageCount_ = 0;
+    std::size_t storedBytes_ = 0;
+    std::uint64_t messagesNotStored_ = 0;
+    bool warnedPreviousValues_ = false;
     WorkerList messageWorkers_;
     ConsumerList consumingMessageWorkers_;
     WorkerList producingMessageWorkers_;

@@ -56,6 +56,42 @@ void QVReportingStats::noteSessionCount(std::size_t sessions) {
     raiseMax(sessionsMax_, sessions);
 }
 
+void QVReportingStats::setStoreBudgets(std::size_t perSession, std::size_t total) {
+    sessionStoreBudget_.store(perSession);
+    storeBudget_.store(total);
+}
+
+bool QVReportingStats::reserveStoreBytes(std::size_t sessionBytes, std::size_t bytes) {
+    if (sessionBytes + bytes > sessionStoreBudget_.load(std::memory_order_relaxed)) {
+        return false;
+    }
+    const std::uint64_t budget = storeBudget_.load(std::memory_order_relaxed);
+    std::uint64_t taken = storeBytes_.load(std::memory_order_relaxed);
+    do {
+        if (taken + bytes > budget) {
+            return false;
+        }
+    } while (!storeBytes_.compare_exchange_weak(taken, taken + bytes, std::memory_order_relaxed));
+    raiseMax(storeBytesMax_, taken + bytes);
+    return true;
+}
+
+void QVReportingStats::forceStoreBytes(std::size_t bytes) {
+    raiseMax(storeBytesMax_, storeBytes_.fetch_add(bytes, std::memory_order_relaxed) + bytes);
+}
+
+void QVReportingStats::releaseStoreBytes(std::size_t bytes) {
+    storeBytes_.fetch_sub(bytes, std::memory_order_relaxed);
+}
+
+void QVReportingStats::noteMessageNotStored() {
+    messagesNotStored_.fetch_add(1, std::memory_order_relaxed);
+}
+
+void QVReportingStats::notePreviousValueDropped() {
+    previousValuesDropped_.fetch_add(1, std::memory_order_relaxed);
+}
+
 std::uint64_t QVReportingStats::limitExceededCount(Limit limit) const {
     return limitsExceeded_[static_cast<std::size_t>(limit)].load();
 }
@@ -90,6 +126,12 @@ Dictionary QVReportingStats::dump() const {
     out.set("clients_max", clientsMax_.load());
     out.set("sessions", sessions_.load());
     out.set("sessions_max", sessionsMax_.load());
+    out.set("store_bytes", storeBytes_.load());
+    out.set("store_bytes_max", storeBytesMax_.load());
+    out.set("store_budget_bytes", storeBudget_.load());
+    out.set("session_store_budget_bytes", sessionStoreBudget_.load());
+    out.set("messages_not_stored", messagesNotStored_.load());
+    out.set("previous_values_dropped", previousValuesDropped_.load());
     return out;
 }
 
@@ -103,6 +145,10 @@ void QVReportingStats::TEST_reset() {
     clientsMax_.store(0);
     sessions_.store(0);
     sessionsMax_.store(0);
+    setStoreBudgets(QVReportingLimits{}.maxSessionStoreBytes, QVReportingLimits{}.maxStoreBytes);
+    storeBytesMax_.store(storeBytes_.load());
+    messagesNotStored_.store(0);
+    previousValuesDropped_.store(0);
     std::lock_guard lock(mutex_);
     sinkLinesLost_.clear();
 }

@@ -33,6 +33,11 @@ struct QVReportingLimits {
     std::size_t maxSessionsPerClient = 4096;
     // Clients connected at once.
     std::size_t maxClients = 256;
+    // Memory a session's stored messages may take (estimated); past it, messages are still
+    // forwarded to the workers but not stored. A busy session holds a few MiB.
+    std::size_t maxSessionStoreBytes = std::size_t{64} << 20;
+    // Memory the stored messages of all sessions together may take.
+    std::size_t maxStoreBytes = std::size_t{512} << 20;
 };
 
 class QVReportingStats {
@@ -48,6 +53,11 @@ class QVReportingStats {
 
     static QVReportingStats& shared();
 
+    // Distinct keys a session remembers in its previous values (the last value of every key it
+    // was sent). Real clients use a few dozen; beyond this, new keys are not remembered (known
+    // keys still update), so a client inventing keys cannot grow the daemon without bound.
+    static constexpr std::size_t kMaxPreviousValuesKeys = 16384;
+
     void noteLimitExceeded(Limit limit);
     // A call refused for its content (a value of a type payloads cannot hold, say).
     void noteInputRefused();
@@ -58,6 +68,22 @@ class QVReportingStats {
     void noteClientCount(std::size_t clients);
     void noteSessionCount(std::size_t sessions);
 
+    // The store budgets sessions keep to (QVReportingLimits' two store limits).
+    void setStoreBudgets(std::size_t perSession, std::size_t total);
+    // Takes bytes for a session that already stores sessionBytes: false, with nothing taken,
+    // when that would pass the session's budget or the daemon's.
+    bool reserveStoreBytes(std::size_t sessionBytes, std::size_t bytes);
+    // Takes bytes whatever the budgets say (a session's own state messages).
+    void forceStoreBytes(std::size_t bytes);
+    // Gives back what a session took, when its messages go.
+    void releaseStoreBytes(std::size_t bytes);
+    // A message forwarded but not stored, for want of budget.
+    void noteMessageNotStored();
+    // A key not remembered in a session's previous values (kMaxPreviousValuesKeys).
+    void notePreviousValueDropped();
+    std::uint64_t storeBytes() const { return storeBytes_.load(); }
+    std::uint64_t messagesNotStored() const { return messagesNotStored_.load(); }
+
     std::uint64_t limitExceededCount(Limit limit) const;
     std::uint64_t logLinesDropped() const { return logLinesDropped_.load(); }
     std::uint64_t sinkLinesLost(std::string_view sink) const;
@@ -65,7 +91,8 @@ class QVReportingStats {
     // Every counter by name, for the operator.
     Dictionary dump() const;
 
-    // For tests only: zero every counter.
+    // For tests only: zero every counter and restore the default budgets (bytes still taken by
+    // live sessions stay counted).
     void TEST_reset();
 
   private:
@@ -80,6 +107,12 @@ class QVReportingStats {
     std::atomic<std::uint64_t> clientsMax_{0};
     std::atomic<std::uint64_t> sessions_{0};
     std::atomic<std::uint64_t> sessionsMax_{0};
+    std::atomic<std::uint64_t> sessionStoreBudget_{QVReportingLimits{}.maxSessionStoreBytes};
+    std::atomic<std::uint64_t> storeBudget_{QVReportingLimits{}.maxStoreBytes};
+    std::atomic<std::uint64_t> storeBytes_{0};
+    std::atomic<std::uint64_t> storeBytesMax_{0};
+    std::atomic<std::uint64_t> messagesNotStored_{0};
+    std::atomic<std::uint64_t> previousValuesDropped_{0};
     mutable std::mutex mutex_;
     std::map<std::string, std::uint64_t, std::less<>> sinkLinesLost_;  // guarded by mutex_
 };

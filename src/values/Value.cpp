@@ -472,6 +472,44 @@ std::size_t Value::valueCount() const {
     return n;
 }
 
+namespace {
+
+// What the allocator adds to each block it hands out (its header, and rounding up).
+constexpr std::size_t kAllocationOverhead = 16;
+
+std::size_t stringHeapBytes(const std::string& s) {
+    // Short strings live inside the object itself.
+    return s.capacity() > 15 ? s.capacity() + 1 + kAllocationOverhead : 0;
+}
+
+// A block made by make_shared: the object, its control block and the allocator's share.
+template <typename T>
+constexpr std::size_t kSharedBlockBytes = sizeof(T) + 16 + kAllocationOverhead;
+
+}  // namespace
+
+std::size_t Value::approximateHeapBytes() const {
+    switch (kind()) {
+        case Kind::String:
+            return stringHeapBytes(*asString());
+        case Kind::Bytes:
+            return kSharedBlockBytes<Bytes> + asBytes()->capacity() + kAllocationOverhead;
+        case Kind::Array: {
+            const Array& a = *asArray();
+            std::size_t n =
+                kSharedBlockBytes<Array> + a.capacity() * sizeof(Value) + kAllocationOverhead;
+            for (const Value& v : a) {
+                n += v.approximateHeapBytes();
+            }
+            return n;
+        }
+        case Kind::Dictionary:
+            return kSharedBlockBytes<Dictionary> + asDictionary()->approximateHeapBytes();
+        default:
+            return 0;
+    }
+}
+
 std::size_t Value::depth() const {
     std::size_t deepest = 0;
     if (const Array* a = asArray()) {
@@ -636,6 +674,20 @@ void Dictionary::merge(const Dictionary& other) {
 void Dictionary::clear() {
     entries_.clear();
     slots_.clear();
+}
+
+std::size_t Dictionary::approximateHeapBytes() const {
+    std::size_t n = 0;
+    if (entries_.capacity() > 0) {
+        n += entries_.capacity() * sizeof(Entry) + kAllocationOverhead;
+    }
+    if (slots_.capacity() > 0) {
+        n += slots_.capacity() * sizeof(slots_[0]) + kAllocationOverhead;
+    }
+    for (const auto& [key, value] : entries_) {
+        n += stringHeapBytes(key) + value.approximateHeapBytes();
+    }
+    return n;
 }
 
 bool Dictionary::operator==(const Dictionary& other) const {

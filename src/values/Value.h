@@ -108,6 +108,9 @@ class Value {
     // 0 deep, an empty container 1). Used to keep client input within bounds.
     std::size_t valueCount() const;
     std::size_t depth() const;
+    // Heap memory this value holds beyond its own sizeof, allocator overhead included: an
+    // estimate for memory budgets, not an exact figure. Shared containers count in full.
+    std::size_t approximateHeapBytes() const;
 
   private:
     std::optional<__int128> asExactInteger() const;
@@ -159,6 +162,9 @@ class Dictionary {
     // Same keys with equal values; order does not matter.
     bool operator==(const Dictionary& other) const;
     bool operator!=(const Dictionary& other) const { return !(*this == other); }
+
+    // Heap memory the dictionary holds beyond its own sizeof (see Value::approximateHeapBytes).
+    std::size_t approximateHeapBytes() const;
 
     std::string description() const;
 

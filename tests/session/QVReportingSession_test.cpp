@@ -4,9 +4,12 @@
 
 #include <cmath>
 #include <random>
+#include <string>
 #include <vector>
 
 #include "fakes/FakePlatform.h"
+#include "fakes/MemoryLogSink.h"
+#include "session/QVReportingStats.h"
 #include "session/QVReportingWorkerRegistry.h"
 
 namespace qv {
@@ -112,6 +115,34 @@ TEST_F(ASession, IgnoresUptimesAndTimeForRedundancyStoresNoRepeatsAndEmptiesTheS
 
 // The redundancy index must agree with a newest-to-oldest search of the store, through the
 // sort at stop and restarts.
+TEST_F(ASession, RemembersABoundedNumberOfDistinctKeysAndKeepsUpdatingKnownOnes) {
+    test::ScopedMemoryLog log;
+    auto& stats = QVReportingStats::shared();
+    stats.TEST_reset();
+    constexpr std::size_t kMax = QVReportingStats::kMaxPreviousValuesKeys;
+    auto s = make();
+    Dictionary many;
+    for (std::size_t i = 0; i < kMax - 10; ++i) {
+        many.set("k" + std::to_string(i), 0);
+    }
+    s->sendMessage(msg(many));  // stamping adds four keys: six places are left
+    ASSERT_EQ(s->previousValues().size(), kMax - 6);
+    Dictionary more{{"k0", 1}};
+    for (int i = 0; i < 20; ++i) {
+        more.set("new" + std::to_string(i), i);
+    }
+    s->sendMessage(msg(more));
+    EXPECT_EQ(s->previousValues().size(), kMax);
+    EXPECT_EQ(*s->previousValues().find("k0"), Value(1));
+    EXPECT_TRUE(s->previousValues().contains("new5"));
+    EXPECT_FALSE(s->previousValues().contains("new6"));
+    s->sendMessage(msg({{"k1", 2}, {"later", 1}}));
+    EXPECT_EQ(*s->previousValues().find("k1"), Value(2));
+    EXPECT_EQ(stats.dump().find("previous_values_dropped")->longLongValue(), 15);
+    EXPECT_EQ(log->count("new keys are no longer remembered"), 1u);
+    stats.TEST_reset();
+}
+
 TEST_F(ASession, FindsTheSameRedundancyAsASearchOfTheStoreUnderRandomTraffic) {
     auto s = make();
     std::mt19937 rng(7);

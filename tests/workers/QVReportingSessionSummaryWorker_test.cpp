@@ -3,12 +3,14 @@
 #include <gtest/gtest.h>
 
 #include <algorithm>
+#include <limits>
 #include <string>
 #include <vector>
 
 #include "fakes/FakePlatform.h"
 #include "fakes/MemoryLogSink.h"
 #include "session/QVReportingSession.h"
+#include "session/QVReportingStats.h"
 #include "session/QVReportingWorkerRegistry.h"
 #include "workers/backends/QVReportingSessionMetricsHubWorker.h"
 
@@ -77,6 +79,57 @@ TEST_F(ASummaryWorker, CountsActivityAndMessagesAndLeavesOutWhatCannotBeKnown) {
     EXPECT_EQ(*summary.find("HostApplicationDisplayID"), Value("Unknown"));
     EXPECT_EQ(*summary.find("thermal_state"), Value("Unknown"));
     EXPECT_EQ(log->count("Error with task_info(): no such file"), 1u);
+}
+
+TEST_F(ASummaryWorker, ForwardsWhatTheStoreBudgetsLeaveUnstoredAndSaysHowMany) {
+    test::ScopedMemoryLog log;
+    auto& stats = QVReportingStats::shared();
+    stats.TEST_reset();
+    const std::size_t daemonBefore = stats.storeBytes();
+    const std::size_t sessionBefore = session->storedBytes();
+    const std::size_t budget = sessionBefore + 2000;
+    stats.setStoreBudgets(budget, std::numeric_limits<std::size_t>::max());
+    for (int i = 0; i < 50; ++i) {
+        send({{"i", i}, {"padding", std::string(100, 'x')}});
+    }
+    const std::size_t stored = session->messages().size() - 1;  // the start state message aside
+    EXPECT_GT(stored, 0u);
+    EXPECT_LT(stored, 50u);
+    EXPECT_LE(session->storedBytes(), budget);
+    EXPECT_EQ(session->messagesNotStored(), 50 - stored);
+    EXPECT_EQ(stats.messagesNotStored(), 50 - stored);
+    EXPECT_EQ(stats.storeBytes() - daemonBefore, session->storedBytes() - sessionBefore);
+    EXPECT_EQ(fake.analytics.eventsNamed("com.korvane.qvsound.Generic.Generic").size(), 50u)
+        << "every message is forwarded, stored or not";
+    EXPECT_EQ(log->count("store budget used up: session 21"), 1u) << "one warning a run";
+
+    // The daemon-wide budget holds for every session.
+    auto other = QVReportingSession::initWithID(fake.platform, 22, {1});
+    other->start();
+    stats.setStoreBudgets(std::numeric_limits<std::size_t>::max(), stats.storeBytes());
+    other->sendMessage(std::make_shared<QVReportingSessionMessage>(
+        Dictionary{{"x", 1}}, category::kGeneric, type::kGeneric));
+    EXPECT_EQ(other->messages().size(), 1u);
+    EXPECT_EQ(other->messagesNotStored(), 1u);
+    other.reset();
+
+    stats.setStoreBudgets(budget, std::numeric_limits<std::size_t>::max());
+    const Dictionary summary = stopAndGetSummary();
+    EXPECT_EQ(*summary.find("num_messages"), Value(50));
+    EXPECT_EQ(*summary.find("num_messages_not_stored"), Value(std::uint64_t{50 - stored}));
+    EXPECT_EQ(*summary.find("num_redundant_messages"), Value(0u)) << "unstored is not redundant";
+    EXPECT_EQ(stats.storeBytes(), daemonBefore - sessionBefore) << "a stop gives the bytes back";
+
+    // The next run starts with an empty store and a summary without the key.
+    session->start();
+    send({{"again", 1}});
+    EXPECT_EQ(session->messages().size(), 2u);
+    EXPECT_EQ(session->messagesNotStored(), 0u);
+    session->stop();
+    EXPECT_FALSE(fake.analytics.eventsNamed(kSummaryEvent)
+                     .back()
+                     .payload.contains("num_messages_not_stored"));
+    stats.TEST_reset();
 }
 
 TEST_F(ASummaryWorker, DescribesTheSessionAndTheDeviceInItsFixedKeyOrder) {

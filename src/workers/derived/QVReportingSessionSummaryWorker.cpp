@@ -64,9 +64,12 @@ Dictionary QVReportingSessionSummaryWorker::summary(const QVReportingSession& se
     const auto stored = static_cast<std::uint64_t>(session.messages().size());
     const auto received =
         static_cast<std::uint64_t>(std::max<std::int64_t>(session.totalMessageCount(), 0));
+    // Received messages that went unstored for want of budget were not redundant.
+    const std::uint64_t notStored = session.messagesNotStored();
     // The session's own state messages are stored without being received: the difference stops
     // at zero rather than wrapping round.
-    const std::uint64_t redundant = received > stored ? received - stored : 0;
+    const std::uint64_t redundant =
+        received > stored + notStored ? received - stored - notStored : 0;
     Dictionary payload{
         {"total_active_time", totalActiveTime_},
         {"active_count", std::uint64_t{activeCount_}},
@@ -95,6 +98,10 @@ Dictionary QVReportingSessionSummaryWorker::summary(const QVReportingSession& se
     payload.set("load_avg_1_min", loads[0]);
     payload.set("load_avg_5_min", loads[1]);
     payload.set("load_avg_15_min", loads[2]);
+    // Only a session that outgrew its store budget says so; others keep the usual keys.
+    if (notStored > 0) {
+        payload.set("num_messages_not_stored", notStored);
+    }
     return payload;
 }
 
