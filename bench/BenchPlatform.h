@@ -5,6 +5,7 @@
 #include <unistd.h>
 
 #include <filesystem>
+#include <limits>
 #include <string>
 
 #include "platform/Platform.h"
@@ -17,6 +18,7 @@
 #include "platform/linux/LinuxProcessInfo.h"
 #include "platform/linux/LinuxSystemCondition.h"
 #include "session/QVReportingLog.h"
+#include "session/QVReportingStats.h"
 
 namespace qv::bench {
 
@@ -26,6 +28,9 @@ struct BenchPlatform {
               (std::filesystem::temp_directory_path() / (name + "-" + std::to_string(::getpid())))
                   .string()) {
         setLogLevel(LogLevel::Error);
+        // Sessions of 10^5 and 10^6 messages are measured, beyond the daemon's store budgets.
+        QVReportingStats::shared().setStoreBudgets(std::numeric_limits<std::size_t>::max(),
+                                                   std::numeric_limits<std::size_t>::max());
     }
     ~BenchPlatform() { std::filesystem::remove_all(stateDir); }
 

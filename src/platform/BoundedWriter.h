@@ -2,8 +2,12 @@
 // waits: an item that finds the buffer full is refused, and the caller counts the loss. Used where
 // a slow consumer (the journal, a sink file) must never stall the reporting server queue.
 //
-// Thread safety: push() and flush() may be called from any thread; the writer function runs only
-// on the writer's own thread, one item at a time, in push order.
+// The writer takes either one item at a time or, with kBatches, everything queued at once (a
+// sink then writes many lines with one system call when it falls behind). While a batch is being
+// written, up to `capacity` further items may queue, so at most twice that is held.
+//
+// Thread safety: push(), flush() and flushUntil() may be called from any thread; the writer
+// function runs only on the writer's own thread, in push order.
 #pragma once
 
 #include <chrono>
@@ -19,7 +23,19 @@ namespace qv {
 template <typename T>
 class BoundedWriter {
   public:
+    using Batch = std::deque<T>;
+    struct Batches {};
+    static constexpr Batches kBatches{};
+
+    // The writer takes one item at a time.
     BoundedWriter(std::size_t capacity, std::function<void(T&)> write)
+        : BoundedWriter(kBatches, capacity, [write = std::move(write)](Batch& batch) {
+              for (T& item : batch) {
+                  write(item);
+              }
+          }) {}
+    // The writer takes every item queued, oldest first.
+    BoundedWriter(Batches, std::size_t capacity, std::function<void(Batch&)> write)
         : capacity_(capacity), write_(std::move(write)), thread_([this] { run(); }) {}
 
     BoundedWriter(const BoundedWriter&) = delete;
@@ -67,26 +83,27 @@ class BoundedWriter {
     std::size_t pushedCount() const { return written_ + inFlight_ + items_.size(); }
 
     void run() {
+        Batch batch;
         std::unique_lock lock(mutex_);
         for (;;) {
             wake_.wait(lock, [&] { return stopping_ || !items_.empty(); });
             if (items_.empty()) {
                 return;  // stopping and drained
             }
-            T item = std::move(items_.front());
-            items_.pop_front();
-            inFlight_ = 1;
+            batch.swap(items_);
+            inFlight_ = batch.size();
             lock.unlock();
-            write_(item);
+            write_(batch);
+            batch.clear();
             lock.lock();
+            written_ += inFlight_;
             inFlight_ = 0;
-            ++written_;
             drained_.notify_all();
         }
     }
 
     const std::size_t capacity_;
-    const std::function<void(T&)> write_;
+    const std::function<void(Batch&)> write_;
     std::mutex mutex_;
     std::condition_variable wake_;
     std::condition_variable drained_;

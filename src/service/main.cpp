@@ -107,6 +107,7 @@ int main(int argc, char** argv) {
     LinuxNotificationCenter notifications;
     const SinkCallbacks sinkCallbacks{
         [](std::string_view sink) { QVReportingStats::shared().noteSinkLineLost(sink); },
+        [](std::string_view) { QVReportingStats::shared().noteSinkTornLineRemoved(); },
         reportProblem};
     auto analytics = LinuxAnalyticsService::create(options->stateDir, clock,
                                                    options->analyticsEventsFile, sinkCallbacks);

@@ -46,6 +46,10 @@ void QVReportingStats::noteSinkLineLost(std::string_view sink) {
     ++it->second;
 }
 
+void QVReportingStats::noteSinkTornLineRemoved() {
+    sinkTornLinesRemoved_.fetch_add(1, std::memory_order_relaxed);
+}
+
 void QVReportingStats::noteClientCount(std::size_t clients) {
     clients_.store(clients);
     raiseMax(clientsMax_, clients);
@@ -122,6 +126,7 @@ Dictionary QVReportingStats::dump() const {
         }
     }
     out.set("sink_lines_lost", sinkTotal);
+    out.set("sink_torn_lines_removed", sinkTornLinesRemoved_.load());
     out.set("clients", clients_.load());
     out.set("clients_max", clientsMax_.load());
     out.set("sessions", sessions_.load());
@@ -149,6 +154,7 @@ void QVReportingStats::TEST_reset() {
     storeBytesMax_.store(storeBytes_.load());
     messagesNotStored_.store(0);
     previousValuesDropped_.store(0);
+    sinkTornLinesRemoved_.store(0);
     std::lock_guard lock(mutex_);
     sinkLinesLost_.clear();
 }

@@ -65,6 +65,8 @@ class QVReportingStats {
     void noteLogLineDropped();
     // A line a sink could not write, or that found its buffer full.
     void noteSinkLineLost(std::string_view sink);
+    // A torn last line (a crash in the middle of a write) removed from a sink file at start.
+    void noteSinkTornLineRemoved();
     void noteClientCount(std::size_t clients);
     void noteSessionCount(std::size_t sessions);
 
@@ -113,6 +115,7 @@ class QVReportingStats {
     std::atomic<std::uint64_t> storeBytesMax_{0};
     std::atomic<std::uint64_t> messagesNotStored_{0};
     std::atomic<std::uint64_t> previousValuesDropped_{0};
+    std::atomic<std::uint64_t> sinkTornLinesRemoved_{0};
     mutable std::mutex mutex_;
     std::map<std::string, std::uint64_t, std::less<>> sinkLinesLost_;  // guarded by mutex_
 };

@@ -1,6 +1,7 @@
 #include "platform/linux/JsonlSink.h"
 
 #include <fcntl.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -30,6 +31,29 @@ std::string errnoText(int error) {
 std::mutex gSinksMutex;
 std::vector<JsonlSink*> gSinks;  // guarded by gSinksMutex
 
+// Where a torn last line starts in a file of `size` bytes: just after its last line feed (0 when
+// it has none); -1 when the file ends with a line feed or cannot be read.
+off_t startOfTornLine(int fd, off_t size) {
+    char block[4096];
+    off_t end = size;
+    bool atEnd = true;
+    while (end > 0) {
+        const off_t from = std::max<off_t>(0, end - static_cast<off_t>(sizeof block));
+        const ssize_t n = ::pread(fd, block, static_cast<std::size_t>(end - from), from);
+        if (n != end - from) {
+            return -1;
+        }
+        for (ssize_t i = n - 1; i >= 0; --i) {
+            if (block[i] == '\n') {
+                return atEnd && i == n - 1 ? -1 : from + i + 1;
+            }
+            atEnd = false;
+        }
+        end = from;
+    }
+    return 0;
+}
+
 }  // namespace
 
 JsonlSink::JsonlSink(std::string stateDir, std::string name, const Clock& clock,
@@ -41,8 +65,9 @@ JsonlSink::JsonlSink(std::string stateDir, std::string name, const Clock& clock,
       clock_(clock),
       callbacks_(std::move(callbacks)),
       capacity_(std::max<std::size_t>(capacity, 1)),
-      writer_(std::make_unique<BoundedWriter<Line>>(capacity_,
-                                                    [this](Line& line) { writeLine(line); })) {
+      writer_(std::make_unique<BoundedWriter<Line>>(
+          BoundedWriter<Line>::kBatches, capacity_,
+          [this](std::deque<Line>& lines) { writeBatch(lines); })) {
     std::lock_guard lock(gSinksMutex);
     gSinks.push_back(this);
 }
@@ -89,32 +114,85 @@ void JsonlSink::flush() {
     writer_->flush();
 }
 
-void JsonlSink::writeLine(Line& line) {
-    std::string text;
-    try {
+void JsonlSink::formatLine(std::string& out, const Line& line) {
+    const std::size_t start = out.size();
+    out += "{\"time\":";
+    QVReportingAppendJsonText(out, Value(line.time));
+    bool valid = true;
+    for (const auto& [key, value] : line.members) {
+        out += ',';
+        valid = QVReportingAppendJsonText(out, Value(std::string_view(key))) && valid;
+        out += ':';
+        valid = valid && QVReportingAppendJsonText(out, value);
+        if (!valid) {
+            break;
+        }
+    }
+    if (!valid) {
+        // Text that is not valid UTF-8 has its bad bytes replaced rather than losing the line.
+        out.resize(start);
         nlohmann::ordered_json object = nlohmann::ordered_json::object();
         object["time"] = line.time;
         for (const auto& [key, value] : line.members) {
             object[key] = QVReportingValueToJson(value);
         }
-        text = object.dump(-1, ' ', false, nlohmann::ordered_json::error_handler_t::replace);
-    } catch (const std::exception& e) {
-        lose(fmt::format("cannot format a line: {}", e.what()));
-        return;
+        out += object.dump(-1, ' ', false, nlohmann::ordered_json::error_handler_t::replace);
+    } else {
+        out += '}';
     }
-    text.push_back('\n');
+    out += '\n';
+}
 
+void JsonlSink::writeBatch(std::deque<Line>& lines) {
+    text_.clear();
+    std::size_t pending = 0;
+    for (const Line& line : lines) {
+        try {
+            formatLine(text_, line);
+        } catch (const std::exception& e) {
+            lose(fmt::format("cannot format a line: {}", e.what()));
+            continue;
+        }
+        ++pending;
+        if (text_.size() >= kMaxWriteBytes) {
+            writeText(text_, pending);
+            text_.clear();
+            pending = 0;
+        }
+    }
+    if (pending > 0) {
+        writeText(text_, pending);
+    }
+    // A burst's buffer is not kept for the quiet that follows.
+    if (text_.capacity() > kMaxWriteBytes * 2) {
+        std::string().swap(text_);
+    }
+}
+
+void JsonlSink::writeText(const std::string& text, std::size_t lines) {
     std::string reason;
     if (!openFile(reason)) {
-        lose(reason);
+        lose(reason, lines);
         return;
     }
-    // One write per line: with O_APPEND the line lands whole at the end, whoever else appends.
-    ssize_t written;
-    do {
-        written = ::write(fd_, text.data(), text.size());
-    } while (written < 0 && errno == EINTR);
-    if (written == static_cast<ssize_t>(text.size())) {
+    std::string_view rest = text;
+    if (tornByUs_) {
+        // Our last write stopped inside a line: end that fragment so these lines stay whole.
+        if (::write(fd_, "\n", 1) == 1) {
+            tornByUs_ = false;
+        }
+    }
+    while (!rest.empty()) {
+        const ssize_t n = ::write(fd_, rest.data(), rest.size());
+        if (n < 0 && errno == EINTR) {
+            continue;
+        }
+        if (n <= 0) {
+            break;
+        }
+        rest.remove_prefix(static_cast<std::size_t>(n));
+    }
+    if (rest.empty()) {
         if (!lastProblem_.empty() && callbacks_.problem) {
             callbacks_.problem(fmt::format("sink {}: writing to {} again after {} lost lines",
                                            name_, path_, lostInRun_));
@@ -123,14 +201,14 @@ void JsonlSink::writeLine(Line& line) {
         lostInRun_ = 0;
         return;
     }
-    if (written < 0) {
-        reason = fmt::format("cannot write to {}: {}", path_, errnoText(errno));
-    } else {
-        reason = fmt::format("short write to {}: {} of {} bytes", path_, written, text.size());
-    }
-    // A descriptor that failed once is not trusted again: the next line opens the file afresh.
+    const int error = errno;
+    const std::string_view written(text.data(), text.size() - rest.size());
+    tornByUs_ = !written.empty() && written.back() != '\n';
+    const auto whole = static_cast<std::size_t>(std::count(written.begin(), written.end(), '\n'));
+    reason = fmt::format("cannot write to {}: {}", path_, errnoText(error));
+    // A descriptor that failed once is not trusted again: the next lines open the file afresh.
     closeFile();
-    lose(reason);
+    lose(reason, lines - whole);
 }
 
 bool JsonlSink::openFile(std::string& reason) {
@@ -152,7 +230,43 @@ bool JsonlSink::openFile(std::string& reason) {
         return false;
     }
     fd_ = fd;
+    if (!tailChecked_) {
+        tailChecked_ = true;
+        repairTornTail();
+    }
     return true;
+}
+
+void JsonlSink::repairTornTail() {
+    struct stat st {};
+    if (::fstat(fd_, &st) != 0 || !S_ISREG(st.st_mode) || st.st_size == 0) {
+        return;
+    }
+    // The sink's own descriptor only writes (a pipe in the file's place must not be read).
+    const int reader = ::open(path_.c_str(), O_RDONLY | O_CLOEXEC);
+    if (reader < 0) {
+        return;
+    }
+    const off_t keep = startOfTornLine(reader, st.st_size);
+    ::close(reader);
+    if (keep < 0) {
+        return;
+    }
+    if (::ftruncate(fd_, keep) != 0) {
+        if (callbacks_.problem) {
+            callbacks_.problem(fmt::format("sink {}: cannot remove the torn last line of {}: {}",
+                                           name_, path_, errnoText(errno)));
+        }
+        return;
+    }
+    if (callbacks_.tornLineRemoved) {
+        callbacks_.tornLineRemoved(name_);
+    }
+    if (callbacks_.problem) {
+        callbacks_.problem(
+            fmt::format("sink {}: removed a torn last line of {} bytes from {} (left by a crash)",
+                        name_, st.st_size - keep, path_));
+    }
 }
 
 void JsonlSink::closeFile() {
@@ -162,9 +276,9 @@ void JsonlSink::closeFile() {
     }
 }
 
-void JsonlSink::lose(const std::string& reason) {
-    ++lostInRun_;
-    if (callbacks_.lineLost) {
+void JsonlSink::lose(const std::string& reason, std::size_t lines) {
+    lostInRun_ += lines;
+    for (std::size_t i = 0; i < lines && callbacks_.lineLost; ++i) {
         callbacks_.lineLost(name_);
     }
     if (reason != lastProblem_) {

@@ -4,8 +4,11 @@
 // services put what they receive.
 //
 // append() never waits: lines go through a bounded buffer to the sink's own thread, which turns
-// them into JSON and writes each with one write(2) on an O_APPEND descriptor as soon as it is
-// woken, so a line reaches its file promptly and whole even when other processes append too. A
+// them into JSON and writes them on an O_APPEND descriptor as soon as it is woken: each write(2)
+// holds only whole lines (all those queued, up to kMaxWriteBytes), so a line reaches its file
+// promptly and whole even when other processes append too, and a busy sink costs one system call
+// for many lines. A crash in the middle of a write can leave a torn last line: the next run
+// removes it before writing (and tells tornLineRemoved), so the file stays whole JSON lines. A
 // line that finds the buffer full is dropped; a line that cannot be written (the directory cannot
 // be made, the file cannot be opened, the write fails or falls short) is lost; either way the
 // loss is counted through the callbacks and the sink goes on, opening the file afresh for the
@@ -24,6 +27,7 @@
 #include <chrono>
 #include <cstddef>
 #include <cstdint>
+#include <deque>
 #include <functional>
 #include <memory>
 #include <string>
@@ -41,6 +45,8 @@ class Clock;
 struct SinkCallbacks {
     // One line lost (buffer full, or not written); called once per line.
     std::function<void(std::string_view sinkName)> lineLost;
+    // A torn last line (left by a crash in the middle of a write) removed from the file.
+    std::function<void(std::string_view sinkName)> tornLineRemoved;
     // A problem worth an error line: the text names the sink and the cause. Repeats of the same
     // cause are not reported again until a line is written or the cause changes, so a broken
     // disk costs one log line, not one per event; lineLost still hears of every line.
@@ -85,12 +91,22 @@ class JsonlSink {
         Dictionary members;
     };
 
+    // Lines are written this many bytes at a time at most, when many are queued.
+    static constexpr std::size_t kMaxWriteBytes = 256 * 1024;
+
     // The sink's thread only, from here down.
-    void writeLine(Line& line);
+    void writeBatch(std::deque<Line>& lines);
+    // Appends the line's JSON text and its line feed to out.
+    void formatLine(std::string& out, const Line& line);
+    // Writes text, which holds `lines` whole lines; on failure they are lost.
+    void writeText(const std::string& text, std::size_t lines);
     // Makes the directory and opens the file when no descriptor is open; false with a reason.
     bool openFile(std::string& reason);
+    // On the first open: a last line cut short by a crash is removed, so the file stays whole
+    // JSON lines.
+    void repairTornTail();
     void closeFile();
-    void lose(const std::string& reason);
+    void lose(const std::string& reason, std::size_t lines = 1);
 
     const std::string name_;
     const std::string directory_;
@@ -104,6 +120,9 @@ class JsonlSink {
     int fd_ = -1;                  // sink's thread only
     std::string lastProblem_;      // sink's thread only: the cause last reported, "" when healthy
     std::uint64_t lostInRun_ = 0;  // sink's thread only: lines lost since the last written one
+    bool tailChecked_ = false;     // sink's thread only: the file's end was looked at
+    bool tornByUs_ = false;        // sink's thread only: our last write ended inside a line
+    std::string text_;             // sink's thread only: lines being written
 
     // Last, and reset first in the destructor: its thread uses every member above.
     std::unique_ptr<BoundedWriter<Line>> writer_;
