@@ -204,16 +204,21 @@ void QVReportingClientServerInstance::sendMessage(Dictionary payload, AudioEvent
         payload.set("sendSingleMessage", 1);
     }
     queue_.async([self = shared_from_this(), payload = std::move(payload), category, type,
-                  ids = std::move(ids), reply = std::move(reply)] {
+                  ids = std::move(ids), reply = std::move(reply)]() mutable {
         QVLOG_DEBUG(QVReportingClientCategory(), "sending message for reporter {}",
                     describeIDs(ids));
         if (!self->delegate_.isReportingEnabled()) {
             reply(QVReportingError::reportingDisabled());
             return;
         }
-        for (const auto& session : self->delegate_.findReportingSessionsForIDs(ids)) {
-            session->sendMessage(
-                std::make_shared<QVReportingSessionMessage>(payload, category, type));
+        const auto sessions = self->delegate_.findReportingSessionsForIDs(ids);
+        for (std::size_t i = 0; i < sessions.size(); ++i) {
+            // Each session gets a message of its own; the last one takes the payload itself.
+            sessions[i]->sendMessage(
+                i + 1 < sessions.size()
+                    ? std::make_shared<QVReportingSessionMessage>(payload, category, type)
+                    : std::make_shared<QVReportingSessionMessage>(std::move(payload), category,
+                                                                  type));
         }
         reply(std::nullopt);
     });

@@ -208,16 +208,15 @@ bool Reader::readDictionary(const std::string& entrySignature, std::size_t depth
     while (!atEnd(type, inner)) {
         m_.enterDictEntry(entrySignature);
         Value k, v;
+        std::string name;
         if (stringKeys) {
-            std::string name;
             m_ >> name;
             if (!charge(name.size() + 5)) {
                 return false;
             }
             if (isTopLevel) {
-                key = name;
+                key.assign(name);  // named in errors; its buffer is reused entry after entry
             }
-            k = std::move(name);
         } else if (!read(depth, k)) {
             return false;
         }
@@ -226,7 +225,7 @@ bool Reader::readDictionary(const std::string& entrySignature, std::size_t depth
         }
         m_.exitDictEntry();
         if (stringKeys) {
-            dict.set(*k.asString(), std::move(v));
+            dict.set(std::move(name), std::move(v));
         } else {
             pairs.push_back(Array{std::move(k), std::move(v)});
         }

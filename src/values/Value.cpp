@@ -619,7 +619,19 @@ void Dictionary::set(std::string_view key, Value value) {
         *existing = std::move(value);
         return;
     }
-    entries_.emplace_back(std::string(key), std::move(value));
+    append(std::string(key), std::move(value));
+}
+
+void Dictionary::set(std::string&& key, Value value) {
+    if (Value* existing = find(key)) {
+        *existing = std::move(value);
+        return;
+    }
+    append(std::move(key), std::move(value));
+}
+
+void Dictionary::append(std::string&& key, Value value) {
+    entries_.emplace_back(std::move(key), std::move(value));
     if (entries_.size() > kSmallDictionary) {
         // Keep the table at most half full so probes stay short.
         if (slots_.size() < entries_.size() * 2) {

@@ -149,6 +149,8 @@ class Dictionary {
 
     // Inserts at the end, or replaces the value in place when the key exists.
     void set(std::string_view key, Value value);
+    void set(std::string&& key, Value value);  // takes the key's buffer
+    void set(const char* key, Value value) { set(std::string_view(key), std::move(value)); }
     // Removes the key; returns whether it was there.
     bool erase(std::string_view key);
     // Sets every entry of other, in other's order (later values win).
@@ -170,6 +172,8 @@ class Dictionary {
 
   private:
     std::ptrdiff_t indexOf(std::string_view key) const;
+    // Appends a key known to be absent.
+    void append(std::string&& key, Value value);
     void rebuildSlots();
     void insertSlot(std::uint32_t entryIndex);
 
