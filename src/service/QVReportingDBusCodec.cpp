@@ -338,7 +338,7 @@ void QVReportingAppendDictionary(sdbus::Message& message, const Dictionary& dict
     message.openContainer("{sv}");
     for (const auto& [key, value] : dictionary) {
         message.openDictEntry("sv");
-        message << key;
+        message << key.str();
         QVReportingAppendVariant(message, value);
         message.closeDictEntry();
     }

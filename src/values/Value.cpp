@@ -529,7 +529,7 @@ std::size_t Value::depth() const {
 
 // ---- Dictionary ----
 
-Dictionary::Dictionary(std::initializer_list<Entry> entries) {
+Dictionary::Dictionary(Literal entries) {
     entries_.reserve(entries.size());
     for (const auto& [k, v] : entries) {
         set(k, v);
@@ -560,15 +560,37 @@ std::ptrdiff_t Dictionary::indexOf(std::string_view key) const {
         const std::size_t size = key.size();
         const char first = size ? key[0] : '\0';
         for (std::size_t i = 0; i < entries_.size(); ++i) {
-            const std::string& k = entries_[i].first;
+            const std::string& k = entries_[i].first.str();
             if (k.size() == size && (size == 0 || (k[0] == first && k == key))) {
                 return static_cast<std::ptrdiff_t>(i);
             }
         }
         return -1;
     }
+    const std::size_t hash = std::hash<std::string_view>{}(key);
     const std::size_t mask = slots_.size() - 1;
-    for (std::size_t s = std::hash<std::string_view>{}(key)&mask;; s = (s + 1) & mask) {
+    for (std::size_t s = hash & mask;; s = (s + 1) & mask) {
+        const std::uint32_t i = slots_[s];
+        if (i == kEmptySlot) {
+            return -1;
+        }
+        if (entries_[i].first.hash() == hash && entries_[i].first == key) {
+            return static_cast<std::ptrdiff_t>(i);
+        }
+    }
+}
+
+std::ptrdiff_t Dictionary::indexOf(const DictionaryKey& key) const {
+    if (slots_.empty()) {
+        for (std::size_t i = 0; i < entries_.size(); ++i) {
+            if (entries_[i].first == key) {
+                return static_cast<std::ptrdiff_t>(i);
+            }
+        }
+        return -1;
+    }
+    const std::size_t mask = slots_.size() - 1;
+    for (std::size_t s = key.hash() & mask;; s = (s + 1) & mask) {
         const std::uint32_t i = slots_[s];
         if (i == kEmptySlot) {
             return -1;
@@ -581,7 +603,7 @@ std::ptrdiff_t Dictionary::indexOf(std::string_view key) const {
 
 void Dictionary::insertSlot(std::uint32_t entryIndex) {
     const std::size_t mask = slots_.size() - 1;
-    std::size_t s = std::hash<std::string_view>{}(entries_[entryIndex].first) & mask;
+    std::size_t s = entries_[entryIndex].first.hash() & mask;
     while (slots_[s] != kEmptySlot) {
         s = (s + 1) & mask;
     }
@@ -614,23 +636,33 @@ Value* Dictionary::find(std::string_view key) {
     return i < 0 ? nullptr : &entries_[static_cast<std::size_t>(i)].second;
 }
 
+const Value* Dictionary::find(const DictionaryKey& key) const {
+    const auto i = indexOf(key);
+    return i < 0 ? nullptr : &entries_[static_cast<std::size_t>(i)].second;
+}
+
+Value* Dictionary::find(const DictionaryKey& key) {
+    const auto i = indexOf(key);
+    return i < 0 ? nullptr : &entries_[static_cast<std::size_t>(i)].second;
+}
+
 void Dictionary::set(std::string_view key, Value value) {
     if (Value* existing = find(key)) {
         *existing = std::move(value);
         return;
     }
-    append(std::string(key), std::move(value));
+    append(DictionaryKey(key), std::move(value));
 }
 
-void Dictionary::set(std::string&& key, Value value) {
+void Dictionary::set(const DictionaryKey& key, Value value) {
     if (Value* existing = find(key)) {
         *existing = std::move(value);
         return;
     }
-    append(std::move(key), std::move(value));
+    append(key, std::move(value));
 }
 
-void Dictionary::append(std::string&& key, Value value) {
+void Dictionary::append(DictionaryKey key, Value value) {
     entries_.emplace_back(std::move(key), std::move(value));
     if (entries_.size() > kSmallDictionary) {
         // Keep the table at most half full so probes stay short.
@@ -654,7 +686,7 @@ bool Dictionary::erase(std::string_view key) {
     return true;
 }
 
-const Value* Dictionary::findNear(std::string_view key, std::size_t hint) const {
+const Value* Dictionary::findNear(const DictionaryKey& key, std::size_t hint) const {
     if (hint < entries_.size() && entries_[hint].first == key) {
         return &entries_[hint].second;
     }
@@ -677,7 +709,7 @@ void Dictionary::merge(const Dictionary& other) {
             *existing = v;
             ++hint;
         } else {
-            set(k, v);
+            append(k, v);
             hint = entries_.size();
         }
     }
@@ -697,7 +729,7 @@ std::size_t Dictionary::approximateHeapBytes() const {
         n += slots_.capacity() * sizeof(slots_[0]) + kAllocationOverhead;
     }
     for (const auto& [key, value] : entries_) {
-        n += stringHeapBytes(key) + value.approximateHeapBytes();
+        n += key.ownedHeapBytes() + value.approximateHeapBytes();
     }
     return n;
 }

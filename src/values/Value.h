@@ -22,6 +22,8 @@
 #include <variant>
 #include <vector>
 
+#include "values/DictionaryKey.h"
+
 namespace qv {
 
 class Value;
@@ -127,11 +129,13 @@ class Value {
 // through an index built on first need.
 class Dictionary {
   public:
-    using Entry = std::pair<std::string, Value>;
+    using Entry = std::pair<DictionaryKey, Value>;
     using const_iterator = std::vector<Entry>::const_iterator;
+    // What a dictionary is written as in code: {{"key", value}, ...}.
+    using Literal = std::initializer_list<std::pair<std::string_view, Value>>;
 
     Dictionary() = default;
-    Dictionary(std::initializer_list<Entry> entries);
+    Dictionary(Literal entries);
     // A copy with room for extra more entries.
     Dictionary(const Dictionary& other, std::size_t extra);
 
@@ -142,15 +146,17 @@ class Dictionary {
 
     const Value* find(std::string_view key) const;
     Value* find(std::string_view key);
+    // By a key of another dictionary: usually a pointer comparison per entry.
+    const Value* find(const DictionaryKey& key) const;
+    Value* find(const DictionaryKey& key);
     bool contains(std::string_view key) const { return find(key) != nullptr; }
     // find(), trying the entry at position hint first: cheap when two dictionaries hold their
     // keys in the same order.
-    const Value* findNear(std::string_view key, std::size_t hint) const;
+    const Value* findNear(const DictionaryKey& key, std::size_t hint) const;
 
     // Inserts at the end, or replaces the value in place when the key exists.
     void set(std::string_view key, Value value);
-    void set(std::string&& key, Value value);  // takes the key's buffer
-    void set(const char* key, Value value) { set(std::string_view(key), std::move(value)); }
+    void set(const DictionaryKey& key, Value value);
     // Removes the key; returns whether it was there.
     bool erase(std::string_view key);
     // Sets every entry of other, in other's order (later values win).
@@ -172,8 +178,9 @@ class Dictionary {
 
   private:
     std::ptrdiff_t indexOf(std::string_view key) const;
+    std::ptrdiff_t indexOf(const DictionaryKey& key) const;
     // Appends a key known to be absent.
-    void append(std::string&& key, Value value);
+    void append(DictionaryKey key, Value value);
     void rebuildSlots();
     void insertSlot(std::uint32_t entryIndex);
 

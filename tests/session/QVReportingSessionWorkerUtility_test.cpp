@@ -12,7 +12,7 @@ namespace {
 using MessagePtr = std::shared_ptr<QVReportingSessionMessage>;
 using Messages = std::vector<MessagePtr>;
 
-MessagePtr message(std::initializer_list<Dictionary::Entry> entries) {
+MessagePtr message(Dictionary::Literal entries) {
     return QVReportingSessionMessage::initWithMessage(Dictionary(entries), 1, 2);
 }
 // A message holding key (as its own value) at time t.

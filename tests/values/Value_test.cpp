@@ -95,6 +95,34 @@ TEST(Value, ReadsTextByTheNumberItStartsWithAndEverythingElseAsZero) {
     EXPECT_EQ(Value(std::numeric_limits<double>::quiet_NaN()).intValue(), 0);
 }
 
+TEST(DictionaryKey, SharesShortTextsOwnsLongOnesAndComparesByTextEitherWay) {
+    const DictionaryKey a("session output"), b(std::string("session output"));
+    EXPECT_TRUE(a.isInterned());
+    EXPECT_EQ(a.data(), b.data()) << "one interned text";
+    EXPECT_TRUE(a.hasBlank());
+    EXPECT_FALSE(DictionaryKey("volume").hasBlank());
+    EXPECT_EQ(a.ownedHeapBytes(), 0u);
+
+    const std::string longText(DictionaryKey::kMaxInternedLength + 1, 'k');
+    const std::size_t interned = DictionaryKey::TEST_internedCount();
+    DictionaryKey owned(longText);
+    EXPECT_FALSE(owned.isInterned());
+    EXPECT_EQ(DictionaryKey::TEST_internedCount(), interned) << "long texts never fill the table";
+    EXPECT_GT(owned.ownedHeapBytes(), longText.size());
+    DictionaryKey copy = owned;
+    owned = DictionaryKey("other");  // the copy keeps the text alive
+    EXPECT_EQ(copy, DictionaryKey(longText));
+    EXPECT_EQ(copy.str(), longText);
+    EXPECT_EQ(std::hash<DictionaryKey>{}(copy), std::hash<std::string_view>{}(longText));
+    EXPECT_TRUE(DictionaryKey() == "");
+    EXPECT_LT(DictionaryKey("a"), DictionaryKey("b"));
+
+    Dictionary d{{longText, 1}, {"session output", 2}};
+    EXPECT_EQ(*d.find(longText), Value(1));
+    EXPECT_EQ(*d.find(copy), Value(1));
+    EXPECT_EQ(*d.find(b), Value(2));
+}
+
 TEST(Dictionary, KeepsInsertionOrderWhenAKeyIsOverwrittenAndAppendsAfterErase) {
     Dictionary d{{"c", 1}, {"a", 2}, {"b", 3}, {"a", "two"}};  // first place, last value
     EXPECT_EQ(keysOf(d), (std::vector<std::string>{"c", "a", "b"}));

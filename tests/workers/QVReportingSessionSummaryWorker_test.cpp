@@ -144,7 +144,7 @@ TEST_F(ASummaryWorker, DescribesTheSessionAndTheDeviceInItsFixedKeyOrder) {
     const Dictionary summary = stopAndGetSummary();
     // No activity: an average of zero, not a division by zero; the two state messages are stored
     // without being received.
-    const std::vector<Dictionary::Entry> expected = {
+    const std::vector<std::pair<std::string, Value>> expected = {
         {"total_active_time", 0.0},
         {"active_count", 0u},
         {"overload_count", 0u},
@@ -162,7 +162,10 @@ TEST_F(ASummaryWorker, DescribesTheSessionAndTheDeviceInItsFixedKeyOrder) {
         {"load_avg_1_min", 0.5},
         {"load_avg_5_min", 1.25},
         {"load_avg_15_min", 2.0}};
-    std::vector<Dictionary::Entry> got(summary.begin(), summary.end());
+    std::vector<std::pair<std::string, Value>> got;
+    for (const auto& [key, value] : summary) {
+        got.emplace_back(key.str(), value);
+    }
     got.resize(std::min(got.size(), expected.size()));
     EXPECT_EQ(got, expected);
     for (std::size_t i = 0; i < got.size(); ++i) {

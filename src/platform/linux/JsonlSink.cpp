@@ -203,7 +203,9 @@ void JsonlSink::writeText(const std::string& text, std::size_t lines) {
     }
     const int error = errno;
     const std::string_view written(text.data(), text.size() - rest.size());
-    tornByUs_ = !written.empty() && written.back() != '\n';
+    if (!written.empty()) {  // else an earlier torn line is still torn
+        tornByUs_ = written.back() != '\n';
+    }
     const auto whole = static_cast<std::size_t>(std::count(written.begin(), written.end(), '\n'));
     reason = fmt::format("cannot write to {}: {}", path_, errnoText(error));
     // A descriptor that failed once is not trusted again: the next lines open the file afresh.
