@@ -17,11 +17,32 @@ const char* yesNo(bool b) {
     return b ? "YES" : "NO";
 }
 
+// The keys every message is stamped with, made once: a key compares by pointer and carries its
+// hash, so looking these up per message costs no hashing.
+struct StampKeys {
+    const DictionaryKey timestamp{QVReportingInternalEventEpochTime};
+    const DictionaryKey processUptime{QVReportingInternalEventProcessUptimeMS};
+    const DictionaryKey systemUptime{QVReportingInternalEventSystemUptimeSec};
+    const DictionaryKey invalidTimestamp{QVReportingMessageKeyInvalidTimestamp};
+    const DictionaryKey audioTag{QVReportingMessageKeyAudioTag};
+    const DictionaryKey applicationName{QVReportingApplicationName};
+};
+
+const StampKeys kStampKeys;
+
+const StampKeys& keys() {
+    return kStampKeys;
+}
+
 // Keys that change with every message of an unchanged state, so redundancy ignores them.
-bool ignoredByRedundancy(std::string_view key) {
-    return key == QVReportingInternalEventProcessUptimeMS ||
-           key == QVReportingInternalEventSystemUptimeSec ||
-           key == QVReportingInternalEventEpochTime;
+inline bool ignoredByRedundancy(const DictionaryKey& key) {
+    const StampKeys& k = keys();
+    if (key.isInterned()) {  // the usual case: three pointer comparisons
+        const void* id = key.identity();
+        return id == k.timestamp.identity() || id == k.processUptime.identity() ||
+               id == k.systemUptime.identity();
+    }
+    return key == k.processUptime || key == k.systemUptime || key == k.timestamp;
 }
 
 std::size_t countCompared(const Dictionary& d) {
@@ -130,32 +151,33 @@ std::string QVReportingSession::description() const {
 
 double QVReportingSession::getEpochTimeFromQVReportingStateMessage(
     const QVReportingSessionMessage& message) {
-    const Value* t = message.message().find(QVReportingInternalEventEpochTime);
+    const Value* t = message.message().find(keys().timestamp);
     return t ? t->doubleValue() : 0.0;
 }
 
 void QVReportingSession::addMissingDates(QVReportingSessionMessage& message, const Clock& clock) {
     Dictionary& payload = message.message();
     const double now = clock.now();
-    if (Value* stamp = payload.find(QVReportingInternalEventEpochTime)) {
+    const StampKeys& k = keys();
+    if (Value* stamp = payload.find(k.timestamp)) {
         const auto t = timestampOf(*stamp);
         // Future times are accepted as they are; only stale or unreadable ones are replaced.
         if (!t || *t < now - kMaximumTimestampAge) {
             Value rejected = std::move(*stamp);
             *stamp = now;
-            payload.set(QVReportingMessageKeyInvalidTimestamp, std::move(rejected));
+            payload.set(k.invalidTimestamp, std::move(rejected));
         }
         return;
     }
-    payload.set(QVReportingMessageKeyInvalidTimestamp, "nil");
-    payload.set(QVReportingInternalEventEpochTime, now);
+    payload.set(k.invalidTimestamp, "nil");
+    payload.set(k.timestamp, now);
 }
 
 void QVReportingSession::removeWhiteSpaceFromKeys(QVReportingSessionMessage& message) {
     Dictionary& payload = message.message();
     std::vector<std::string> blankKeys;
     for (const auto& entry : payload) {
-        if (entry.first.find(' ') != std::string::npos) {
+        if (entry.first.hasBlank()) {
             blankKeys.push_back(entry.first);
         }
     }
@@ -176,21 +198,22 @@ void QVReportingSession::removeWhiteSpaceFromKeys(QVReportingSessionMessage& mes
 void QVReportingSession::addAudioMessageTag(QVReportingSessionMessage& message) {
     std::string tag = QVReportingUtilityCategoryString(message.category());
     tag += QVReportingUtilityTypeString(message.type());
-    message.message().set(QVReportingMessageKeyAudioTag, std::move(tag));
+    message.message().set(keys().audioTag, std::move(tag));
 }
 
 void QVReportingSession::addAppName(QVReportingSessionMessage& message) const {
     Dictionary& payload = message.message();
-    Value* name = payload.find(QVReportingApplicationName);
+    const DictionaryKey& key = keys().applicationName;
+    Value* name = payload.find(key);
     if (name && !(name->isString() && *name->asString() == "Unknown")) {
         return;
     }
-    const Value* configured = configuration_.find(QVReportingApplicationName);
+    const Value* configured = configuration_.find(key);
     Value chosen = configured ? *configured : Value("Unknown");
     if (name) {
         *name = std::move(chosen);
     } else {
-        payload.set(QVReportingApplicationName, std::move(chosen));
+        payload.set(key, std::move(chosen));
     }
 }
 

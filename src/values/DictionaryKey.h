@@ -68,9 +68,18 @@ class DictionaryKey {
     // Heap memory this key alone holds (an interned text belongs to the table, not to its keys).
     std::size_t ownedHeapBytes() const;
 
+    // Keys with one identity have one text; two interned keys of different identities have
+    // different texts (the table holds each text once).
+    const void* identity() const { return text_; }
+
     bool operator==(const DictionaryKey& other) const {
-        return text_ == other.text_ ||
-               (text_->hash == other.text_->hash && text_->text == other.text_->text);
+        if (text_ == other.text_) {
+            return true;
+        }
+        if (text_->interned && other.text_->interned) {
+            return false;
+        }
+        return text_->hash == other.text_->hash && text_->text == other.text_->text;
     }
     bool operator==(std::string_view text) const { return text_->text == text; }
     bool operator==(const char* text) const { return text_->text == text; }
