@@ -61,15 +61,24 @@ class AccessoryTestCase(unittest.TestCase):
         self.state = os.path.join(self.workdir, "state")
         os.makedirs(os.path.join(self.state, "defaults"))
         self.daemon = None
+        self.clients = []
 
     def tearDown(self):
+        status = 0
         if self.daemon:
-            self.daemon.stop()
+            # Clients leave before the daemon is told to stop, so its exit status speaks of the
+            # daemon's own shutdown alone.
+            for client in self.clients:
+                client.connection.close()
+            wait_until(lambda: self.daemon.log_text().count("invalidationHandler: connection exited") >= len(self.clients),
+                       what="the clients to leave")
+            status = self.daemon.stop()
         self.bluez.terminate()
         self.bluez.wait(timeout=10)
         self.connection.close()
         self.bus.stop()
         shutil.rmtree(self.workdir, ignore_errors=True)
+        self.assertEqual(status, 0, "qvreportd left cleanly")
 
     def device(self, address, paired=True, connected=False, info=None):
         self.mock.AddDevice("hci0", address, "Earbuds")
@@ -87,6 +96,10 @@ class AccessoryTestCase(unittest.TestCase):
         wait_until(lambda: f"BlueZ: org.bluez is " in self.daemon.log_text()
                    and f"{paired} paired of" in self.daemon.log_text(),
                    what="the daemon to read BlueZ")
+
+    def client(self):
+        self.clients.append(Client(self.bus))
+        return self.clients[-1]
 
     def suite(self):
         path = os.path.join(self.state, "defaults", SUITE + ".json")
@@ -120,7 +133,7 @@ class Gathering(AccessoryTestCase):
         self.device("00:00:00:00:00:06", paired=False, info=good)
         self.start_daemon(5)
         before = time.time()
-        client = Client(self.bus)
+        client = self.client()
         self.session_with_trigger(client, 100)
         after = time.time()
 
@@ -166,7 +179,7 @@ class Publication(AccessoryTestCase):
         self.device("00:00:00:00:00:01", connected=True, info=good)
         self.device("00:00:00:00:00:02", info={**good, "TELPVersionInfo": version_info("K2")})
         self.start_daemon(2)
-        client = Client(self.bus)
+        client = self.client()
         before = time.time()
         self.session_with_trigger(client, 200)
 
@@ -197,7 +210,7 @@ class NoBlueZ(AccessoryTestCase):
         self.daemon = Daemon(self.bus, self.state, "--bluez-bus",
                              "unix:path=" + os.path.join(self.workdir, "no-such-bus"),
                              "--accessory-dir", self.accessories)
-        client = Client(self.bus)
+        client = self.client()
         self.session_with_trigger(client, 300)
         log = wait_until(lambda: "There have been no BT enumerations" in self.daemon.log_text()
                          and self.daemon.log_text(), what="the stop")

@@ -14,6 +14,7 @@
 
 #include <fmt/format.h>
 #include <sdbus-c++/sdbus-c++.h>
+#include <systemd/sd-bus.h>
 
 #include "platform/linux/AccessoryInformationFile.h"
 
@@ -46,6 +47,33 @@ std::string printable(std::string_view text) {
         out += "...";
     }
     return out;
+}
+
+// Why the bus cannot be reached now, or nothing when it can. The binding keeps the half-made bus
+// of a connection that fails, so a bus that stays away would cost memory at every attempt: it is
+// tried with sd-bus first, which gives everything back.
+std::optional<std::string> unreachable(const std::string& bus) {
+    sd_bus* probe = nullptr;
+    int r = 0;
+    if (bus == "system") {
+        r = sd_bus_open_system(&probe);
+    } else {
+        r = sd_bus_new(&probe);
+        if (r >= 0) {
+            r = sd_bus_set_address(probe, bus.c_str());
+        }
+        if (r >= 0) {
+            r = sd_bus_set_bus_client(probe, 1);
+        }
+        if (r >= 0) {
+            r = sd_bus_start(probe);
+        }
+    }
+    sd_bus_flush_close_unref(probe);
+    if (r < 0) {
+        return std::string(std::strerror(-r));
+    }
+    return std::nullopt;
 }
 
 std::unique_ptr<sdbus::IConnection> connectTo(const std::string& bus) {
@@ -411,6 +439,9 @@ void LinuxBluetoothFacility::run() {
     while (!stopping_) {
         std::unique_ptr<sdbus::IConnection> connection;
         try {
+            if (auto why = unreachable(bus_)) {
+                throw sdbus::Error("org.freedesktop.DBus.Error.NoServer", *why);
+            }
             connection = connectTo(bus_);
         } catch (const sdbus::Error& e) {
             // Logged once per outage: an absent bus is a normal state of some hosts.
