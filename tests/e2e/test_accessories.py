@@ -70,7 +70,8 @@ class AccessoryTestCase(unittest.TestCase):
             # daemon's own shutdown alone.
             for client in self.clients:
                 client.connection.close()
-            wait_until(lambda: self.daemon.log_text().count("invalidationHandler: connection exited") >= len(self.clients),
+            left = "invalidationHandler: connection exited"
+            wait_until(lambda: self.daemon.log_text().count(left) >= len(self.clients),
                        what="the clients to leave")
             status = self.daemon.stop()
         self.bluez.terminate()
