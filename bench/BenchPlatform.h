@@ -10,6 +10,7 @@
 
 #include "platform/Platform.h"
 #include "platform/linux/LinuxAnalyticsService.h"
+#include "platform/linux/LinuxBluetoothFacility.h"
 #include "platform/linux/LinuxClock.h"
 #include "platform/linux/LinuxConvoService.h"
 #include "platform/linux/LinuxDeviceInformation.h"
@@ -46,8 +47,10 @@ struct BenchPlatform {
     LinuxConvoService convo{preferences, std::make_unique<JsonlSink>(
                                              stateDir, std::string(LinuxConvoService::kSinkName),
                                              clock, SinkCallbacks{})};
-    Platform platform{clock,     device, process, preferences, notifications, *analytics.service,
-                      condition, convo};
+    // No BlueZ here: the benchmarks gather no accessory information.
+    LinuxBluetoothFacility bluetooth{"unix:path=" + stateDir + "/no-bluez-bus", stateDir, {}};
+    Platform platform{clock,     device, process,  preferences, notifications, *analytics.service,
+                      condition, convo,  bluetooth};
 };
 
 }  // namespace qv::bench

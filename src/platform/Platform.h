@@ -6,6 +6,7 @@
 namespace qv {
 
 class AnalyticsService;
+class BluetoothFacility;
 class Clock;
 class ConvoService;
 class DeviceInformation;
@@ -23,6 +24,7 @@ struct Platform {
     AnalyticsService& analytics;
     SystemCondition& condition;
     ConvoService& convo;
+    BluetoothFacility& bluetooth;
 };
 
 }  // namespace qv

@@ -91,6 +91,13 @@ std::optional<QVReportingDaemonOptions> QVReportingParseDaemonOptions(int argc, 
                    "Memory the stored messages of all sessions may take together")
         ->capture_default_str()
         ->check(CLI::PositiveNumber);
+    app.add_option("--bluez-bus", o.bluezBus,
+                   "Bus to read BlueZ (org.bluez) from: system, or a bus address (unix:path=...)")
+        ->capture_default_str();
+    app.add_option("--accessory-dir", o.accessoryDir,
+                   "Directory of accessory information files, one per paired accessory: "
+                   "ADDRESS.json (e.g. AA:BB:CC:DD:EE:FF.json)")
+        ->capture_default_str();
     try {
         app.parse(argc, argv);
     } catch (const CLI::ParseError& e) {

@@ -17,6 +17,8 @@ struct QVReportingDaemonOptions {
     std::string analyticsEventsFile;
     LogLevel logLevel = LogLevel::Info;
     QVReportingLimits limits;
+    std::string bluezBus = "system";  // "system" or a bus address: where BlueZ is read
+    std::string accessoryDir = "/etc/qvreportd/accessories";
 };
 
 // Parses argv. Returns the options, or nothing after printing help, the version or an error;

@@ -15,6 +15,7 @@
 
 #include "monitoring/QVReportingSystemMonitor.h"
 #include "platform/linux/LinuxAnalyticsService.h"
+#include "platform/linux/LinuxBluetoothFacility.h"
 #include "platform/linux/LinuxClock.h"
 #include "platform/linux/LinuxConvoService.h"
 #include "platform/linux/LinuxDeviceInformation.h"
@@ -120,8 +121,26 @@ int main(int argc, char** argv) {
         preferences,
         std::make_unique<JsonlSink>(options->stateDir, std::string(LinuxConvoService::kSinkName),
                                     clock, sinkCallbacks));
-    const Platform platform{
-        clock, device, process, preferences, notifications, *analytics.service, condition, convo};
+    // BlueZ is followed on a thread of the facility's own; a bus that cannot be reached now only
+    // leaves Bluetooth unavailable until it can.
+    LinuxBluetoothFacility bluetooth(
+        options->bluezBus, options->accessoryDir,
+        [](LinuxBluetoothFacility::LogLevel level, const std::string& line) {
+            switch (level) {
+                case LinuxBluetoothFacility::LogLevel::Info:
+                    QVLOG_INFO(QVReportingAudioRegistrationCategory(), "{}", line);
+                    break;
+                case LinuxBluetoothFacility::LogLevel::Default:
+                    QVLOG_DEFAULT(QVReportingAudioRegistrationCategory(), "{}", line);
+                    break;
+                case LinuxBluetoothFacility::LogLevel::Error:
+                    QVLOG_ERROR(QVReportingAudioRegistrationCategory(), "{}", line);
+                    break;
+            }
+        });
+    const Platform platform{clock,       device,        process,
+                            preferences, notifications, *analytics.service,
+                            condition,   convo,         bluetooth};
 
     QVReportingWorkerRegistry::setAllWorkerClasses(QVReportingAllWorkerClasses());
     SerialQueue& queue = QVReportingUtilityGetReportingServerQueue();

@@ -1,6 +1,7 @@
 // A Platform made of fakes, each reachable by the test.
 #pragma once
 
+#include "fakes/FakeBluetoothFacility.h"
 #include "fakes/FakeClock.h"
 #include "fakes/FakeConvoService.h"
 #include "fakes/FakeDeviceInformation.h"
@@ -14,14 +15,20 @@ struct FakePlatform {
     struct Replacements {
         AnalyticsService* analytics = nullptr;
         ConvoService* convo = nullptr;
+        BluetoothFacility* bluetooth = nullptr;
     };
 
     // The fakes' platform with some services replaced, for a test that brings its own.
     Platform with(const Replacements& r) {
-        return Platform{clock,         device,
-                        process,       preferences,
-                        notifications, r.analytics ? *r.analytics : analytics,
-                        condition,     r.convo ? *r.convo : convo};
+        return Platform{clock,
+                        device,
+                        process,
+                        preferences,
+                        notifications,
+                        r.analytics ? *r.analytics : analytics,
+                        condition,
+                        r.convo ? *r.convo : convo,
+                        r.bluetooth ? *r.bluetooth : bluetooth};
     }
 
     FakeClock clock;
@@ -32,6 +39,7 @@ struct FakePlatform {
     FakeAnalyticsService analytics;
     FakeSystemCondition condition;
     FakeConvoService convo;
+    FakeBluetoothFacility bluetooth;
     Platform platform = with({});
 };
 

@@ -1,0 +1,153 @@
+#include "platform/linux/AccessoryInformationFile.h"
+
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstring>
+
+#include <fmt/format.h>
+#include <nlohmann/json.hpp>
+
+#include "platform/BluetoothFacility.h"
+#include "platform/SafeFileName.h"
+#include "values/ValueJson.h"
+
+namespace qv {
+
+namespace {
+
+constexpr std::size_t kAddressLength = 17;  // "AA:BB:CC:DD:EE:FF"
+
+AccessoryFileResult refused(std::string reason) {
+    AccessoryFileResult r;
+    r.status = AccessoryFileResult::Status::Refused;
+    r.reason = std::move(reason);
+    return r;
+}
+
+// Closes the descriptor however the reader leaves.
+struct FileDescriptor {
+    int fd;
+    ~FileDescriptor() {
+        if (fd >= 0) {
+            ::close(fd);
+        }
+    }
+};
+
+}  // namespace
+
+std::optional<std::string> QVReportingCanonicalBluetoothAddress(std::string_view text) {
+    if (text.size() != kAddressLength) {
+        return std::nullopt;
+    }
+    std::string canonical(text);
+    for (std::size_t i = 0; i < canonical.size(); ++i) {
+        char& c = canonical[i];
+        if (i % 3 == 2) {
+            if (c != ':') {
+                return std::nullopt;
+            }
+        } else if (c >= 'a' && c <= 'f') {
+            c = static_cast<char>(c - 'a' + 'A');
+        } else if (!((c >= '0' && c <= '9') || (c >= 'A' && c <= 'F'))) {
+            return std::nullopt;
+        }
+    }
+    return canonical;
+}
+
+std::string QVReportingAccessoryFilePath(const std::string& directory,
+                                         const std::string& canonicalAddress) {
+    // The address is checked already; the safe name keeps it inside the directory regardless.
+    return directory + "/" + QVReportingSafeFileComponent(canonicalAddress + ".json");
+}
+
+AccessoryFileResult QVReportingReadAccessoryFile(const std::string& directory,
+                                                 const std::string& canonicalAddress) {
+    const std::string path = QVReportingAccessoryFilePath(directory, canonicalAddress);
+    // No symbolic link may lead out of the directory, and a pipe or device must not block us.
+    FileDescriptor file{::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOFOLLOW | O_NONBLOCK)};
+    if (file.fd < 0) {
+        if (errno == ENOENT) {
+            return {};
+        }
+        if (errno == ELOOP) {
+            return refused("it is a symbolic link");
+        }
+        return refused(fmt::format("cannot open it: {}", std::strerror(errno)));
+    }
+    struct stat st {};
+    if (::fstat(file.fd, &st) != 0) {
+        return refused(fmt::format("cannot examine it: {}", std::strerror(errno)));
+    }
+    if (!S_ISREG(st.st_mode)) {
+        return refused("it is not a regular file");
+    }
+    if (static_cast<std::uint64_t>(st.st_size) > kMaxAccessoryFileBytes) {
+        return refused(fmt::format("it holds {} bytes, more than the {} accepted", st.st_size,
+                                   kMaxAccessoryFileBytes));
+    }
+    std::string text;
+    text.resize(kMaxAccessoryFileBytes + 1);
+    std::size_t length = 0;
+    while (length < text.size()) {
+        const ssize_t n = ::read(file.fd, text.data() + length, text.size() - length);
+        if (n < 0) {
+            if (errno == EINTR) {
+                continue;
+            }
+            return refused(fmt::format("cannot read it: {}", std::strerror(errno)));
+        }
+        if (n == 0) {
+            break;
+        }
+        length += static_cast<std::size_t>(n);
+    }
+    if (length > kMaxAccessoryFileBytes) {  // it grew while being read
+        return refused(
+            fmt::format("it holds more than the {} bytes accepted", kMaxAccessoryFileBytes));
+    }
+    text.resize(length);
+
+    std::size_t deepest = 0;
+    const auto json = nlohmann::ordered_json::parse(
+        text,
+        [&deepest](int depth, nlohmann::ordered_json::parse_event_t, nlohmann::ordered_json&) {
+            deepest = std::max(deepest, static_cast<std::size_t>(depth));
+            return true;
+        },
+        /*allow_exceptions=*/false);
+    if (json.is_discarded()) {
+        return refused("it is not JSON");
+    }
+    // The callback's depth counts the containers open around a value.
+    if (deepest > kMaxAccessoryFileDepth) {
+        return refused(fmt::format("it is nested deeper than {} levels", kMaxAccessoryFileDepth));
+    }
+    if (!json.is_object()) {
+        return refused("it is not a JSON object");
+    }
+    const auto versions = json.find(accessory::kTELPVersionInfo);
+    if (versions == json.end()) {
+        return refused(fmt::format("it has no \"{}\"", accessory::kTELPVersionInfo));
+    }
+    if (!versions->is_array()) {
+        return refused(fmt::format("its \"{}\" is not a list", accessory::kTELPVersionInfo));
+    }
+    const auto caseInfo = json.find(accessory::kCaseInfo);
+    if (caseInfo == json.end()) {
+        return refused(fmt::format("it has no \"{}\"", accessory::kCaseInfo));
+    }
+    if (!caseInfo->is_object()) {
+        return refused(fmt::format("its \"{}\" is not an object", accessory::kCaseInfo));
+    }
+    AccessoryFileResult r;
+    r.status = AccessoryFileResult::Status::Loaded;
+    r.information = QVReportingDictionaryFromJson(json);
+    return r;
+}
+
+}  // namespace qv

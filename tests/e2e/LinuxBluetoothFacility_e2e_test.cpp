@@ -1,0 +1,326 @@
+// The Linux Bluetooth facility against a BlueZ on a private bus: a dbus-daemon of its own and
+// python-dbusmock's bluez5 template, driven through its mock interface as a test bench would
+// drive a radio. No adapter is needed.
+#include "platform/linux/LinuxBluetoothFacility.h"
+
+#include <fcntl.h>
+#include <gtest/gtest.h>
+#include <signal.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <chrono>
+#include <cstdio>
+#include <fstream>
+#include <functional>
+#include <mutex>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include <sdbus-c++/sdbus-c++.h>
+
+#include "fakes/TempDirectory.h"
+
+namespace qv {
+namespace {
+
+using namespace std::chrono_literals;
+
+constexpr const char* kMock = "org.bluez.Mock";
+constexpr const char* kGenericMock = "org.freedesktop.DBus.Mock";
+
+bool waitUntil(const std::function<bool()>& predicate, std::chrono::seconds timeout = 10s) {
+    const auto deadline = std::chrono::steady_clock::now() + timeout;
+    while (!predicate()) {
+        if (std::chrono::steady_clock::now() > deadline) {
+            return false;
+        }
+        std::this_thread::sleep_for(10ms);
+    }
+    return true;
+}
+
+// A private bus and, when asked, a mock BlueZ on it; both ended with the object.
+class PrivateBus {
+  public:
+    PrivateBus() {
+        FILE* bus = popen("dbus-daemon --session --fork --print-address=1 --print-pid=1", "r");
+        char line[512] = {}, pid[32] = {};
+        const bool read = bus && fgets(line, sizeof line, bus) && fgets(pid, sizeof pid, bus);
+        if (bus) {
+            pclose(bus);
+        }
+        if (read) {
+            address = line;
+            address.erase(address.find_last_not_of('\n') + 1);
+            busPid_ = std::stoi(pid);
+            control_ = sdbus::createSessionBusConnectionWithAddress(address);
+        }
+    }
+    ~PrivateBus() {
+        stopBlueZ();
+        control_.reset();
+        if (busPid_ > 0) {
+            kill(busPid_, SIGTERM);
+        }
+    }
+
+    void startBlueZ() {
+        bluezPid_ = fork();
+        if (bluezPid_ == 0) {
+            setenv("DBUS_SYSTEM_BUS_ADDRESS", address.c_str(), 1);
+            const int quiet = open("/dev/null", O_WRONLY);
+            dup2(quiet, STDOUT_FILENO);
+            dup2(quiet, STDERR_FILENO);
+            execl("/usr/bin/python3", "python3", "-m", "dbusmock", "--template", "bluez5",
+                  static_cast<char*>(nullptr));
+            _exit(127);
+        }
+        auto daemon =
+            sdbus::createProxy(*control_, "org.freedesktop.DBus", "/org/freedesktop/DBus");
+        ASSERT_TRUE(waitUntil([&] {
+            bool owned = false;
+            daemon->callMethod("NameHasOwner")
+                .onInterface("org.freedesktop.DBus")
+                .withArguments(std::string("org.bluez"))
+                .storeResultsTo(owned);
+            return owned;
+        })) << "the mock BlueZ never came";
+        mock_ = sdbus::createProxy(*control_, "org.bluez", "/");
+    }
+    void stopBlueZ() {
+        mock_.reset();
+        if (bluezPid_ > 0) {
+            kill(bluezPid_, SIGTERM);
+            waitpid(bluezPid_, nullptr, 0);
+            bluezPid_ = -1;
+        }
+    }
+
+    sdbus::IProxy& mock() { return *mock_; }
+
+    // A device with the template's own calls: added, then paired and connected as asked.
+    std::string addDevice(const std::string& device, bool paired, bool connected) {
+        std::string path;
+        mock_->callMethod("AddDevice")
+            .onInterface(kMock)
+            .withArguments("hci0", device, "Earbuds")
+            .storeResultsTo(path);
+        if (paired) {
+            mock_->callMethod("PairDevice").onInterface(kMock).withArguments("hci0", device, 0u);
+        }
+        if (connected) {
+            mock_->callMethod("ConnectDevice").onInterface(kMock).withArguments("hci0", device);
+        }
+        return path;
+    }
+
+    // A Device1 object made by hand, with whatever properties a test wants BlueZ to claim.
+    void addRawDevice(const std::string& path, std::map<std::string, sdbus::Variant> properties) {
+        mock_->callMethod("AddObject")
+            .onInterface(kGenericMock)
+            .withArguments(
+                path, std::string("org.bluez.Device1"), properties,
+                std::vector<sdbus::Struct<std::string, std::string, std::string, std::string>>{});
+        std::map<std::string, std::map<std::string, sdbus::Variant>> interfaces{
+            {"org.bluez.Device1", properties}};
+        std::vector<sdbus::Variant> args{sdbus::Variant(sdbus::ObjectPath(path)),
+                                         sdbus::Variant(interfaces)};
+        mock_->callMethod("EmitSignal")
+            .onInterface(kGenericMock)
+            .withArguments(std::string("org.freedesktop.DBus.ObjectManager"),
+                           std::string("InterfacesAdded"), std::string("oa{sa{sv}}"), args);
+    }
+
+    std::string address;
+
+  private:
+    pid_t busPid_ = -1;
+    pid_t bluezPid_ = -1;
+    std::unique_ptr<sdbus::IConnection> control_;
+    std::unique_ptr<sdbus::IProxy> mock_;
+};
+
+class Lines {
+  public:
+    LinuxBluetoothFacility::LogCallback callback() {
+        return [this](LinuxBluetoothFacility::LogLevel, const std::string& line) {
+            std::lock_guard lock(mutex_);
+            lines_.push_back(line);
+        };
+    }
+    std::size_t count(const std::string& needle) const {
+        std::lock_guard lock(mutex_);
+        std::size_t n = 0;
+        for (const auto& l : lines_) {
+            n += l.find(needle) != std::string::npos ? 1 : 0;
+        }
+        return n;
+    }
+
+    // Every line, for a failure message.
+    std::string all() const {
+        std::lock_guard lock(mutex_);
+        std::string out;
+        for (const auto& l : lines_) {
+            out += l + "\n";
+        }
+        return out;
+    }
+
+  private:
+    mutable std::mutex mutex_;
+    std::vector<std::string> lines_;
+};
+
+void writeAccessory(const test::TempDirectory& dir, const std::string& address,
+                    const std::string& text) {
+    const auto tmp = dir / (address + ".tmp");
+    std::ofstream(tmp) << text;
+    std::filesystem::rename(tmp, dir / (address + ".json"));
+}
+
+const char* kGoodFile =
+    R"({"TELPVersionInfo": ["a", "M4801", "c", "KEY"], "CaseInfo": {"CaseInfoVersion": "1"}})";
+
+std::vector<std::string> addresses(const std::vector<BluetoothPairedDevice>& devices) {
+    std::vector<std::string> out;
+    for (const auto& d : devices) {
+        out.push_back(d.address);
+    }
+    return out;
+}
+
+// Whether the facility lists the device of that address with accessory information.
+bool hasInformation(const BluetoothFacility& facility, const std::string& address) {
+    for (const auto& d : facility.pairedDevices()) {
+        if (d.address == address) {
+            return d.accessoryInformation.has_value();
+        }
+    }
+    return false;
+}
+
+TEST(TheLinuxBluetoothFacility, FollowsBlueZAndTheAccessoryDirectory) {
+    PrivateBus bus;
+    ASSERT_FALSE(bus.address.empty()) << "no dbus-daemon";
+    test::TempDirectory dir("qvaccessories");
+    writeAccessory(dir, "00:00:00:00:00:01", kGoodFile);
+    writeAccessory(dir, "00:00:00:00:00:02", kGoodFile);
+    Lines log;
+    LinuxBluetoothFacility facility(bus.address, dir.path().string(), log.callback());
+
+    // No BlueZ yet: unavailable, and said so.
+    ASSERT_TRUE(waitUntil([&] { return log.count("org.bluez has no owner") == 1; }));
+    EXPECT_FALSE(facility.available());
+    EXPECT_TRUE(facility.pairedDevices().empty());
+
+    bus.startBlueZ();
+    ASSERT_TRUE(waitUntil([&] { return facility.available(); }));
+    bus.mock().callMethod("AddAdapter").onInterface(kMock).withArguments("hci0", "bench");
+    const std::string first = bus.addDevice("00:00:00:00:00:01", true, true);
+    bus.addDevice("00:00:00:00:00:02", true, false);
+    bus.addDevice("00:00:00:00:00:03", false, false);  // seen but not paired
+    bus.addDevice("00:00:00:00:00:04", true, false);   // paired, no accessory file
+    ASSERT_TRUE(waitUntil([&] { return facility.pairedDevices().size() == 3; }));
+    auto devices = facility.pairedDevices();
+    EXPECT_EQ(
+        addresses(devices),
+        (std::vector<std::string>{"00:00:00:00:00:01", "00:00:00:00:00:02", "00:00:00:00:00:04"}))
+        << "object-path order";
+    EXPECT_EQ(devices[0].identifier, first);
+    EXPECT_TRUE(devices[0].connected);
+    EXPECT_FALSE(devices[1].connected);
+    ASSERT_TRUE(devices[0].accessoryInformation.has_value());
+    EXPECT_EQ(devices[0].accessoryInformation->find("TELPVersionInfo")->asArray()->size(), 4u);
+    EXPECT_FALSE(devices[2].accessoryInformation.has_value());
+
+    // Connection changes arrive as signals.
+    bus.mock()
+        .callMethod("DisconnectDevice")
+        .onInterface(kMock)
+        .withArguments("hci0", "00:00:00:00:00:01");
+    ASSERT_TRUE(waitUntil([&] { return !facility.isConnected(first); }));
+    bus.mock()
+        .callMethod("ConnectDevice")
+        .onInterface(kMock)
+        .withArguments("hci0", "00:00:00:00:00:01");
+    ASSERT_TRUE(waitUntil([&] { return facility.isConnected(first); }));
+
+    // The directory is followed: a file that appears, one that goes bad, one that goes away.
+    writeAccessory(dir, "00:00:00:00:00:04", kGoodFile);
+    ASSERT_TRUE(waitUntil([&] { return hasInformation(facility, "00:00:00:00:00:04"); }))
+        << log.all();
+    writeAccessory(dir, "00:00:00:00:00:02", "{\"TELPVersionInfo\": 5, \"CaseInfo\": {}}");
+    ASSERT_TRUE(waitUntil([&] { return !hasInformation(facility, "00:00:00:00:00:02"); }));
+    EXPECT_EQ(log.count("00:00:00:00:00:02.json refused: its \"TELPVersionInfo\" is not a list"),
+              1u);
+    std::filesystem::remove(dir / "00:00:00:00:00:04.json");
+    ASSERT_TRUE(waitUntil([&] { return !hasInformation(facility, "00:00:00:00:00:04"); }));
+
+    // A device removed from BlueZ leaves the list.
+    bus.mock()
+        .callMethod("RemoveDevice")
+        .onInterface("org.bluez.Adapter1")
+        .withArguments(sdbus::ObjectPath(first));
+    ASSERT_TRUE(waitUntil([&] { return facility.pairedDevices().size() == 2; }));
+    EXPECT_FALSE(facility.isConnected(first));
+
+    // BlueZ goes away and comes back: unavailable, then read afresh.
+    const auto syncs = facility.TEST_syncCount();
+    bus.stopBlueZ();
+    ASSERT_TRUE(waitUntil([&] { return !facility.available(); }));
+    EXPECT_TRUE(facility.pairedDevices().empty());
+    bus.startBlueZ();
+    ASSERT_TRUE(waitUntil([&] { return facility.TEST_syncCount() > syncs; }));
+    EXPECT_TRUE(facility.available());
+    EXPECT_TRUE(facility.pairedDevices().empty()) << "the new BlueZ has no devices yet";
+}
+
+TEST(TheLinuxBluetoothFacility, NeverLetsWhatBlueZClaimsNameAFileOutsideItsDirectory) {
+    PrivateBus bus;
+    ASSERT_FALSE(bus.address.empty()) << "no dbus-daemon";
+    test::TempDirectory root("qvaccessories");
+    std::filesystem::create_directory(root / "accessories");
+    const auto dir = root / "accessories";
+    // Files a hostile address could aim at, next to and above the directory.
+    std::ofstream(root / "passwd.json") << kGoodFile;
+    std::ofstream(dir / ".json") << kGoodFile;
+    std::ofstream(dir / "AA:BB:CC:DD:EE:FF.json") << kGoodFile;
+    Lines log;
+    bus.startBlueZ();
+    LinuxBluetoothFacility facility(bus.address, dir.string(), log.callback());
+    ASSERT_TRUE(waitUntil([&] { return facility.available(); }));
+    bus.mock().callMethod("AddAdapter").onInterface(kMock).withArguments("hci0", "bench");
+
+    auto raw = [&](const std::string& path, sdbus::Variant address, sdbus::Variant paired) {
+        bus.addRawDevice(
+            path, {{"Address", address}, {"Paired", paired}, {"Connected", sdbus::Variant(true)}});
+    };
+    raw("/org/bluez/hci0/dev_a", sdbus::Variant(std::string("../passwd")), sdbus::Variant(true));
+    raw("/org/bluez/hci0/dev_b", sdbus::Variant(std::string("")), sdbus::Variant(true));
+    raw("/org/bluez/hci0/dev_c", sdbus::Variant(std::string("aa:bb:cc:dd:ee:ff")),
+        sdbus::Variant(true));
+    raw("/org/bluez/hci0/dev_d", sdbus::Variant(std::uint32_t{7}), sdbus::Variant(true));
+    raw("/org/bluez/hci0/dev_e", sdbus::Variant(std::string("AA:BB:CC:DD:EE:FF")),
+        sdbus::Variant(std::string("yes")));
+    raw("/org/bluez/hci0/dev_f", sdbus::Variant(std::string("AA:BB:CC:DD:EE:FF/../../passwd")),
+        sdbus::Variant(true));
+    ASSERT_TRUE(waitUntil([&] { return log.count("is not a boolean") == 1; }));
+    ASSERT_TRUE(waitUntil([&] { return facility.pairedDevices().size() == 5; }));
+
+    // Only the well-formed address (in any case) has accessory information; the others are
+    // listed without any, each refusal logged; a Paired that is not a boolean pairs nothing.
+    for (const auto& d : facility.pairedDevices()) {
+        EXPECT_EQ(d.accessoryInformation.has_value(), d.identifier == "/org/bluez/hci0/dev_c")
+            << d.identifier;
+        EXPECT_TRUE(d.address.empty() || d.address == "AA:BB:CC:DD:EE:FF") << d.address;
+    }
+    EXPECT_EQ(log.count("has the address \"../passwd\", which is not a Bluetooth address"), 1u);
+    EXPECT_EQ(log.count("which is not a Bluetooth address"), 3u);
+    EXPECT_EQ(log.count("Address of /org/bluez/hci0/dev_d is not a string"), 1u);
+}
+
+}  // namespace
+}  // namespace qv
