@@ -12,6 +12,7 @@
 #include "platform/linux/LinuxClock.h"
 #include "platform/linux/LinuxConvoService.h"
 #include "platform/linux/LinuxDeviceInformation.h"
+#include "platform/linux/LinuxIssueCaptureService.h"
 #include "platform/linux/LinuxNotificationCenter.h"
 #include "platform/linux/LinuxPreferenceStore.h"
 #include "platform/linux/LinuxProcessInfo.h"
@@ -41,8 +42,17 @@ struct BenchPlatform {
     LinuxConvoService convo{preferences, std::make_unique<JsonlSink>(
                                              stateDir, std::string(LinuxConvoService::kSinkName),
                                              clock, SinkCallbacks{})};
-    Platform platform{clock,     device, process, preferences, notifications, *analytics.service,
-                      condition, convo};
+    LinuxIssueCaptureService issueCapture{
+        clock, preferences,
+        std::make_unique<JsonlSink>(stateDir, std::string(LinuxIssueCaptureService::kSinkName),
+                                    clock, SinkCallbacks{}),
+        LinuxIssueCaptureService::Options{
+            (std::filesystem::path(stateDir) / "logs" / "Audio" / "Captures").string(),
+            std::nullopt, ::getpid()},
+        LinuxIssueCaptureService::Callbacks{}};
+    Platform platform{clock,       device,        process,
+                      preferences, notifications, *analytics.service,
+                      condition,   convo,         issueCapture};
 };
 
 }  // namespace qv::bench

@@ -9,6 +9,7 @@ class AnalyticsService;
 class Clock;
 class ConvoService;
 class DeviceInformation;
+class IssueCaptureService;
 class NotificationCenter;
 class PreferenceStore;
 class ProcessInfo;
@@ -23,6 +24,7 @@ struct Platform {
     AnalyticsService& analytics;
     SystemCondition& condition;
     ConvoService& convo;
+    IssueCaptureService& issueCapture;
 };
 
 }  // namespace qv

@@ -82,6 +82,9 @@ std::optional<QVReportingDaemonOptions> QVReportingParseDaemonOptions(int argc, 
     app.add_option("--max-clients", l.maxClients, "Most clients served at once")
         ->capture_default_str()
         ->check(CLI::PositiveNumber);
+    app.add_option("--journal-dir", o.journalDir,
+                   "Directory of journal files that issue captures read (default: the local "
+                   "journal)");
     try {
         app.parse(argc, argv);
     } catch (const CLI::ParseError& e) {

@@ -17,6 +17,8 @@ struct QVReportingDaemonOptions {
     std::string analyticsEventsFile;
     LogLevel logLevel = LogLevel::Info;
     QVReportingLimits limits;
+    // Journal files the issue-capture service reads; empty: the local journal.
+    std::string journalDir;
 };
 
 // Parses argv. Returns the options, or nothing after printing help, the version or an error;

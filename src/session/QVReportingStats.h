@@ -55,12 +55,16 @@ class QVReportingStats {
     void noteLogLineDropped();
     // A line a sink could not write, or that found its buffer full.
     void noteSinkLineLost(std::string_view sink);
+    // A request the issue-capture service refused (its policy, or no room); reason names the
+    // error code.
+    void noteIssueCaptureRefused(std::string_view reason);
     void noteClientCount(std::size_t clients);
     void noteSessionCount(std::size_t sessions);
 
     std::uint64_t limitExceededCount(Limit limit) const;
     std::uint64_t logLinesDropped() const { return logLinesDropped_.load(); }
     std::uint64_t sinkLinesLost(std::string_view sink) const;
+    std::uint64_t issueCaptureRefused(std::string_view reason) const;
 
     // Every counter by name, for the operator.
     Dictionary dump() const;
@@ -81,7 +85,8 @@ class QVReportingStats {
     std::atomic<std::uint64_t> sessions_{0};
     std::atomic<std::uint64_t> sessionsMax_{0};
     mutable std::mutex mutex_;
-    std::map<std::string, std::uint64_t, std::less<>> sinkLinesLost_;  // guarded by mutex_
+    std::map<std::string, std::uint64_t, std::less<>> sinkLinesLost_;        // guarded by mutex_
+    std::map<std::string, std::uint64_t, std::less<>> issueCaptureRefused_;  // guarded by mutex_
 };
 
 }  // namespace qv

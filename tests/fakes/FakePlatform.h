@@ -4,6 +4,7 @@
 #include "fakes/FakeClock.h"
 #include "fakes/FakeConvoService.h"
 #include "fakes/FakeDeviceInformation.h"
+#include "fakes/FakeIssueCaptureService.h"
 #include "fakes/FakeServices.h"
 #include "platform/Platform.h"
 
@@ -14,14 +15,20 @@ struct FakePlatform {
     struct Replacements {
         AnalyticsService* analytics = nullptr;
         ConvoService* convo = nullptr;
+        IssueCaptureService* issueCapture = nullptr;
     };
 
     // The fakes' platform with some services replaced, for a test that brings its own.
     Platform with(const Replacements& r) {
-        return Platform{clock,         device,
-                        process,       preferences,
-                        notifications, r.analytics ? *r.analytics : analytics,
-                        condition,     r.convo ? *r.convo : convo};
+        return Platform{clock,
+                        device,
+                        process,
+                        preferences,
+                        notifications,
+                        r.analytics ? *r.analytics : analytics,
+                        condition,
+                        r.convo ? *r.convo : convo,
+                        r.issueCapture ? *r.issueCapture : issueCapture};
     }
 
     FakeClock clock;
@@ -32,6 +39,7 @@ struct FakePlatform {
     FakeAnalyticsService analytics;
     FakeSystemCondition condition;
     FakeConvoService convo;
+    FakeIssueCaptureService issueCapture;
     Platform platform = with({});
 };
 
