@@ -18,6 +18,7 @@
 #include "platform/linux/LinuxProcessInfo.h"
 #include "platform/linux/LinuxSystemCondition.h"
 #include "session/QVReportingLog.h"
+#include "session/QVReportingStats.h"
 
 namespace qv::bench {
 
@@ -49,7 +50,11 @@ struct BenchPlatform {
         LinuxIssueCaptureService::Options{
             (std::filesystem::path(stateDir) / "logs" / "Audio" / "Captures").string(),
             std::nullopt, ::getpid()},
-        LinuxIssueCaptureService::Callbacks{}};
+        LinuxIssueCaptureService::Callbacks{[](std::string_view reason) {
+                                                QVReportingStats::shared().noteIssueCaptureRefused(
+                                                    reason);
+                                            },
+                                            {}}};
     Platform platform{clock,       device,        process,
                       preferences, notifications, *analytics.service,
                       condition,   convo,         issueCapture};

@@ -3,6 +3,8 @@
 #include <gtest/gtest.h>
 #include <nlohmann/json.hpp>
 
+#include <signal.h>
+#include <sys/resource.h>
 #include <unistd.h>
 
 #include <cmath>
@@ -15,6 +17,7 @@
 #include "fakes/FakeClock.h"
 #include "fakes/FakeServices.h"
 #include "fakes/TempDirectory.h"
+#include "platform/linux/IssueCaptureCollector.h"
 
 namespace qv {
 namespace {
@@ -139,14 +142,38 @@ TEST_F(ALinuxIssueCaptureService, TakesOneCapturePerSignatureInTheInterval) {
     EXPECT_EQ(reason(session(signature("A"), 60)), kIssueCaptureErrorRequestThrottled);
     clock.advance(0.5);
     EXPECT_EQ(reason(snapshot(signature("A"))), std::nullopt);
+    // A shorter interval applies from the signature's next capture on.
     set(LinuxIssueCaptureService::kSignatureIntervalKey, 5);
+    EXPECT_EQ(reason(snapshot(signature("A"))), kIssueCaptureErrorRequestThrottled);
+    clock.advance(600);
+    EXPECT_EQ(reason(snapshot(signature("A"))), std::nullopt);
     clock.advance(5);
     EXPECT_EQ(reason(snapshot(signature("A"))), std::nullopt);
 
+    // Requests refused for their signature leave no line; every accepted one has its two.
+    const auto requests = sinkLines("snapshot");
     const auto replies = sinkLines("reply");
-    ASSERT_EQ(replies.size(), 6u);
-    EXPECT_EQ(replies[1]["reply"]["reason"], kIssueCaptureErrorRequestThrottled);
-    EXPECT_EQ(sinkLines("snapshot").size(), 5u);
+    ASSERT_EQ(requests.size(), 5u);
+    ASSERT_EQ(replies.size(), 5u);
+    for (std::size_t i = 0; i < requests.size(); ++i) {
+        EXPECT_EQ(requests[i]["sessionID"], replies[i]["sessionID"]);
+        EXPECT_EQ(replies[i]["reply"]["success"], true);
+    }
+    std::lock_guard lock(mutex);
+    EXPECT_EQ(std::count(refused.begin(), refused.end(), "kIssueCaptureErrorRequestThrottled"), 3);
+}
+
+TEST_F(ALinuxIssueCaptureService, RefusesARequestQueuedBehindTheCaptureOfItsSignature) {
+    // The second request may reach the thread before the first is decided, or be turned away
+    // at the door after it: either way it is refused for its signature.
+    std::promise<Dictionary> first, second;
+    ASSERT_TRUE(reporter->snapshotWithSignature(signature("Q"), 0, std::nullopt, std::nullopt,
+                                                [&](const Dictionary& r) { first.set_value(r); }));
+    ASSERT_TRUE(reporter->snapshotWithSignature(signature("Q"), 0, std::nullopt, std::nullopt,
+                                                [&](const Dictionary& r) { second.set_value(r); }));
+    service->flush();
+    EXPECT_EQ(reason(first.get_future().get()), std::nullopt);
+    EXPECT_EQ(reason(second.get_future().get()), kIssueCaptureErrorRequestThrottled);
 }
 
 TEST_F(ALinuxIssueCaptureService, CollectsATimedSessionWhenItsTimeHasPassedUnlessCancelled) {
@@ -286,6 +313,62 @@ TEST_F(ALinuxIssueCaptureService, BoundsTheRequestsWaitingForItsThreadAndItsPend
     EXPECT_EQ(std::count(refused.begin(), refused.end(), "kIssueCaptureErrorServiceUnavailable"),
               static_cast<long>(LinuxIssueCaptureService::kMaxQueuedRequests -
                                 LinuxIssueCaptureService::kMaxPendingSessions + 1));
+}
+
+}  // namespace
+}  // namespace qv
+
+namespace qv {
+namespace {
+
+// A disk that fills up in the middle of a capture, played by a file-size limit: every write past
+// it fails (EFBIG) as a full disk's would (ENOSPC), with SIGXFSZ ignored.
+class FileSizeLimit {
+  public:
+    explicit FileSizeLimit(rlim_t bytes) {
+        getrlimit(RLIMIT_FSIZE, &saved_);
+        previous_ = signal(SIGXFSZ, SIG_IGN);
+        rlimit limit = saved_;
+        limit.rlim_cur = bytes;
+        setrlimit(RLIMIT_FSIZE, &limit);
+    }
+    ~FileSizeLimit() {
+        setrlimit(RLIMIT_FSIZE, &saved_);
+        signal(SIGXFSZ, previous_);
+    }
+
+  private:
+    rlimit saved_{};
+    sighandler_t previous_;
+};
+
+TEST(AnIssueCapture, ThatCannotBeWrittenWholeSaysSoAndLeavesNoHalfManifest) {
+    test::TempDirectory dir{"qvcapture"};
+    IssueCaptureJob job;
+    job.id = "full";
+    job.kind = "snapshot";
+    job.signature = Dictionary{{"detectedProcess", "Unknown"}};
+    job.payload = Dictionary{
+        {std::string(kIssueCaptureKeyPayloadDEParameters),
+         Dictionary{
+             {"x", Dictionary{{"processIDs", Array{static_cast<std::int64_t>(::getpid())}}}}}}};
+    job.directory = dir / "full";
+    job.journalDirectory = (dir / "none").string();
+    IssueCaptureOutcome outcome;
+    {
+        FileSizeLimit limit(64);
+        outcome = QVReportingCollectIssueCapture(job, 1.0);
+    }
+    EXPECT_FALSE(outcome.manifestWritten);
+    EXPECT_FALSE(fs::exists(job.directory / "manifest.json"));
+    EXPECT_FALSE(fs::exists(job.directory / "manifest.json.tmp"));
+    ASSERT_GE(outcome.problems.size(), 2u);  // the status file and the manifest
+    EXPECT_NE(outcome.problems[0].find("status-"), std::string::npos) << outcome.problems[0];
+    bool noted = false;
+    for (const auto& n : outcome.manifest["notCollected"]) {
+        noted = noted || n["why"].get<std::string>().starts_with("writing status-");
+    }
+    EXPECT_TRUE(noted);
 }
 
 }  // namespace

@@ -55,14 +55,21 @@ bool validSignature(const Dictionary& signature) {
     return true;
 }
 
-std::string errorName(std::int64_t reason) {
-    const auto name = IssueCaptureErrorName(reason);
-    return name ? std::string(*name) : std::to_string(reason);
+// The service refuses only with codes it defines.
+std::string_view errorName(std::int64_t reason) {
+    return IssueCaptureErrorName(reason).value_or("unknown");
 }
 
 Dictionary failure(std::int64_t reason) {
     return Dictionary{{std::string(kIssueCaptureReplySuccess), false},
                       {std::string(kIssueCaptureReplyReason), reason}};
+}
+
+// The answers given at the door, made once: a flood meets them many times.
+const Dictionary& refusal(std::int64_t reason) {
+    static const Dictionary unavailable = failure(kIssueCaptureErrorServiceUnavailable);
+    static const Dictionary throttled = failure(kIssueCaptureErrorRequestThrottled);
+    return reason == kIssueCaptureErrorRequestThrottled ? throttled : unavailable;
 }
 
 }  // namespace
@@ -78,8 +85,9 @@ struct LinuxIssueCaptureService::Policy {
 
     static Policy read(const PreferenceStore& preferences) {
         Policy p;
+        const Dictionary suite = preferences.values(kSuite);  // one look at the store
         const auto number = [&](std::string_view key) -> std::optional<double> {
-            const auto v = preferences.value(kSuite, key);
+            const Value* v = suite.find(key);
             if (!v || v->kind() == Value::Kind::Bool) {
                 return std::nullopt;
             }
@@ -89,8 +97,7 @@ struct LinuxIssueCaptureService::Policy {
             }
             return d;
         };
-        if (const auto v = preferences.value(kSuite, kEnabledKey);
-            v && v->kind() == Value::Kind::Bool) {
+        if (const Value* v = suite.find(kEnabledKey); v && v->kind() == Value::Kind::Bool) {
             p.enabled = v->boolValue();
         }
         if (const auto d = number(kDailyLimitKey)) {
@@ -187,6 +194,7 @@ void LinuxIssueCaptureService::flush() {
     {
         std::lock_guard lock(mutex_);
         tasks_.push_back([] {});
+        queued_.store(tasks_.size(), std::memory_order_relaxed);
         target = ++tasksQueued_;
     }
     wake_.notify_one();
@@ -198,24 +206,37 @@ void LinuxIssueCaptureService::flush() {
 }
 
 bool LinuxIssueCaptureService::enqueue(std::function<void()> task) {
+    bool wasEmpty = false;
     {
         std::lock_guard lock(mutex_);
         if (tasks_.size() >= kMaxQueuedRequests) {
             return false;
         }
+        wasEmpty = tasks_.empty();
         tasks_.push_back(std::move(task));
+        queued_.store(tasks_.size(), std::memory_order_relaxed);
         ++tasksQueued_;
     }
-    wake_.notify_one();
+    // The thread sleeps only on an empty queue and drains it whole once awake: a flood of
+    // requests wakes it once, not once per request.
+    if (wasEmpty) {
+        wake_.notify_one();
+    }
     return true;
 }
 
-void LinuxIssueCaptureService::refuseNow(std::string_view request, std::int64_t reason,
-                                         const ReplyCallback& reply) {
+void LinuxIssueCaptureService::refuseNow(std::int64_t reason, const ReplyCallback& reply) {
+    // No sink line: a flood that fills the queue would only fill the sink's buffer next. The
+    // refusal is counted, and the caller hears of it.
     if (callbacks_.refused) {
         callbacks_.refused(errorName(reason));
     }
-    answer(request, std::nullopt, failure(reason), reply);
+    if (reply) {
+        reply(reason == kIssueCaptureErrorServiceUnavailable ||
+                      reason == kIssueCaptureErrorRequestThrottled
+                  ? refusal(reason)
+                  : failure(reason));
+    }
 }
 
 bool LinuxIssueCaptureService::request(std::string_view kind, const Dictionary& signature,
@@ -225,41 +246,71 @@ bool LinuxIssueCaptureService::request(std::string_view kind, const Dictionary& 
         duration > kMaxDurationSeconds) {
         return false;
     }
+    // A full queue is refused before anything is copied for it.
+    if (queued_.load(std::memory_order_relaxed) >= kMaxQueuedRequests) {
+        refuseNow(kIssueCaptureErrorServiceUnavailable, reply);
+        return true;
+    }
     const double requested = clock_.now();
+    if (throttledAtTheDoor(signatureKey(signature), requested)) {
+        refuseNow(kIssueCaptureErrorRequestThrottled, reply);
+        return true;
+    }
     auto shared = std::make_shared<ReplyCallback>(std::move(reply));
     const bool queued =
         enqueue([this, k = std::string(kind), signature, duration, payload, requested, shared] {
             handleRequest(k, signature, duration, payload, requested, *shared);
         });
     if (!queued) {
-        refuseNow(kind, kIssueCaptureErrorServiceUnavailable, *shared);
+        refuseNow(kIssueCaptureErrorServiceUnavailable, *shared);
     }
     return true;
 }
 
+bool LinuxIssueCaptureService::throttledAtTheDoor(const std::string& key, double now) const {
+    std::lock_guard lock(doorMutex_);
+    const auto it = throttledUntil_.find(key);
+    return it != throttledUntil_.end() && now < it->second;
+}
+
+void LinuxIssueCaptureService::publishThrottle(const std::string& key, double until, double now) {
+    std::lock_guard lock(doorMutex_);
+    if (throttledUntil_.size() >= kMaxTrackedSignatures && !throttledUntil_.contains(key)) {
+        std::erase_if(throttledUntil_, [&](const auto& entry) { return entry.second <= now; });
+        if (throttledUntil_.size() >= kMaxTrackedSignatures) {
+            throttledUntil_.clear();  // the thread's own rule still holds
+        }
+    }
+    throttledUntil_[key] = until;
+}
+
 void LinuxIssueCaptureService::cancel(const std::string& identifier) {
     if (!enqueue([this, identifier] { handleCancel(identifier); })) {
-        Dictionary line{{"op", "cancel"}, {"sessionID", identifier}};
-        sink_->append(std::move(line));
-        refuseNow("cancel", kIssueCaptureErrorServiceUnavailable, nullptr);
+        refuseNow(kIssueCaptureErrorServiceUnavailable, nullptr);
     }
 }
 
 void LinuxIssueCaptureService::run() {
     countEarlierCaptures();
     std::unique_lock lock(mutex_);
+    std::deque<std::function<void()>> batch;
     for (;;) {
         lock.unlock();
         collectDue();
         lock.lock();
         if (!tasks_.empty()) {
-            auto task = std::move(tasks_.front());
-            tasks_.pop_front();
+            // Everything waiting is taken at once: one lock per batch, not one per request.
+            batch.swap(tasks_);
+            queued_.store(0, std::memory_order_relaxed);
             lock.unlock();
-            task();
-            task = nullptr;  // what it holds goes before the flush that waits on it
+            const std::size_t n = batch.size();
+            for (auto& task : batch) {
+                task();
+                task = nullptr;  // what it holds goes before a flush that waits on it
+            }
+            batch.clear();
             lock.lock();
-            ++tasksDone_;
+            tasksDone_ += n;
             done_.notify_all();
             continue;
         }
@@ -325,6 +376,9 @@ void LinuxIssueCaptureService::handleRequest(const std::string& kind, const Dict
         line.set("payload", *payload);
     }
     if (refusal) {
+        if (*refusal == kIssueCaptureErrorRequestThrottled) {
+            publishThrottle(key, lastBySignature_[key] + policy.signatureInterval, now);
+        }
         sink_->append(std::move(line));
         if (callbacks_.refused) {
             callbacks_.refused(errorName(*refusal));
@@ -345,6 +399,7 @@ void LinuxIssueCaptureService::handleRequest(const std::string& kind, const Dict
         }
     }
     lastBySignature_[key] = now;
+    publishThrottle(key, now + policy.signatureInterval, now);
     answer(kind, id,
            Dictionary{{std::string(kIssueCaptureReplySuccess), true},
                       {std::string(kIssueCaptureReplySessionID), id}},
@@ -462,6 +517,7 @@ void LinuxIssueCaptureService::countEarlierCaptures() {
         return;  // no captures yet
     }
     const double now = clock_.now();
+    const double interval = Policy::read(preferences_).signatureInterval;
     std::vector<std::pair<double, std::string>> found;
     std::size_t scanned = 0;
     for (; it != std::filesystem::directory_iterator() && scanned < kMaxEarlierCapturesScanned;
@@ -491,6 +547,7 @@ void LinuxIssueCaptureService::countEarlierCaptures() {
             const std::string key = signatureKey(QVReportingDictionaryFromJson(*sig));
             auto& last = lastBySignature_[key];
             last = std::max(last, t);
+            publishThrottle(key, last + interval, now);
         }
     }
     std::sort(found.begin(), found.end());

@@ -21,8 +21,16 @@
 // A cancel of an identifier that is not a pending timed session (unknown, cancelled before, or
 // already collected) is answered with kIssueCaptureErrorSessionNotFound in the sink.
 //
-// Bounds: at most kMaxQueuedRequests requests wait for the service's thread; one beyond is
-// answered at once, on the caller's thread, with kIssueCaptureErrorServiceUnavailable. At most
+// The door: once the thread has taken a capture of a signature (or refused one inside the
+// interval), further requests of that signature inside the interval are refused with
+// kIssueCaptureErrorRequestThrottled on the caller's thread, without queueing and without a sink
+// line, so that a flood of one issue costs its senders next to nothing. A change of
+// SignatureIntervalSeconds applies to a signature from its next capture.
+//
+// Bounds: at most kMaxQueuedRequests requests wait for the service's thread (besides the batch it
+// is handling); one beyond is
+// answered at once, on the caller's thread, with kIssueCaptureErrorServiceUnavailable, and leaves
+// no sink line (a flood that fills the queue would only fill the sink next). At most
 // kMaxPendingSessions timed sessions wait for their time; one beyond is answered with
 // kIssueCaptureErrorServiceUnavailable. Every refusal is reported through Callbacks::refused.
 //
@@ -126,10 +134,14 @@ class LinuxIssueCaptureService final : public IssueCaptureService {
 
     // Any thread.
     bool enqueue(std::function<void()> task);
-    void refuseNow(std::string_view request, std::int64_t reason, const ReplyCallback& reply);
+    void refuseNow(std::int64_t reason, const ReplyCallback& reply);
     bool request(std::string_view kind, const Dictionary& signature, double duration,
                  const std::optional<Dictionary>& payload, ReplyCallback reply);
     void cancel(const std::string& identifier);
+    // Whether the thread has already refused this signature until after now.
+    bool throttledAtTheDoor(const std::string& key, double now) const;
+    // The service's thread: the signature is refused until then.
+    void publishThrottle(const std::string& key, double until, double now);
 
     // The service's thread only, from here down.
     void run();
@@ -153,6 +165,8 @@ class LinuxIssueCaptureService final : public IssueCaptureService {
     const Options options_;
     const Callbacks callbacks_;
     std::atomic<std::size_t> pendingCount_{0};
+    // tasks_.size() as last set under mutex_, for a refusal that need not take the lock.
+    std::atomic<std::size_t> queued_{0};
 
     std::mutex mutex_;
     std::condition_variable wake_;
@@ -161,6 +175,10 @@ class LinuxIssueCaptureService final : public IssueCaptureService {
     std::uint64_t tasksQueued_ = 0;            // guarded by mutex_
     std::uint64_t tasksDone_ = 0;              // guarded by mutex_
     bool stopping_ = false;                    // guarded by mutex_
+
+    // What the thread decided about signatures, for requests to be refused before they queue.
+    mutable std::mutex doorMutex_;
+    std::unordered_map<std::string, double> throttledUntil_;  // guarded by doorMutex_, capped
 
     // The service's thread only.
     std::map<std::string, PendingSession> pending_;
