@@ -78,8 +78,13 @@ class HapticLeakCapture(DaemonTestCase):
 
         wait_until(lambda: "Started ICX session for haptics leaks. sessionId="
                    + os.path.basename(capture) in self.daemon.log_text(), what="the reply's log line")
-        with open(os.path.join(self.daemon.state_dir, "sinks", "issuecapture.jsonl")) as f:
-            lines = [json.loads(line) for line in f]
+        def sink_lines():
+            path = os.path.join(self.daemon.state_dir, "sinks", "issuecapture.jsonl")
+            if not os.path.exists(path):
+                return []
+            with open(path) as f:
+                return [json.loads(line) for line in f if line.endswith("\n")]
+        lines = wait_until(lambda: len(sink_lines()) >= 2 and sink_lines(), what="the sink lines")
         self.assertEqual([l["op"] for l in lines], ["snapshot", "reply"])
         self.assertEqual(lines[0]["payload"]["DEParameters"][
             "com.korvane.EnergylogCore.DESysLogFilterProcess"]["processIDs"], [os.getpid()])
