@@ -44,6 +44,19 @@ std::string signatureKey(const Dictionary& signature) {
     return key;
 }
 
+// The same parts as a number, for the door, which must not allocate for every request it sees.
+std::uint64_t doorKey(const Dictionary& signature) {
+    std::uint64_t h = 1469598103934665603ull;
+    for (const std::string_view part :
+         {kIssueCaptureSignatureDomain, kIssueCaptureSignatureType, kIssueCaptureSignatureSubtype,
+          kIssueCaptureSignatureSubtypeContext, kIssueCaptureSignatureDetectedProcess}) {
+        const std::string* text = stringPart(signature, part);
+        const std::uint64_t p = std::hash<std::string_view>{}(text ? *text : std::string_view());
+        h = (h ^ p) * 1099511628211ull + 0x9e3779b97f4a7c15ull;
+    }
+    return h;
+}
+
 bool validSignature(const Dictionary& signature) {
     for (const std::string_view part :
          {kIssueCaptureSignatureDomain, kIssueCaptureSignatureType, kIssueCaptureSignatureSubtype,
@@ -127,11 +140,13 @@ class LinuxIssueCaptureService::Reporter final : public IssueCaptureReporter {
                              std::string_view subtype, std::string_view subtypeContext,
                              std::string_view detectedProcess,
                              const std::optional<Dictionary>& thresholdValues) override {
-        Dictionary signature{{std::string(kIssueCaptureSignatureDomain), domain},
-                             {std::string(kIssueCaptureSignatureType), type},
-                             {std::string(kIssueCaptureSignatureSubtype), subtype},
-                             {std::string(kIssueCaptureSignatureSubtypeContext), subtypeContext},
-                             {std::string(kIssueCaptureSignatureDetectedProcess), detectedProcess}};
+        Dictionary signature;
+        signature.reserve(6);
+        signature.set(kIssueCaptureSignatureDomain, domain);
+        signature.set(kIssueCaptureSignatureType, type);
+        signature.set(kIssueCaptureSignatureSubtype, subtype);
+        signature.set(kIssueCaptureSignatureSubtypeContext, subtypeContext);
+        signature.set(kIssueCaptureSignatureDetectedProcess, detectedProcess);
         if (thresholdValues) {
             signature.set(kIssueCaptureSignatureThresholdValues, *thresholdValues);
         }
@@ -252,7 +267,7 @@ bool LinuxIssueCaptureService::request(std::string_view kind, const Dictionary& 
         return true;
     }
     const double requested = clock_.now();
-    if (throttledAtTheDoor(signatureKey(signature), requested)) {
+    if (throttledAtTheDoor(doorKey(signature), requested)) {
         refuseNow(kIssueCaptureErrorRequestThrottled, reply);
         return true;
     }
@@ -267,13 +282,15 @@ bool LinuxIssueCaptureService::request(std::string_view kind, const Dictionary& 
     return true;
 }
 
-bool LinuxIssueCaptureService::throttledAtTheDoor(const std::string& key, double now) const {
+bool LinuxIssueCaptureService::throttledAtTheDoor(std::uint64_t key, double now) const {
     std::lock_guard lock(doorMutex_);
     const auto it = throttledUntil_.find(key);
     return it != throttledUntil_.end() && now < it->second;
 }
 
-void LinuxIssueCaptureService::publishThrottle(const std::string& key, double until, double now) {
+void LinuxIssueCaptureService::publishThrottle(const Dictionary& signature, double until,
+                                               double now) {
+    const std::uint64_t key = doorKey(signature);
     std::lock_guard lock(doorMutex_);
     if (throttledUntil_.size() >= kMaxTrackedSignatures && !throttledUntil_.contains(key)) {
         std::erase_if(throttledUntil_, [&](const auto& entry) { return entry.second <= now; });
@@ -377,7 +394,7 @@ void LinuxIssueCaptureService::handleRequest(const std::string& kind, const Dict
     }
     if (refusal) {
         if (*refusal == kIssueCaptureErrorRequestThrottled) {
-            publishThrottle(key, lastBySignature_[key] + policy.signatureInterval, now);
+            publishThrottle(signature, lastBySignature_[key] + policy.signatureInterval, now);
         }
         sink_->append(std::move(line));
         if (callbacks_.refused) {
@@ -399,7 +416,7 @@ void LinuxIssueCaptureService::handleRequest(const std::string& kind, const Dict
         }
     }
     lastBySignature_[key] = now;
-    publishThrottle(key, now + policy.signatureInterval, now);
+    publishThrottle(signature, now + policy.signatureInterval, now);
     answer(kind, id,
            Dictionary{{std::string(kIssueCaptureReplySuccess), true},
                       {std::string(kIssueCaptureReplySessionID), id}},
@@ -544,10 +561,10 @@ void LinuxIssueCaptureService::countEarlierCaptures() {
         found.emplace_back(t, it->path().filename().string());
         if (const auto sig = manifest.find("signature");
             sig != manifest.end() && sig->is_object()) {
-            const std::string key = signatureKey(QVReportingDictionaryFromJson(*sig));
-            auto& last = lastBySignature_[key];
+            const Dictionary signature = QVReportingDictionaryFromJson(*sig);
+            auto& last = lastBySignature_[signatureKey(signature)];
             last = std::max(last, t);
-            publishThrottle(key, last + interval, now);
+            publishThrottle(signature, last + interval, now);
         }
     }
     std::sort(found.begin(), found.end());

@@ -139,9 +139,9 @@ class LinuxIssueCaptureService final : public IssueCaptureService {
                  const std::optional<Dictionary>& payload, ReplyCallback reply);
     void cancel(const std::string& identifier);
     // Whether the thread has already refused this signature until after now.
-    bool throttledAtTheDoor(const std::string& key, double now) const;
+    bool throttledAtTheDoor(std::uint64_t key, double now) const;
     // The service's thread: the signature is refused until then.
-    void publishThrottle(const std::string& key, double until, double now);
+    void publishThrottle(const Dictionary& signature, double until, double now);
 
     // The service's thread only, from here down.
     void run();
@@ -178,7 +178,8 @@ class LinuxIssueCaptureService final : public IssueCaptureService {
 
     // What the thread decided about signatures, for requests to be refused before they queue.
     mutable std::mutex doorMutex_;
-    std::unordered_map<std::string, double> throttledUntil_;  // guarded by doorMutex_, capped
+    // By a hash of the signature: a collision costs one signature a capture, never a flood.
+    std::unordered_map<std::uint64_t, double> throttledUntil_;  // guarded by doorMutex_, capped
 
     // The service's thread only.
     std::map<std::string, PendingSession> pending_;

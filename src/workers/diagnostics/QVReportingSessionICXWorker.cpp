@@ -26,16 +26,20 @@ constexpr std::string_view kTestModeLine = "Skipping actual fire, as we are runn
 }  // namespace
 
 Dictionary QVReportingICXSnapshotPayload(const std::vector<std::int64_t>& processIdentifiers) {
+    // Built with set() and moves rather than initializer lists, which copy every entry: a flood
+    // builds one payload per fire.
     Array pids;
     pids.reserve(processIdentifiers.size());
     for (const std::int64_t pid : processIdentifiers) {
         pids.emplace_back(pid);
     }
-    Dictionary filter{{"processIDs", Value(std::move(pids))}};
-    Dictionary extensions{
-        {"com.korvane.EnergylogCore.DESysLogFilterProcess", Value(std::move(filter))}};
-    return Dictionary{
-        {std::string(kIssueCaptureKeyPayloadDEParameters), Value(std::move(extensions))}};
+    Dictionary filter;
+    filter.set("processIDs", Value(std::move(pids)));
+    Dictionary extensions;
+    extensions.set("com.korvane.EnergylogCore.DESysLogFilterProcess", Value(std::move(filter)));
+    Dictionary payload;
+    payload.set(kIssueCaptureKeyPayloadDEParameters, Value(std::move(extensions)));
+    return payload;
 }
 
 std::shared_ptr<QVReportingSessionICXWorker> QVReportingSessionICXWorker::initWithSession(

@@ -24,6 +24,26 @@ namespace qv {
 
 class IssueCaptureReporter;
 
+// An optional payload that keeps its storage when cleared: a detector counting a flood copies
+// each counted payload over the last one instead of allocating a fresh copy every time.
+class QVReportingICXLastPayload {
+  public:
+    explicit operator bool() const { return present_; }
+    bool has_value() const { return present_; }
+    const Dictionary& operator*() const { return value_; }
+    const Dictionary* operator->() const { return &value_; }
+    QVReportingICXLastPayload& operator=(const Dictionary& payload) {
+        value_ = payload;
+        present_ = true;
+        return *this;
+    }
+    void reset() { present_ = false; }
+
+  private:
+    Dictionary value_;
+    bool present_ = false;
+};
+
 class WorkerInstanceState {
   public:
     // Identifier of the last issue-capture session or snapshot the service reported started.
@@ -43,7 +63,7 @@ class WorkerInstanceState {
     // Fires over the life of the state; never reset.
     std::uint64_t firedCount = 0;
     // Payload of the last counted message: an exact repeat never counts twice in a row.
-    std::optional<Dictionary> lastMessage;
+    QVReportingICXLastPayload lastMessage;
     // The issue-capture client made for the latest fire.
     std::shared_ptr<IssueCaptureReporter> issueReporter;
 
