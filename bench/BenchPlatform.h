@@ -14,6 +14,7 @@
 #include "platform/linux/LinuxClock.h"
 #include "platform/linux/LinuxConvoService.h"
 #include "platform/linux/LinuxDeviceInformation.h"
+#include "platform/linux/LinuxIssueCaptureService.h"
 #include "platform/linux/LinuxNotificationCenter.h"
 #include "platform/linux/LinuxPreferenceStore.h"
 #include "platform/linux/LinuxProcessInfo.h"
@@ -49,8 +50,26 @@ struct BenchPlatform {
                                              clock, SinkCallbacks{})};
     // No BlueZ here: the benchmarks gather no accessory information.
     LinuxBluetoothFacility bluetooth{"unix:path=" + stateDir + "/no-bluez-bus", stateDir, {}};
-    Platform platform{clock,     device, process,  preferences, notifications, *analytics.service,
-                      condition, convo,  bluetooth};
+    LinuxIssueCaptureService issueCapture{
+        clock, preferences,
+        std::make_unique<JsonlSink>(stateDir, std::string(LinuxIssueCaptureService::kSinkName),
+                                    clock, SinkCallbacks{}),
+        LinuxIssueCaptureService::Options{
+            (std::filesystem::path(stateDir) / "logs" / "Audio" / "Captures").string(),
+            std::nullopt, ::getpid()},
+        LinuxIssueCaptureService::Callbacks{[](std::string_view reason) {
+                                                QVReportingStats::shared().noteIssueCaptureRefused(
+                                                    reason);
+                                            },
+                                            {}}};
+
+    // The platform with the device information given instead (an internal build, say).
+    Platform withDevice(DeviceInformation& other) {
+        return Platform{clock,     other, process,   preferences, notifications, *analytics.service,
+                        condition, convo, bluetooth, issueCapture};
+    }
+
+    Platform platform = withDevice(device);
 };
 
 }  // namespace qv::bench

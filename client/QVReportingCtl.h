@@ -125,4 +125,9 @@ class DefaultsCommands {
 // Prints one sink, or every sink merged by time; with follow, keeps printing new lines.
 int printSinks(const Options& options, const std::string& sink, bool follow);
 
+// --- Captures (QVReportingCtlCaptures.cpp) -----------------------------------------------------
+
+// Lists the issue captures of the state directory with their manifests, oldest first.
+int printCaptures(const Options& options);
+
 }  // namespace qv::ctl

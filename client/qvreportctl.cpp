@@ -142,6 +142,10 @@ int run(int argc, char** argv) {
     c->add_flag("-f,--follow", follow, "Keep printing lines as they are appended");
     c->callback([&] { action = [&] { return printSinks(options, sink, follow); }; });
 
+    c = app.add_subcommand("captures",
+                           "List the issue captures (logs/Audio/Captures) with their manifests");
+    c->callback([&] { action = [&] { return printCaptures(options); }; });
+
     try {
         app.parse(argc, argv);
     } catch (const CLI::ParseError& e) {

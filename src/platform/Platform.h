@@ -10,6 +10,7 @@ class BluetoothFacility;
 class Clock;
 class ConvoService;
 class DeviceInformation;
+class IssueCaptureService;
 class NotificationCenter;
 class PreferenceStore;
 class ProcessInfo;
@@ -25,6 +26,7 @@ struct Platform {
     SystemCondition& condition;
     ConvoService& convo;
     BluetoothFacility& bluetooth;
+    IssueCaptureService& issueCapture;
 };
 
 }  // namespace qv

@@ -98,6 +98,9 @@ std::optional<QVReportingDaemonOptions> QVReportingParseDaemonOptions(int argc, 
                    "Directory of accessory information files, one per paired accessory: "
                    "ADDRESS.json (e.g. AA:BB:CC:DD:EE:FF.json)")
         ->capture_default_str();
+    app.add_option("--journal-dir", o.journalDir,
+                   "Directory of journal files that issue captures read (default: the local "
+                   "journal)");
     try {
         app.parse(argc, argv);
     } catch (const CLI::ParseError& e) {

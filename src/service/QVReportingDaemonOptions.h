@@ -19,6 +19,8 @@ struct QVReportingDaemonOptions {
     QVReportingLimits limits;
     std::string bluezBus = "system";  // "system" or a bus address: where BlueZ is read
     std::string accessoryDir = "/etc/qvreportd/accessories";
+    // Journal files the issue-capture service reads; empty: the local journal.
+    std::string journalDir;
 };
 
 // Parses argv. Returns the options, or nothing after printing help, the version or an error;

@@ -19,6 +19,7 @@
 #include "platform/linux/LinuxClock.h"
 #include "platform/linux/LinuxConvoService.h"
 #include "platform/linux/LinuxDeviceInformation.h"
+#include "platform/linux/LinuxIssueCaptureService.h"
 #include "platform/linux/LinuxNotificationCenter.h"
 #include "platform/linux/LinuxPreferenceStore.h"
 #include "platform/linux/LinuxProcessInfo.h"
@@ -138,9 +139,24 @@ int main(int argc, char** argv) {
                     break;
             }
         });
-    const Platform platform{clock,       device,        process,
-                            preferences, notifications, *analytics.service,
-                            condition,   convo,         bluetooth};
+    LinuxIssueCaptureService issueCapture(
+        clock, preferences,
+        std::make_unique<JsonlSink>(options->stateDir,
+                                    std::string(LinuxIssueCaptureService::kSinkName), clock,
+                                    sinkCallbacks),
+        LinuxIssueCaptureService::Options{
+            (device.diagnosticLogsDirectory() / "Audio" / "Captures").string(),
+            options->journalDir.empty() ? std::nullopt
+                                        : std::optional<std::string>(options->journalDir),
+            process.ownProcessIdentifier()},
+        LinuxIssueCaptureService::Callbacks{[](std::string_view reason) {
+                                                QVReportingStats::shared().noteIssueCaptureRefused(
+                                                    reason);
+                                            },
+                                            reportProblem});
+    const Platform platform{
+        clock,     device, process,   preferences, notifications, *analytics.service,
+        condition, convo,  bluetooth, issueCapture};
 
     QVReportingWorkerRegistry::setAllWorkerClasses(QVReportingAllWorkerClasses());
     SerialQueue& queue = QVReportingUtilityGetReportingServerQueue();

@@ -50,6 +50,19 @@ void QVReportingStats::noteSinkTornLineRemoved() {
     sinkTornLinesRemoved_.fetch_add(1, std::memory_order_relaxed);
 }
 
+void QVReportingStats::noteIssueCaptureRefused(std::string_view reason) {
+    std::lock_guard lock(mutex_);
+    auto it = issueCaptureRefused_.find(reason);
+    if (it == issueCaptureRefused_.end()) {
+        // Reasons are the service's few error codes; a stranger one is pooled.
+        if (issueCaptureRefused_.size() >= kMaxTrackedSinks) {
+            reason = "other";
+        }
+        it = issueCaptureRefused_.emplace(std::string(reason), 0).first;
+    }
+    ++it->second;
+}
+
 void QVReportingStats::noteClientCount(std::size_t clients) {
     clients_.store(clients);
     raiseMax(clientsMax_, clients);
@@ -106,6 +119,12 @@ std::uint64_t QVReportingStats::sinkLinesLost(std::string_view sink) const {
     return it == sinkLinesLost_.end() ? 0 : it->second;
 }
 
+std::uint64_t QVReportingStats::issueCaptureRefused(std::string_view reason) const {
+    std::lock_guard lock(mutex_);
+    auto it = issueCaptureRefused_.find(reason);
+    return it == issueCaptureRefused_.end() ? 0 : it->second;
+}
+
 Dictionary QVReportingStats::dump() const {
     Dictionary out;
     std::uint64_t limitsTotal = 0;
@@ -127,6 +146,15 @@ Dictionary QVReportingStats::dump() const {
     }
     out.set("sink_lines_lost", sinkTotal);
     out.set("sink_torn_lines_removed", sinkTornLinesRemoved_.load());
+    std::uint64_t refusedTotal = 0;
+    {
+        std::lock_guard lock(mutex_);
+        for (const auto& [reason, n] : issueCaptureRefused_) {
+            refusedTotal += n;
+            out.set("issue_capture_refused_" + reason, n);
+        }
+    }
+    out.set("issue_capture_refused", refusedTotal);
     out.set("clients", clients_.load());
     out.set("clients_max", clientsMax_.load());
     out.set("sessions", sessions_.load());
@@ -157,6 +185,7 @@ void QVReportingStats::TEST_reset() {
     sinkTornLinesRemoved_.store(0);
     std::lock_guard lock(mutex_);
     sinkLinesLost_.clear();
+    issueCaptureRefused_.clear();
 }
 
 }  // namespace qv

@@ -67,6 +67,9 @@ class QVReportingStats {
     void noteSinkLineLost(std::string_view sink);
     // A torn last line (a crash in the middle of a write) removed from a sink file at start.
     void noteSinkTornLineRemoved();
+    // A request the issue-capture service refused (its policy, or no room); reason names the
+    // error code.
+    void noteIssueCaptureRefused(std::string_view reason);
     void noteClientCount(std::size_t clients);
     void noteSessionCount(std::size_t sessions);
 
@@ -89,6 +92,7 @@ class QVReportingStats {
     std::uint64_t limitExceededCount(Limit limit) const;
     std::uint64_t logLinesDropped() const { return logLinesDropped_.load(); }
     std::uint64_t sinkLinesLost(std::string_view sink) const;
+    std::uint64_t issueCaptureRefused(std::string_view reason) const;
 
     // Every counter by name, for the operator.
     Dictionary dump() const;
@@ -117,7 +121,8 @@ class QVReportingStats {
     std::atomic<std::uint64_t> previousValuesDropped_{0};
     std::atomic<std::uint64_t> sinkTornLinesRemoved_{0};
     mutable std::mutex mutex_;
-    std::map<std::string, std::uint64_t, std::less<>> sinkLinesLost_;  // guarded by mutex_
+    std::map<std::string, std::uint64_t, std::less<>> sinkLinesLost_;        // guarded by mutex_
+    std::map<std::string, std::uint64_t, std::less<>> issueCaptureRefused_;  // guarded by mutex_
 };
 
 }  // namespace qv

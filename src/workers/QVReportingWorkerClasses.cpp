@@ -8,6 +8,7 @@
 #include "workers/derived/QVReportingSessionSummaryJsonFileWorker.h"
 #include "workers/derived/QVReportingSessionSummaryWorker.h"
 #include "workers/derived/QVReportingSessionVolumeMessagesWorker.h"
+#include "workers/diagnostics/QVReportingSessionICXWorker.h"
 
 namespace qv {
 
@@ -22,6 +23,7 @@ QVReportingWorkerRegistry::ClassList QVReportingAllWorkerClasses() {
         &makeWorkerClass<QVReportingSessionInputMessagesWorker>(),
         &makeWorkerClass<QVReportingSessionMetricsHubWorker>(),
         &makeWorkerClass<QVReportingSessionSystemMonitorWorker>(),
+        &makeWorkerClass<QVReportingSessionICXWorker>(),
         &makeWorkerClass<QVReportingSessionSummaryJsonFileWorker>(),
         &makeWorkerClass<QVReportingSessionAudioRegistrationWorker>(),
     };

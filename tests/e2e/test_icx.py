@@ -1,0 +1,108 @@
+"""Issue capture end to end: an internal build whose device has haptic hardware, a python client
+sending a haptic leak sequence, and the capture the daemon takes of that client."""
+
+import json
+import os
+import shutil
+import subprocess
+import sys
+import tempfile
+import time
+import unittest
+import uuid
+
+sys.path.insert(0, os.path.dirname(__file__))
+from harness import DAEMON, DaemonTestCase, wait_until  # noqa: E402
+
+PLAYBACK, ENERGY_LOG, HAPTICS = 4, 8, 3
+JOURNAL_REMOTE = "/lib/systemd/systemd-journal-remote"
+
+
+def write_journal(directory, pid, message):
+    """A real journal file holding one entry of process pid, written by systemd-journal-remote
+    from an export-format stream. False when the writer is not installed."""
+    if not os.path.exists(JOURNAL_REMOTE):
+        return False
+    now_us = int(time.time() * 1e6)
+    entry = (f"__REALTIME_TIMESTAMP={now_us}\n__MONOTONIC_TIMESTAMP=1\n"
+             f"_BOOT_ID={uuid.uuid4().hex}\n_PID={pid}\n_COMM=python3\n"
+             f"SYSLOG_IDENTIFIER=icx-e2e\nMESSAGE={message}\n\n")
+    subprocess.run([JOURNAL_REMOTE, f"--output={directory}/client.journal", "-"],
+                   input=entry.encode(), check=True, capture_output=True)
+    return True
+
+
+class HapticLeakCapture(DaemonTestCase):
+    def setUp(self):
+        self.extra = tempfile.mkdtemp(prefix="qv-icx-")
+        self.addCleanup(shutil.rmtree, self.extra, True)
+        self.journal = os.path.join(self.extra, "journal")
+        os.makedirs(self.journal)
+        device = os.path.join(self.extra, "device.json")
+        with open(device, "w") as f:
+            json.dump({"InternalBuild": True, "capabilities": {"haptics": True}}, f)
+        self.daemon_args = ("--device-file", device, "--journal-dir", self.journal)
+        super().setUp()
+
+    def captures(self):
+        root = os.path.join(self.daemon.state_dir, "logs", "Audio", "Captures")
+        if not os.path.isdir(root):
+            return []
+        return [os.path.join(root, d) for d in sorted(os.listdir(root))
+                if os.path.exists(os.path.join(root, d, "manifest.json"))]
+
+    def test_a_haptic_leak_sequence_captures_the_clients_journal_lines_and_status(self):
+        marker = f"icx e2e marker {uuid.uuid4().hex}"
+        journal_written = write_journal(self.journal, os.getpid(), marker)
+
+        c = self.client()
+        c.create(501, service_type=HAPTICS)
+        c.start(501)
+        c.send({"Haptic_Active_Hardware_Time_Seconds": 1.5}, PLAYBACK, ENERGY_LOG, [501])
+        self.assertEqual(self.captures(), [])
+        c.send({"Haptic_Active_Hardware_Time_Seconds": 2.5}, PLAYBACK, ENERGY_LOG, [501])
+        captures = wait_until(self.captures, what="the capture's manifest")
+        self.assertEqual(len(captures), 1)
+        capture = captures[0]
+        with open(os.path.join(capture, "manifest.json")) as f:
+            manifest = json.load(f)
+        self.assertEqual(manifest["kind"], "snapshot")
+        self.assertEqual(manifest["signature"]["type"], "haptics")
+        self.assertEqual(manifest["signature"]["subtypeContext"], "EnergyLog")
+        self.assertEqual(manifest["processIDs"], [os.getpid()])
+
+        with open(os.path.join(capture, f"status-{os.getpid()}.txt")) as f:
+            status = f.read()
+        self.assertIn("Name:\tpython3", status)
+        self.assertIn(f"Pid:\t{os.getpid()}", status)
+
+        wait_until(lambda: "Started ICX session for haptics leaks. sessionId="
+                   + os.path.basename(capture) in self.daemon.log_text(), what="the reply's log line")
+        def sink_lines():
+            path = os.path.join(self.daemon.state_dir, "sinks", "issuecapture.jsonl")
+            if not os.path.exists(path):
+                return []
+            with open(path) as f:
+                return [json.loads(line) for line in f if line.endswith("\n")]
+        lines = wait_until(lambda: len(sink_lines()) >= 2 and sink_lines(), what="the sink lines")
+        self.assertEqual([l["op"] for l in lines], ["snapshot", "reply"])
+        self.assertEqual(lines[0]["payload"]["DEParameters"][
+            "com.korvane.EnergylogCore.DESysLogFilterProcess"]["processIDs"], [os.getpid()])
+        self.assertEqual(lines[1]["reply"], {"success": True, "sessionID": os.path.basename(capture)})
+
+        ctl = os.path.join(os.path.dirname(DAEMON), "qvreportctl")
+        listed = subprocess.run([ctl, "--state-dir", self.daemon.state_dir, "--json", "captures"],
+                                check=True, capture_output=True, text=True).stdout.splitlines()
+        self.assertEqual([json.loads(l)["id"] for l in listed], [os.path.basename(capture)])
+
+        if not journal_written:
+            self.skipTest(f"{JOURNAL_REMOTE} is not installed (Debian package "
+                          "systemd-journal-remote): no journal to read; the /proc part passed")
+        with open(os.path.join(capture, "journal.txt")) as f:
+            journal = f.read()
+        self.assertIn(f"icx-e2e[{os.getpid()}]: {marker}", journal)
+        self.assertEqual(manifest["journal"]["lines"], 1)
+
+
+if __name__ == "__main__":
+    unittest.main()
