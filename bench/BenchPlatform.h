@@ -12,6 +12,8 @@
 #include "platform/linux/LinuxClock.h"
 #include "platform/linux/LinuxConvoService.h"
 #include "platform/linux/LinuxDeviceInformation.h"
+#include "platform/linux/LinuxDiagnosticRequestService.h"
+#include "platform/linux/LinuxIssueFilerService.h"
 #include "platform/linux/LinuxNotificationCenter.h"
 #include "platform/linux/LinuxPreferenceStore.h"
 #include "platform/linux/LinuxProcessInfo.h"
@@ -41,8 +43,19 @@ struct BenchPlatform {
     LinuxConvoService convo{preferences, std::make_unique<JsonlSink>(
                                              stateDir, std::string(LinuxConvoService::kSinkName),
                                              clock, SinkCallbacks{})};
-    Platform platform{clock,     device, process, preferences, notifications, *analytics.service,
-                      condition, convo};
+    LinuxIssueFilerService issueFiler{
+        std::make_unique<JsonlSink>(stateDir, std::string(LinuxIssueFilerService::kSinkName), clock,
+                                    SinkCallbacks{}),
+        LinuxIssueFilerService::Options{}};
+    LinuxDiagnosticRequestService diagnostics{
+        clock,
+        std::make_unique<JsonlSink>(stateDir, std::string(LinuxDiagnosticRequestService::kSinkName),
+                                    clock, SinkCallbacks{}),
+        LinuxDiagnosticRequestService::Options{
+            .spinlogsDirectory = std::filesystem::path(stateDir) / "logs/Audio/Spinlogs",
+            .notice = nullptr}};
+    Platform platform{clock,     device, process,    preferences, notifications, *analytics.service,
+                      condition, convo,  issueFiler, diagnostics};
 };
 
 }  // namespace qv::bench

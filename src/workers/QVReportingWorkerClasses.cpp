@@ -7,6 +7,8 @@
 #include "workers/derived/QVReportingSessionSummaryJsonFileWorker.h"
 #include "workers/derived/QVReportingSessionSummaryWorker.h"
 #include "workers/derived/QVReportingSessionVolumeMessagesWorker.h"
+#include "workers/diagnostics/QVReportingSessionIssueFilerWorker.h"
+#include "workers/diagnostics/QVReportingSessionPulsarWorker.h"
 
 namespace qv {
 
@@ -21,7 +23,9 @@ QVReportingWorkerRegistry::ClassList QVReportingAllWorkerClasses() {
         &makeWorkerClass<QVReportingSessionInputMessagesWorker>(),
         &makeWorkerClass<QVReportingSessionMetricsHubWorker>(),
         &makeWorkerClass<QVReportingSessionSystemMonitorWorker>(),
+        &makeWorkerClass<QVReportingSessionPulsarWorker>(),
         &makeWorkerClass<QVReportingSessionSummaryJsonFileWorker>(),
+        &makeWorkerClass<QVReportingSessionIssueFilerWorker>(),
     };
 }
 
