@@ -308,9 +308,27 @@ TEST_F(TheLinuxIssueFilerService, GivesUpOnANotificationServiceThatHangsWithoutP
     EXPECT_GE(timedOut, 1);
     EXPECT_GE(refused, 2) << "at most one prompt in flight and one waiting";
     EXPECT_EQ(timedOut + refused, 4);
-    std::lock_guard lock(mutex);
-    EXPECT_EQ(completions.size(), 4u) << "every completion runs once";
-    EXPECT_EQ(notices.size(), 2u) << "the hang and the overflow, each once";
+    {
+        std::lock_guard lock(mutex);
+        EXPECT_EQ(completions.size(), 4u) << "every completion runs once";
+        EXPECT_EQ(notices.size(), 2u) << "the hang and the overflow, each once";
+    }
+
+    // A bus that takes the connection and then says nothing is given up on in time too.
+    const fs::path silent = state / "silent";
+    const int fd = ::socket(AF_UNIX, SOCK_STREAM, 0);
+    sockaddr_un addr{};
+    addr.sun_family = AF_UNIX;
+    std::snprintf(addr.sun_path, sizeof addr.sun_path, "%s", silent.c_str());
+    ASSERT_EQ(::bind(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr), 0);
+    ASSERT_EQ(::listen(fd, 4), 0);
+    auto mute = make("unix:path=" + silent.string(), 300ms);
+    mute->createDraft(sampleDraft(), "vidcalld", "mute", {});
+    mute->flush();
+    ::close(fd);
+    const auto last = withOp(sinkLines(), "prompt").back();
+    EXPECT_EQ(last["reason"],
+              "the session bus at unix:path=" + silent.string() + " did not let us in in time");
 }
 
 }  // namespace

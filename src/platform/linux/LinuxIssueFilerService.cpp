@@ -69,7 +69,9 @@ std::string escapeMarkup(std::string_view text) {
 }
 
 struct BusDeleter {
-    void operator()(sd_bus* bus) const { sd_bus_flush_close_unref(bus); }
+    // No flush: the reply is in, and flushing a connection that never came up waits for its
+    // authentication without a bound.
+    void operator()(sd_bus* bus) const { sd_bus_close_unref(bus); }
 };
 struct MessageDeleter {
     void operator()(sd_bus_message* m) const { sd_bus_message_unref(m); }
@@ -82,10 +84,42 @@ struct NotifyResult {
     std::string reason;  // why there is no id
 };
 
+// Brings the connection up (authentication and Hello) by the deadline. sd_bus_call would wait
+// for that without a bound of its own, so a bus that accepts the connection and then says nothing
+// would hold the thread far beyond the time-out.
+std::optional<std::string> connectBy(sd_bus* bus, const std::string& address,
+                                     std::chrono::steady_clock::time_point deadline) {
+    for (;;) {
+        int r = sd_bus_is_ready(bus);
+        if (r > 0) {
+            return std::nullopt;
+        }
+        if (r == 0) {
+            r = sd_bus_process(bus, nullptr);
+            if (r > 0) {
+                continue;
+            }
+        }
+        if (r < 0) {
+            return fmt::format("cannot reach the session bus at {}: {}", address, errnoText(-r));
+        }
+        const auto left = std::chrono::duration_cast<std::chrono::microseconds>(
+            deadline - std::chrono::steady_clock::now());
+        if (left.count() <= 0) {
+            return fmt::format("the session bus at {} did not let us in in time", address);
+        }
+        r = sd_bus_wait(bus, static_cast<std::uint64_t>(left.count()));
+        if (r < 0) {
+            return fmt::format("cannot reach the session bus at {}: {}", address, errnoText(-r));
+        }
+    }
+}
+
 // One Notify call on a fresh connection: prompts are rare, and a fresh connection survives the
-// session bus going and coming back.
+// session bus going and coming back. The whole exchange ends within the time-out.
 NotifyResult notify(const std::string& address, const std::string& summary, const std::string& body,
                     std::chrono::milliseconds timeout) {
+    const auto deadline = std::chrono::steady_clock::now() + timeout;
     sd_bus* raw = nullptr;
     int r = sd_bus_new(&raw);
     if (r < 0) {
@@ -99,6 +133,9 @@ NotifyResult notify(const std::string& address, const std::string& summary, cons
         (r = sd_bus_start(bus.get())) < 0) {
         return {std::nullopt,
                 fmt::format("cannot reach the session bus at {}: {}", address, errnoText(-r))};
+    }
+    if (auto error = connectBy(bus.get(), address, deadline)) {
+        return {std::nullopt, *error};
     }
     sd_bus_message* m = nullptr;
     r = sd_bus_message_new_method_call(bus.get(), &m, kNotificationsName, kNotificationsPath,
@@ -118,8 +155,11 @@ NotifyResult notify(const std::string& address, const std::string& summary, cons
     }
     sd_bus_error error = SD_BUS_ERROR_NULL;
     sd_bus_message* reply = nullptr;
-    r = sd_bus_call(bus.get(), call.get(), static_cast<std::uint64_t>(timeout.count()) * 1000,
-                    &error, &reply);
+    const auto left =
+        std::max<std::int64_t>(1, std::chrono::duration_cast<std::chrono::microseconds>(
+                                      deadline - std::chrono::steady_clock::now())
+                                      .count());
+    r = sd_bus_call(bus.get(), call.get(), static_cast<std::uint64_t>(left), &error, &reply);
     MessagePtr answer(reply);
     if (r < 0) {
         std::string reason;
