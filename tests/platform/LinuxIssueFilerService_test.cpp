@@ -50,6 +50,20 @@ IssueDraft sampleDraft() {
     return draft;
 }
 
+// A unix socket that listens at path and never answers.
+int listeningSocket(const fs::path& path) {
+    fs::create_directories(path.parent_path());
+    const int fd = ::socket(AF_UNIX, SOCK_STREAM, 0);
+    sockaddr_un addr{};
+    addr.sun_family = AF_UNIX;
+    std::snprintf(addr.sun_path, sizeof addr.sun_path, "%s", path.c_str());
+    if (::bind(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr) != 0 || ::listen(fd, 4) != 0) {
+        ::close(fd);
+        return -1;
+    }
+    return fd;
+}
+
 // A program started for the test, with its standard output readable line by line; killed when
 // the object goes.
 class Spawned {
@@ -180,25 +194,15 @@ class TheLinuxIssueFilerService : public ::testing::Test {
 };
 
 TEST_F(TheLinuxIssueFilerService, FindsTheUsersSessionBusFromTheEnvironmentOrTheRuntimeSocket) {
-    EXPECT_EQ(LinuxIssueFilerService::sessionBusAddressFor("unix:path=/x", 1000, state.path()),
+    EXPECT_EQ(LinuxIssueFilerService::sessionBusAddressFor("unix:path=/x", 7, state.path()),
               "unix:path=/x");
-    EXPECT_EQ(LinuxIssueFilerService::sessionBusAddressFor("", 1000, state.path()), std::nullopt);
-    EXPECT_EQ(LinuxIssueFilerService::sessionBusAddressFor(nullptr, 1000, state.path()),
-              std::nullopt);
-    fs::create_directories(state / "1000");
-    std::ofstream(state / "1000/bus") << "not a socket";
-    EXPECT_EQ(LinuxIssueFilerService::sessionBusAddressFor(nullptr, 1000, state.path()),
-              std::nullopt);
-
-    const fs::path socketPath = state / "1001/bus";
-    fs::create_directories(socketPath.parent_path());
-    const int fd = ::socket(AF_UNIX, SOCK_STREAM, 0);
-    sockaddr_un addr{};
-    addr.sun_family = AF_UNIX;
-    std::snprintf(addr.sun_path, sizeof addr.sun_path, "%s", socketPath.c_str());
-    ASSERT_EQ(::bind(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr), 0);
-    EXPECT_EQ(LinuxIssueFilerService::sessionBusAddressFor(nullptr, 1001, state.path()),
-              "unix:path=" + socketPath.string());
+    EXPECT_EQ(LinuxIssueFilerService::sessionBusAddressFor("", 7, state.path()), std::nullopt);
+    fs::create_directories(state / "7");
+    std::ofstream(state / "7/bus") << "not a socket";
+    EXPECT_EQ(LinuxIssueFilerService::sessionBusAddressFor(nullptr, 7, state.path()), std::nullopt);
+    const int fd = listeningSocket(state / "8/bus");
+    EXPECT_EQ(LinuxIssueFilerService::sessionBusAddressFor(nullptr, 8, state.path()),
+              "unix:path=" + (state / "8/bus").string());
     ::close(fd);
 }
 
@@ -316,12 +320,8 @@ TEST_F(TheLinuxIssueFilerService, GivesUpOnANotificationServiceThatHangsWithoutP
 
     // A bus that takes the connection and then says nothing is given up on in time too.
     const fs::path silent = state / "silent";
-    const int fd = ::socket(AF_UNIX, SOCK_STREAM, 0);
-    sockaddr_un addr{};
-    addr.sun_family = AF_UNIX;
-    std::snprintf(addr.sun_path, sizeof addr.sun_path, "%s", silent.c_str());
-    ASSERT_EQ(::bind(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr), 0);
-    ASSERT_EQ(::listen(fd, 4), 0);
+    const int fd = listeningSocket(silent);
+    ASSERT_GE(fd, 0);
     auto mute = make("unix:path=" + silent.string(), 300ms);
     mute->createDraft(sampleDraft(), "vidcalld", "mute", {});
     mute->flush();

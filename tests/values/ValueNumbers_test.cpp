@@ -24,33 +24,19 @@ TEST(ValueNumbers, IntegersComeFromNumbersAndLeadingDigitsAndClampInsteadOfWrapp
         std::int64_t expected;
     };
     const std::vector<Case> cases = {
-        {Value(1024), 1024},
         {Value(true), 1},
-        {Value(false), 0},
-        {Value(1024.9), 1024},
         {Value(-1.9), -1},
         {Value(kNaN), 0},
-        {Value(kInf), kMax64},
         {Value(-kInf), kMin64},
-        {Value(1e300), kMax64},
         {Value(std::numeric_limits<std::uint64_t>::max()), kMax64},
-        {Value("1024 frames"), 1024},
-        {Value("  \t-3"), -3},
-        {Value("+7"), 7},
+        {Value("  \t-3 frames"), -3},
         {Value("12.9"), 12},
-        {Value("1e3"), 1},
         {Value("abc"), 0},
-        {Value(""), 0},
         {Value("-"), 0},
         {Value("99999999999999999999"), kMax64},
         {Value("-9223372036854775808"), kMin64},
-        {Value("-99999999999999999999"), kMin64},
-        {Value("9223372036854775807"), kMax64},
         {Value(Array{Value(5)}), 0},
-        {Value(Dictionary{{"a", 5}}), 0},
-        {Value(Bytes{1, 2}), 0},
         {Value(Date{1000.0}), 0},
-        {Value(), 0},
     };
     for (const auto& c : cases) {
         EXPECT_EQ(QVReportingIntegerValue(&c.value), c.expected) << c.value.description();
@@ -71,25 +57,11 @@ TEST(ValueNumbers, DoublesReadTextByItsLeadingDecimalNumberOnly) {
         double expected;
     };
     const std::vector<Case> cases = {
-        {Value(2.5), 2.5},
-        {Value(7), 7.0},
-        {Value(true), 1.0},
-        {Value("2.5e3x"), 2500.0},
-        {Value(" -0.25"), -0.25},
-        {Value(".5"), 0.5},
-        {Value("5."), 5.0},
-        {Value("3e"), 3.0},
-        {Value("3e+"), 3.0},
-        {Value("1e999"), kInf},
-        {Value("-1e999"), -kInf},
-        {Value("1e-999"), 0.0},
-        {Value("e5"), 0.0},
-        {Value("."), 0.0},
-        {Value("nan"), 0.0},
-        {Value("inf"), 0.0},
-        {Value("0x10"), 0.0},
-        {Value(Array{}), 0.0},
-        {Value(), 0.0},
+        {Value(7), 7.0},        {Value("2.5e3x"), 2500.0},
+        {Value(" -.5"), -0.5},  {Value("3e+"), 3.0},
+        {Value("1e999"), kInf}, {Value("1e-999"), 0.0},
+        {Value("e5"), 0.0},     {Value("nan"), 0.0},
+        {Value("0x10"), 0.0},   {Value(Dictionary{}), 0.0},
     };
     for (const auto& c : cases) {
         EXPECT_EQ(QVReportingDoubleValue(&c.value), c.expected) << c.value.description();

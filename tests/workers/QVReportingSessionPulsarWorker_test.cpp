@@ -32,10 +32,8 @@ class APulsarWorker : public ::testing::Test {
         setting(Worker::kEnableKey, true);
         // Counts posts of the notification, and notes whether each request came before it.
         fake.notifications.registerNotification(
-            Worker::kDroppedSpinlogNotification,
-            [](std::function<void()> task) { task(); }, [this](NotificationCenter::Token) {
-                ++posts;
-            });
+            Worker::kDroppedSpinlogNotification, [](std::function<void()> task) { task(); },
+            [this](NotificationCenter::Token) { ++posts; });
         fake.diagnostics.onRequest = [this] { postsAtRequest.push_back(posts); };
     }
     void TearDown() override {
@@ -160,11 +158,9 @@ TEST_F(APulsarWorker, ReadsPayloadValuesOfAnyKindAsIntegers) {
         bool requested;
     };
     const Case cases[] = {
-        {Value("1024"), true},        {Value("1024 frames"), true}, {Value(512.9), true},
-        {Value("abc"), false},        {Value(511.9), false},        {Value(true), false},
+        {Value("1024 frames"), true}, {Value(512.9), true},
+        {Value("abc"), false},        {Value(true), false},
         {Value(std::nan("")), false}, {Value(Array{Value(4096)}), false},
-        {Value(Dictionary{{"v", 4096}}), false}, {Value(), false},
-        {Value(std::numeric_limits<double>::infinity()), true},
     };
     std::size_t expected = 0;
     for (const auto& c : cases) {
