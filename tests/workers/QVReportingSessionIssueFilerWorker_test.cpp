@@ -47,8 +47,7 @@ class AnIssueFilerWorker : public ::testing::Test {
     void send(QVReportingSession& session, bool xyError, double secondsFromNow = 0.0) {
         Dictionary payload{{"qvreporting_timestamp", fake.clock.now() + secondsFromNow}};
         payload.set(xyError ? "vcac_invalid_x" : "vcac_position_x", 1.5);
-        session.sendMessage(
-            std::make_shared<QVReportingSessionMessage>(std::move(payload), 3, 6));
+        session.sendMessage(std::make_shared<QVReportingSessionMessage>(std::move(payload), 3, 6));
     }
     std::optional<Value> lastRun() {
         return fake.preferences.value(Worker::kDefaultsSuite, Worker::kLastRunKey);
@@ -164,7 +163,8 @@ TEST_F(AnIssueFilerWorker, AsksOncePerBackOffAcrossSessionsAndOncePerSessionRun)
     fake.clock.advance(1);
     send(*fourth, true, 7.0);
     EXPECT_EQ(fake.issueFiler.count(), 3u);
-    EXPECT_TRUE(log->contains("Issue filer has already run for VidcallXYerrorMessage reporterID=4"));
+    EXPECT_TRUE(
+        log->contains("Issue filer has already run for VidcallXYerrorMessage reporterID=4"));
     fourth->stop();
     EXPECT_FALSE(workerOf(*fourth)->hasRun());
     EXPECT_TRUE(log->contains("Resetting hasRun to false. reporterID=4"));
