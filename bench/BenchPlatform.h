@@ -14,7 +14,9 @@
 #include "platform/linux/LinuxClock.h"
 #include "platform/linux/LinuxConvoService.h"
 #include "platform/linux/LinuxDeviceInformation.h"
+#include "platform/linux/LinuxDiagnosticRequestService.h"
 #include "platform/linux/LinuxIssueCaptureService.h"
+#include "platform/linux/LinuxIssueFilerService.h"
 #include "platform/linux/LinuxNotificationCenter.h"
 #include "platform/linux/LinuxPreferenceStore.h"
 #include "platform/linux/LinuxProcessInfo.h"
@@ -63,10 +65,23 @@ struct BenchPlatform {
                                             },
                                             {}}};
 
+    LinuxIssueFilerService issueFiler{
+        std::make_unique<JsonlSink>(stateDir, std::string(LinuxIssueFilerService::kSinkName), clock,
+                                    SinkCallbacks{}),
+        LinuxIssueFilerService::Options{}};
+    LinuxDiagnosticRequestService diagnostics{
+        clock,
+        std::make_unique<JsonlSink>(stateDir, std::string(LinuxDiagnosticRequestService::kSinkName),
+                                    clock, SinkCallbacks{}),
+        LinuxDiagnosticRequestService::Options{
+            .spinlogsDirectory = std::filesystem::path(stateDir) / "logs/Audio/Spinlogs",
+            .notice = nullptr}};
+
     // The platform with the device information given instead (an internal build, say).
     Platform withDevice(DeviceInformation& other) {
-        return Platform{clock,     other, process,   preferences, notifications, *analytics.service,
-                        condition, convo, bluetooth, issueCapture};
+        return Platform{
+            clock,     other, process,   preferences,  notifications, *analytics.service,
+            condition, convo, bluetooth, issueCapture, issueFiler,    diagnostics};
     }
 
     Platform platform = withDevice(device);

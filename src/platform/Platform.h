@@ -11,6 +11,8 @@ class Clock;
 class ConvoService;
 class DeviceInformation;
 class IssueCaptureService;
+class DiagnosticRequestService;
+class IssueFilerService;
 class NotificationCenter;
 class PreferenceStore;
 class ProcessInfo;
@@ -27,6 +29,8 @@ struct Platform {
     ConvoService& convo;
     BluetoothFacility& bluetooth;
     IssueCaptureService& issueCapture;
+    IssueFilerService& issueFiler;
+    DiagnosticRequestService& diagnostics;
 };
 
 }  // namespace qv

@@ -4,9 +4,11 @@
 #include <malloc.h>
 #include <signal.h>
 #include <sys/stat.h>
+#include <unistd.h>
 
 #include <cerrno>
 #include <chrono>
+#include <cstdlib>
 #include <cstring>
 #include <filesystem>
 #include <memory>
@@ -19,7 +21,9 @@
 #include "platform/linux/LinuxClock.h"
 #include "platform/linux/LinuxConvoService.h"
 #include "platform/linux/LinuxDeviceInformation.h"
+#include "platform/linux/LinuxDiagnosticRequestService.h"
 #include "platform/linux/LinuxIssueCaptureService.h"
+#include "platform/linux/LinuxIssueFilerService.h"
 #include "platform/linux/LinuxNotificationCenter.h"
 #include "platform/linux/LinuxPreferenceStore.h"
 #include "platform/linux/LinuxProcessInfo.h"
@@ -154,9 +158,29 @@ int main(int argc, char** argv) {
                                                     reason);
                                             },
                                             reportProblem});
+    LinuxIssueFilerService issueFiler(
+        std::make_unique<JsonlSink>(options->stateDir,
+                                    std::string(LinuxIssueFilerService::kSinkName), clock,
+                                    sinkCallbacks),
+        LinuxIssueFilerService::Options{
+            .sessionBusAddress = LinuxIssueFilerService::sessionBusAddressFor(
+                std::getenv("DBUS_SESSION_BUS_ADDRESS"), ::geteuid()),
+            .notice = [](const std::string& message) {
+                QVLOG_DEFAULT(QVReportingSessionCategory(), "{}", message);
+            }});
+    LinuxDiagnosticRequestService diagnostics(
+        clock,
+        std::make_unique<JsonlSink>(options->stateDir,
+                                    std::string(LinuxDiagnosticRequestService::kSinkName), clock,
+                                    sinkCallbacks),
+        LinuxDiagnosticRequestService::Options{
+            .spinlogsDirectory = device.diagnosticLogsDirectory() / "Audio" / "Spinlogs",
+            .notice = [](const std::string& message) {
+                QVLOG_DEFAULT(QVReportingPulsarLogCategory(), "{}", message);
+            }});
     const Platform platform{
-        clock,     device, process,   preferences, notifications, *analytics.service,
-        condition, convo,  bluetooth, issueCapture};
+        clock,     device, process,   preferences,  notifications, *analytics.service,
+        condition, convo,  bluetooth, issueCapture, issueFiler,    diagnostics};
 
     QVReportingWorkerRegistry::setAllWorkerClasses(QVReportingAllWorkerClasses());
     SerialQueue& queue = QVReportingUtilityGetReportingServerQueue();

@@ -9,6 +9,8 @@
 #include "workers/derived/QVReportingSessionSummaryWorker.h"
 #include "workers/derived/QVReportingSessionVolumeMessagesWorker.h"
 #include "workers/diagnostics/QVReportingSessionICXWorker.h"
+#include "workers/diagnostics/QVReportingSessionIssueFilerWorker.h"
+#include "workers/diagnostics/QVReportingSessionPulsarWorker.h"
 
 namespace qv {
 
@@ -24,8 +26,10 @@ QVReportingWorkerRegistry::ClassList QVReportingAllWorkerClasses() {
         &makeWorkerClass<QVReportingSessionMetricsHubWorker>(),
         &makeWorkerClass<QVReportingSessionSystemMonitorWorker>(),
         &makeWorkerClass<QVReportingSessionICXWorker>(),
+        &makeWorkerClass<QVReportingSessionPulsarWorker>(),
         &makeWorkerClass<QVReportingSessionSummaryJsonFileWorker>(),
         &makeWorkerClass<QVReportingSessionAudioRegistrationWorker>(),
+        &makeWorkerClass<QVReportingSessionIssueFilerWorker>(),
     };
 }
 

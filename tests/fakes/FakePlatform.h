@@ -5,7 +5,9 @@
 #include "fakes/FakeClock.h"
 #include "fakes/FakeConvoService.h"
 #include "fakes/FakeDeviceInformation.h"
+#include "fakes/FakeDiagnosticRequestService.h"
 #include "fakes/FakeIssueCaptureService.h"
+#include "fakes/FakeIssueFilerService.h"
 #include "fakes/FakeServices.h"
 #include "platform/Platform.h"
 
@@ -15,24 +17,32 @@ struct FakePlatform {
     // Services a test puts in place of the fakes; those left null stay the fakes.
     struct Replacements {
         DeviceInformation* device = nullptr;
+        ProcessInfo* process = nullptr;
+        PreferenceStore* preferences = nullptr;
+        NotificationCenter* notifications = nullptr;
         AnalyticsService* analytics = nullptr;
+        SystemCondition* condition = nullptr;
         ConvoService* convo = nullptr;
         BluetoothFacility* bluetooth = nullptr;
         IssueCaptureService* issueCapture = nullptr;
+        IssueFilerService* issueFiler = nullptr;
+        DiagnosticRequestService* diagnostics = nullptr;
     };
 
     // The fakes' platform with some services replaced, for a test that brings its own.
     Platform with(const Replacements& r) {
         return Platform{clock,
                         r.device ? *r.device : device,
-                        process,
-                        preferences,
-                        notifications,
+                        r.process ? *r.process : process,
+                        r.preferences ? *r.preferences : preferences,
+                        r.notifications ? *r.notifications : notifications,
                         r.analytics ? *r.analytics : analytics,
-                        condition,
+                        r.condition ? *r.condition : condition,
                         r.convo ? *r.convo : convo,
                         r.bluetooth ? *r.bluetooth : bluetooth,
-                        r.issueCapture ? *r.issueCapture : issueCapture};
+                        r.issueCapture ? *r.issueCapture : issueCapture,
+                        r.issueFiler ? *r.issueFiler : issueFiler,
+                        r.diagnostics ? *r.diagnostics : diagnostics};
     }
 
     FakeClock clock;
@@ -45,6 +55,8 @@ struct FakePlatform {
     FakeConvoService convo;
     FakeBluetoothFacility bluetooth;
     FakeIssueCaptureService issueCapture;
+    FakeIssueFilerService issueFiler;
+    FakeDiagnosticRequestService diagnostics;
     Platform platform = with({});
 };
 

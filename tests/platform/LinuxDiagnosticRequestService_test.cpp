@@ -1,0 +1,368 @@
+#include "platform/linux/LinuxDiagnosticRequestService.h"
+
+#include <fcntl.h>
+#include <gtest/gtest.h>
+#include <signal.h>
+#include <unistd.h>
+#include <nlohmann/json.hpp>
+
+#include <chrono>
+#include <filesystem>
+#include <fstream>
+#include <mutex>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "fakes/TempDirectory.h"
+#include "platform/linux/LinuxClock.h"
+#include "platform/linux/LinuxConfinedProcess.h"
+
+namespace qv {
+namespace {
+
+namespace fs = std::filesystem;
+using namespace std::chrono_literals;
+using Json = nlohmann::json;
+
+constexpr DiagnosticRequestOptions kSpinlog{true, true, false, false, false};
+
+std::vector<Json> readLines(const fs::path& path) {
+    std::vector<Json> lines;
+    std::ifstream in(path);
+    std::string line;
+    while (std::getline(in, line)) {
+        lines.push_back(Json::parse(line));
+    }
+    return lines;
+}
+
+std::string readFile(const fs::path& path) {
+    std::ifstream in(path);
+    return std::string((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
+}
+
+// Whether the process is gone (or only a zombie waiting for its parent).
+bool processGone(pid_t pid) {
+    std::ifstream stat("/proc/" + std::to_string(pid) + "/stat");
+    std::string text;
+    if (!std::getline(stat, text)) {
+        return true;
+    }
+    const auto close = text.rfind(')');
+    return close != std::string::npos && close + 2 < text.size() && text[close + 2] == 'Z';
+}
+
+// Waits for a condition, not for a while.
+bool waitUntil(const std::function<bool()>& condition) {
+    const auto deadline = std::chrono::steady_clock::now() + 10s;
+    while (!condition()) {
+        if (std::chrono::steady_clock::now() > deadline) {
+            return false;
+        }
+        std::this_thread::sleep_for(5ms);
+    }
+    return true;
+}
+
+class TheLinuxDiagnosticRequestService : public ::testing::Test {
+  protected:
+    LinuxDiagnosticRequestService::Options options(const std::string& perf) {
+        LinuxDiagnosticRequestService::Options o;
+        o.spinlogsDirectory = spinlogs;
+        o.perf = perf;
+        o.notice = [this](const std::string& m) {
+            std::lock_guard lock(mutex);
+            notices.push_back(m);
+        };
+        return o;
+    }
+    std::unique_ptr<LinuxDiagnosticRequestService> make(LinuxDiagnosticRequestService::Options o) {
+        return std::make_unique<LinuxDiagnosticRequestService>(
+            clock,
+            std::make_unique<JsonlSink>(state.path().string(),
+                                        std::string(LinuxDiagnosticRequestService::kSinkName),
+                                        clock, SinkCallbacks{}),
+            std::move(o));
+    }
+    // A stand-in for perf: a shell script, given the body of its "record" and "report" cases.
+    std::string fakePerf(const std::string& record, const std::string& report = "echo report") {
+        const fs::path path = tools.path() / ("perf" + std::to_string(++scripts));
+        std::ofstream(path) << "#!/bin/sh\n"
+                               "mode=$1\n"
+                               "for a in \"$@\"; do [ \"$prev\" = -o ] && out=$a; "
+                               "[ \"$prev\" = -i ] && in=$a; prev=$a; done\n"
+                               "case $mode in\n"
+                               "record)\n"
+                            << record
+                            << "\n;;\n"
+                               "report)\n"
+                            << report << "\n;;\nesac\n";
+        fs::permissions(path, fs::perms::owner_all | fs::perms::group_read | fs::perms::group_exec |
+                                  fs::perms::others_read | fs::perms::others_exec);
+        return path.string();
+    }
+    void request(LinuxDiagnosticRequestService& service, int n,
+                 const DiagnosticRequestOptions& o = kSpinlog) {
+        service.request("com.korvane.qvsound", "AudioOverloads", "com.example.daw",
+                        Dictionary{{"smallest_buffer_frame_size", 1024}, {"n", n}}, o);
+    }
+    std::vector<Json> lines(const std::string& op) const {
+        std::vector<Json> out;
+        for (auto& l : readLines(state / "sinks/diagnostics.jsonl")) {
+            if (l["op"] == op) {
+                out.push_back(l);
+            }
+        }
+        return out;
+    }
+    std::vector<std::string> noticesSoFar() {
+        std::lock_guard lock(mutex);
+        return notices;
+    }
+
+    test::TempDirectory state{"qv-diagnostics"};
+    test::TempDirectory tools{"qv-fakeperf"};
+    fs::path spinlogs = state / "logs/Audio/Spinlogs";
+    LinuxClock clock;
+    int scripts = 0;
+    std::mutex mutex;
+    std::vector<std::string> notices;
+};
+
+TEST_F(TheLinuxDiagnosticRequestService, RecordsRequestsAndSaysOnceThatPerfIsMissingOrRefused) {
+    auto service = make(options((tools / "no-such-perf").string()));
+    request(*service, 1);
+    service->flush();
+    request(*service, 2);
+    request(*service, 3, {false, false, false, false, false});
+    service->flush();
+
+    auto requests = lines("request");
+    ASSERT_EQ(requests.size(), 3u);
+    EXPECT_EQ(requests[0], (Json{{"time", requests[0]["time"]},
+                                 {"op", "request"},
+                                 {"request", 1},
+                                 {"domain", "com.korvane.qvsound"},
+                                 {"kind", "AudioOverloads"},
+                                 {"description", "com.example.daw"},
+                                 {"payload", {{"smallest_buffer_frame_size", 1024}, {"n", 1}}},
+                                 {"options",
+                                  {{"sampleStacks", true},
+                                   {"callGraphs", true},
+                                   {"extendedWindow", false},
+                                   {"userSpaceOnly", false},
+                                   {"skipReport", false}}},
+                                 {"sampled", true}}))
+        << "perf is looked for by the sampler, not the caller";
+    auto samples = lines("sample");
+    ASSERT_EQ(samples.size(), 1u);
+    EXPECT_EQ(samples[0]["ok"], false);
+    EXPECT_EQ(samples[0]["error"].get<std::string>().rfind("perf is not installed", 0), 0u);
+    EXPECT_EQ(requests[1]["sampled"], false);
+    EXPECT_EQ(requests[1]["reason"], samples[0]["error"]);
+    EXPECT_EQ(requests[2]["reason"], "no stack sample was asked for");
+    EXPECT_EQ(noticesSoFar().size(), 1u);
+    const auto counters = service->counters();
+    EXPECT_EQ(counters.sampled, 0u);
+    EXPECT_EQ(counters.notSampledUnavailable, 2u);
+    EXPECT_EQ(counters.notSampledNotAsked, 1u);
+    EXPECT_FALSE(fs::exists(spinlogs)) << "nothing is made for a sample that cannot be taken";
+
+    // perf that refuses at run time: the same, with its own words.
+    service = make(options(fakePerf(
+        "echo 'Error: Access to performance monitoring and observability operations is limited.' "
+        ">&2\necho 'Consider tweaking /proc/sys/kernel/perf_event_paranoid' >&2\nexit 255")));
+    request(*service, 4);
+    service->flush();
+    request(*service, 5);
+    service->flush();
+    samples = lines("sample");
+    ASSERT_EQ(samples.size(), 2u);
+    const std::string error = samples[1]["error"];
+    EXPECT_EQ(error.rfind("perf record exited with status 255: ", 0), 0u) << error;
+    EXPECT_NE(error.find("perf_event_paranoid"), std::string::npos) << error;
+    requests = lines("request");
+    EXPECT_EQ(requests.back()["reason"], "perf refused: " + error);
+    EXPECT_EQ(noticesSoFar().size(), 2u);
+}
+
+TEST_F(TheLinuxDiagnosticRequestService, SamplesOneAtATimeAndRecordsTheRestWithoutQueueing) {
+    // record waits until the test lets it go, holding the sampler busy meanwhile.
+    const fs::path release = tools / "release";
+    auto o = options(fakePerf(
+        "while [ ! -e " + release.string() + " ]; do sleep 0.01; done\necho \"$@\" > \"$out\"",
+        "echo \"report of $in\""));
+    auto service = make(std::move(o));
+    for (int i = 1; i <= 200; ++i) {
+        request(*service, i);
+    }
+    std::ofstream(release) << "go";
+    service->flush();
+    request(*service, 201, {true, false, true, true, true});
+    service->flush();
+
+    const auto requests = lines("request");
+    ASSERT_EQ(requests.size(), 201u);
+    EXPECT_EQ(requests[0]["sampled"], true);
+    for (std::size_t i = 1; i < 200; ++i) {
+        EXPECT_EQ(requests[i]["sampled"], false);
+        EXPECT_EQ(requests[i]["reason"], "a sample is already being taken");
+    }
+    EXPECT_EQ(requests[200]["sampled"], true) << "free again once the first is done";
+    const auto samples = lines("sample");
+    ASSERT_EQ(samples.size(), 2u);
+    EXPECT_EQ(samples[0]["request"], 1);
+    EXPECT_EQ(samples[0]["ok"], true);
+    EXPECT_EQ(samples[0]["seconds"], 3.0);
+    const fs::path data = samples[0]["data"].get<std::string>();
+    EXPECT_EQ(data.parent_path(), spinlogs);
+    EXPECT_EQ(readFile(data), "record -a -g --no-buildid-cache --max-size=65536K -o " +
+                                  data.string() + " -- sleep 3.000\n");
+    EXPECT_EQ(readFile(samples[0]["report"].get<std::string>()),
+              "report of " + data.string() + "\n");
+    EXPECT_EQ(samples[0]["reportTruncated"], false);
+    // The other options: no call graphs, the longer window, user space only, no report.
+    const fs::path second = samples[1]["data"].get<std::string>();
+    EXPECT_EQ(readFile(second), "record -a --all-user --no-buildid-cache --max-size=65536K -o " +
+                                    second.string() + " -- sleep 10.000\n");
+    EXPECT_FALSE(samples[1].contains("report"));
+
+    const auto counters = service->counters();
+    EXPECT_EQ(counters.requests, 201u);
+    EXPECT_EQ(counters.sampled, 2u);
+    EXPECT_EQ(counters.notSampledBusy, 199u);
+}
+
+TEST_F(TheLinuxDiagnosticRequestService, ConfinesPerfAndBoundsItsTimeAndOutput) {
+    // A descriptor the daemon left inheritable must not reach perf (numbered high, where the
+    // child's own descriptors do not land).
+    const int opened = ::open((tools / "leak-me").c_str(), O_WRONLY | O_CREAT, 0600);
+    ASSERT_GE(opened, 0);
+    const int leaked = ::fcntl(opened, F_DUPFD, 100);
+    ::close(opened);
+    ASSERT_GE(leaked, 100);
+    const fs::path outside = state / "outside";
+    auto o =
+        options(fakePerf("echo data > \"$out\"\n"
+                         "echo x > " +
+                             outside.string() +
+                             " 2>/dev/null\n"
+                             "echo x > inside",
+                         "ls -l /proc/self/fd\necho HOME=$HOME TMPDIR=$TMPDIR PWD=$(pwd)\n"
+                         "head -c 100000 /dev/zero | tr '\\0' x"));
+    o.maxReportBytes = 4096;
+    o.maxKeptSpinlogs = 2;
+    auto service = make(std::move(o));
+    for (int i = 1; i <= 3; ++i) {
+        request(*service, i);
+        service->flush();
+    }
+    ::close(leaked);
+
+    const auto samples = lines("sample");
+    ASSERT_EQ(samples.size(), 3u);
+    const Json& last = samples[2];
+    EXPECT_EQ(last["ok"], true) << last.dump();
+    const std::string report = readFile(last["report"].get<std::string>());
+    EXPECT_EQ(report.size(), 4096u);
+    EXPECT_EQ(last["reportBytes"], 4096);
+    EXPECT_EQ(last["reportTruncated"], true);
+    EXPECT_EQ(report.find("leak-me"), std::string::npos) << report.substr(0, 800);
+    EXPECT_EQ(report.find("diagnostics.jsonl"), std::string::npos) << "nor the sink's file";
+    EXPECT_NE(report.find("HOME=" + spinlogs.string() + " TMPDIR=" + spinlogs.string() +
+                          " PWD=" + spinlogs.string()),
+              std::string::npos);
+    EXPECT_TRUE(fs::exists(spinlogs / "inside"));
+    if (!QVReportingConfinementUnavailableReason()) {
+        EXPECT_FALSE(fs::exists(outside)) << "writes outside the Spinlogs directory are refused";
+    }
+
+    // Only the newest two groups of files are kept.
+    std::vector<std::string> names;
+    for (const auto& e : fs::directory_iterator(spinlogs)) {
+        if (e.path().filename() != "inside") {
+            names.push_back(e.path().filename().string());
+        }
+    }
+    std::sort(names.begin(), names.end());
+    ASSERT_EQ(names.size(), 6u) << "two groups of three files";
+    for (std::size_t i = 0; i < names.size(); ++i) {
+        EXPECT_NE(names[i].find(i < 3 ? "-000002." : "-000003."), std::string::npos) << names[i];
+    }
+}
+
+TEST_F(TheLinuxDiagnosticRequestService, StopsAPerfThatOverstaysWithEverythingItStarted) {
+    // Written where perf may write: its working directory.
+    const fs::path pidFile = spinlogs / "child.pid";
+    auto o = options(
+        fakePerf("trap '' INT\nsleep 1000 &\necho $! > " + pidFile.string() + "\nwait\nwait"));
+    o.sampleWindow = 50ms;
+    o.recordGrace = 100ms;
+    o.killGrace = 100ms;
+    auto service = make(std::move(o));
+    request(*service, 1);
+    service->flush();
+    const auto samples = lines("sample");
+    ASSERT_EQ(samples.size(), 1u);
+    EXPECT_EQ(samples[0]["ok"], false);
+    EXPECT_EQ(samples[0]["error"], "perf record did not finish within 150 ms and was stopped");
+    const pid_t child = std::stoi(readFile(pidFile));
+    EXPECT_TRUE(waitUntil([&] { return processGone(child); })) << "what perf started goes with it";
+    EXPECT_EQ(service->counters().samplesFailed, 1u);
+
+    // A sampler still running when the service goes is killed, and says so.
+    const fs::path started = spinlogs / "started";
+    auto hanging = make(options(fakePerf("touch started\nexec sleep 1000")));
+    request(*hanging, 2);
+    ASSERT_TRUE(waitUntil([&] { return fs::exists(started); }));
+    hanging.reset();
+    const auto stopped = lines("sample");
+    ASSERT_EQ(stopped.size(), 2u);
+    EXPECT_EQ(stopped[1]["error"], "perf record was stopped: the service is stopping");
+}
+
+TEST_F(TheLinuxDiagnosticRequestService, TakesARealSystemWideSampleWithPerf) {
+    if (const auto why = LinuxDiagnosticRequestService::perfUnavailableReason("perf")) {
+        GTEST_SKIP() << "no stack sample here: " << *why;
+    }
+    auto o = options("perf");
+    o.sampleWindow = 500ms;
+    auto service = make(std::move(o));
+    request(*service, 1);
+    request(*service, 2);
+    service->flush();
+
+    const auto samples = lines("sample");
+    ASSERT_EQ(samples.size(), 1u);
+    if (samples[0]["ok"] != true) {
+        // perf present and permitted on paper may still be refused (a container's seccomp
+        // filter, say): the service then stops asking it, which is what a refusal looks like.
+        request(*service, 3);
+        service->flush();
+        const auto third = lines("request")[2];
+        if (third["sampled"] == false &&
+            third["reason"].get<std::string>().rfind("perf refused", 0) == 0) {
+            GTEST_SKIP() << "perf refused here: " << samples[0]["error"];
+        }
+        FAIL() << samples[0].dump();
+    }
+    EXPECT_GT(samples[0]["dataBytes"].get<std::uint64_t>(), 0u);
+    const std::string report = readFile(samples[0]["report"].get<std::string>());
+    EXPECT_NE(report.find("# Samples"), std::string::npos) << report.substr(0, 400);
+    EXPECT_EQ(lines("request")[1]["reason"], "a sample is already being taken");
+
+    // perf wrote nothing outside the Spinlogs directory of the state directory.
+    std::vector<std::string> written;
+    for (const auto& e : fs::recursive_directory_iterator(state.path())) {
+        if (e.is_regular_file()) {
+            written.push_back(fs::relative(e.path(), state.path()).string());
+        }
+    }
+    for (const auto& f : written) {
+        EXPECT_TRUE(f == "sinks/diagnostics.jsonl" || f.rfind("logs/Audio/Spinlogs/", 0) == 0) << f;
+    }
+}
+
+}  // namespace
+}  // namespace qv

@@ -1,0 +1,335 @@
+#include "platform/linux/LinuxIssueFilerService.h"
+
+#include <fcntl.h>
+#include <gtest/gtest.h>
+#include <signal.h>
+#include <sys/socket.h>
+#include <sys/un.h>
+#include <sys/wait.h>
+#include <unistd.h>
+#include <nlohmann/json.hpp>
+
+#include <atomic>
+#include <cstdio>
+#include <filesystem>
+#include <fstream>
+#include <map>
+#include <mutex>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "fakes/FakeClock.h"
+#include "fakes/TempDirectory.h"
+
+namespace qv {
+namespace {
+
+namespace fs = std::filesystem;
+using namespace std::chrono_literals;
+using Json = nlohmann::json;
+
+std::vector<Json> readLines(const fs::path& path) {
+    std::vector<Json> lines;
+    std::ifstream in(path);
+    std::string line;
+    while (std::getline(in, line)) {
+        lines.push_back(Json::parse(line));
+    }
+    return lines;
+}
+
+IssueDraft sampleDraft() {
+    IssueDraft draft;
+    draft.title = "Invalid x/y coordinates during a Vidcall call (ITF)";
+    draft.problemDescription = "Something went wrong.";
+    draft.component = {"Vidcall Core - Callwire", "All", 1174093};
+    draft.reproducibility = 6;
+    draft.classification = 7;
+    draft.diagnosticExtensionIdentifiers = {"com.korvane.DiagnosticExtensions.audio"};
+    return draft;
+}
+
+// A unix socket that listens at path and never answers.
+int listeningSocket(const fs::path& path) {
+    fs::create_directories(path.parent_path());
+    const int fd = ::socket(AF_UNIX, SOCK_STREAM, 0);
+    sockaddr_un addr{};
+    addr.sun_family = AF_UNIX;
+    std::snprintf(addr.sun_path, sizeof addr.sun_path, "%s", path.c_str());
+    if (::bind(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr) != 0 || ::listen(fd, 4) != 0) {
+        ::close(fd);
+        return -1;
+    }
+    return fd;
+}
+
+// A program started for the test, with its standard output readable line by line; killed when
+// the object goes.
+class Spawned {
+  public:
+    explicit Spawned(std::vector<std::string> argv) {
+        int fds[2];
+        if (::pipe2(fds, O_CLOEXEC) != 0) {
+            return;
+        }
+        pid_ = ::fork();
+        if (pid_ == 0) {
+            ::dup2(fds[1], 1);
+            // dbus-daemon complains that it may not raise its descriptor limit here.
+            const int quiet = ::open("/dev/null", O_WRONLY);
+            ::dup2(quiet, 2);
+            std::vector<char*> args;
+            for (auto& a : argv) {
+                args.push_back(a.data());
+            }
+            args.push_back(nullptr);
+            ::execv(args[0], args.data());
+            ::_exit(127);
+        }
+        ::close(fds[1]);
+        out_ = ::fdopen(fds[0], "r");
+    }
+    ~Spawned() {
+        if (pid_ > 0) {
+            ::kill(pid_, SIGKILL);
+            ::waitpid(pid_, nullptr, 0);
+        }
+        if (out_ != nullptr) {
+            ::fclose(out_);
+        }
+    }
+    Spawned(const Spawned&) = delete;
+    Spawned& operator=(const Spawned&) = delete;
+
+    // The next line of output without its line break; empty at the end.
+    std::string readLine() {
+        char buffer[1024];
+        if (out_ == nullptr || ::fgets(buffer, sizeof buffer, out_) == nullptr) {
+            return "";
+        }
+        std::string line(buffer);
+        line.erase(line.find_last_not_of('\n') + 1);
+        return line;
+    }
+
+  private:
+    pid_t pid_ = -1;
+    FILE* out_ = nullptr;
+};
+
+class TheLinuxIssueFilerService : public ::testing::Test {
+  protected:
+    std::unique_ptr<LinuxIssueFilerService> make(std::optional<std::string> address,
+                                                 std::chrono::milliseconds timeout = 2000ms,
+                                                 std::size_t maxPending = 16) {
+        return std::make_unique<LinuxIssueFilerService>(
+            std::make_unique<JsonlSink>(state.path().string(),
+                                        std::string(LinuxIssueFilerService::kSinkName), clock,
+                                        SinkCallbacks{}),
+            LinuxIssueFilerService::Options{.sessionBusAddress = std::move(address),
+                                            .notifyTimeout = timeout,
+                                            .maxPendingPrompts = maxPending,
+                                            .notice = [this](const std::string& m) {
+                                                std::lock_guard lock(mutex);
+                                                notices.push_back(m);
+                                            }});
+    }
+    LinuxIssueFilerService::Completion recorder() {
+        return [this](const std::optional<std::string>& error) {
+            std::lock_guard lock(mutex);
+            completions.push_back({error, std::this_thread::get_id()});
+        };
+    }
+    std::vector<Json> sinkLines() const { return readLines(state / "sinks/issuefiler.jsonl"); }
+    static std::vector<Json> withOp(const std::vector<Json>& lines, const std::string& op) {
+        std::vector<Json> out;
+        for (const auto& l : lines) {
+            if (l["op"] == op) {
+                out.push_back(l);
+            }
+        }
+        return out;
+    }
+
+    // A private session bus, or nothing where dbus-daemon or python's D-Bus modules are missing.
+    std::optional<std::string> startBus() {
+        if (!fs::exists("/usr/bin/dbus-daemon") ||
+            std::system("/usr/bin/python3 -c 'import dbus, gi' 2>/dev/null") != 0) {
+            return std::nullopt;
+        }
+        bus = std::make_unique<Spawned>(std::vector<std::string>{
+            "/usr/bin/dbus-daemon", "--session", "--nofork", "--print-address=1"});
+        std::string address = bus->readLine();
+        if (address.empty()) {
+            return std::nullopt;
+        }
+        return address;
+    }
+    bool startNotifications(const std::string& address, const std::string& mode) {
+        // __FILE__ may be relative to the build directory, two levels above the test binary.
+        fs::path source(__FILE__);
+        if (source.is_relative()) {
+            source = fs::canonical("/proc/self/exe").parent_path().parent_path() / source;
+        }
+        const fs::path script =
+            source.parent_path().parent_path() / "e2e" / "notification_server.py";
+        server = std::make_unique<Spawned>(
+            std::vector<std::string>{"/usr/bin/python3", script.string(), address,
+                                     (state / "notified.jsonl").string(), mode});
+        return server->readLine() == "ready";
+    }
+
+    test::TempDirectory state{"qv-issuefiler"};
+    test::FakeClock clock;
+    std::mutex mutex;
+    std::vector<std::string> notices;
+    struct Completed {
+        std::optional<std::string> error;
+        std::thread::id thread;
+    };
+    std::vector<Completed> completions;
+    std::unique_ptr<Spawned> bus;
+    std::unique_ptr<Spawned> server;
+};
+
+TEST_F(TheLinuxIssueFilerService, FindsTheUsersSessionBusFromTheEnvironmentOrTheRuntimeSocket) {
+    EXPECT_EQ(LinuxIssueFilerService::sessionBusAddressFor("unix:path=/x", 7, state.path()),
+              "unix:path=/x");
+    EXPECT_EQ(LinuxIssueFilerService::sessionBusAddressFor("", 7, state.path()), std::nullopt);
+    fs::create_directories(state / "7");
+    std::ofstream(state / "7/bus") << "not a socket";
+    EXPECT_EQ(LinuxIssueFilerService::sessionBusAddressFor(nullptr, 7, state.path()), std::nullopt);
+    const int fd = listeningSocket(state / "8/bus");
+    EXPECT_EQ(LinuxIssueFilerService::sessionBusAddressFor(nullptr, 8, state.path()),
+              "unix:path=" + (state / "8/bus").string());
+    ::close(fd);
+}
+
+TEST_F(TheLinuxIssueFilerService, WithoutASessionBusRecordsTheDraftAndSaysWhyNoPromptCame) {
+    auto service = make(std::nullopt);
+    service->createDraft(sampleDraft(), "vidcalld", "a Vidcall spatial positioning error occurred",
+                         recorder());
+    service->createDraft(sampleDraft(), "", "again", recorder());
+    service->flush();
+
+    const auto lines = sinkLines();
+    const auto drafts = withOp(lines, "draft");
+    ASSERT_EQ(drafts.size(), 2u);
+    const Json& d = drafts[0];
+    EXPECT_EQ(d["draft"], 1);
+    EXPECT_EQ(d["processName"], "vidcalld");
+    EXPECT_EQ(d["displayReason"], "a Vidcall spatial positioning error occurred");
+    EXPECT_EQ(d["title"], "Invalid x/y coordinates during a Vidcall call (ITF)");
+    EXPECT_EQ(d["problemDescription"], "Something went wrong.");
+    EXPECT_EQ(
+        d["component"],
+        Json({{"name", "Vidcall Core - Callwire"}, {"version", "All"}, {"identifier", 1174093}}));
+    EXPECT_EQ(d["reproducibility"], 6);
+    EXPECT_EQ(d["classification"], 7);
+    EXPECT_EQ(d["diagnosticExtensionIdentifiers"],
+              Json::array({"com.korvane.DiagnosticExtensions.audio"}));
+    EXPECT_EQ(drafts[1]["draft"], 2);
+
+    const auto prompts = withOp(lines, "prompt");
+    ASSERT_EQ(prompts.size(), 2u);
+    for (std::size_t i = 0; i < 2; ++i) {
+        EXPECT_EQ(prompts[i]["draft"], static_cast<int>(i + 1));
+        EXPECT_EQ(prompts[i]["shown"], false);
+        EXPECT_EQ(prompts[i]["reason"], "no session bus");
+    }
+    std::lock_guard lock(mutex);
+    ASSERT_EQ(completions.size(), 2u);
+    for (const auto& c : completions) {
+        EXPECT_EQ(c.error, std::nullopt) << "a recorded draft is a created draft";
+        EXPECT_NE(c.thread, std::this_thread::get_id());
+    }
+    EXPECT_EQ(notices.size(), 1u) << "the cause is told once";
+}
+
+TEST_F(TheLinuxIssueFilerService, PromptsThroughTheDesktopNotificationServiceWhenOneRuns) {
+    const auto address = startBus();
+    if (!address) {
+        GTEST_SKIP() << "no dbus-daemon, or python3 lacks dbus and gi: no private session bus";
+    }
+    auto service = make(address);
+    // No notification service yet: said so, and nothing is started for it.
+    service->createDraft(sampleDraft(), "vidcalld", "first", recorder());
+    service->flush();
+    ASSERT_TRUE(startNotifications(*address, "answer"));
+    service->createDraft(sampleDraft(), "vid<b>call\xff",
+                         "a Vidcall spatial positioning error occurred", recorder());
+    service->flush();
+
+    const auto prompts = withOp(sinkLines(), "prompt");
+    ASSERT_EQ(prompts.size(), 2u);
+    EXPECT_EQ(prompts[0]["shown"], false);
+    EXPECT_EQ(prompts[0]["reason"], "no notification service on the session bus");
+    EXPECT_EQ(prompts[1]["shown"], true);
+    EXPECT_EQ(prompts[1]["notification"], 1);
+
+    const auto notified = readLines(state / "notified.jsonl");
+    ASSERT_EQ(notified.size(), 1u);
+    EXPECT_EQ(notified[0]["app_name"], "qvreportd");
+    EXPECT_EQ(notified[0]["summary"], "Invalid x/y coordinates during a Vidcall call (ITF)");
+    EXPECT_EQ(notified[0]["body"],
+              "vid&lt;b&gt;call\xEF\xBF\xBD: a Vidcall spatial positioning error occurred. A bug "
+              "report draft is waiting to be filed.");
+    EXPECT_EQ(notified[0]["hints"]["urgency"], 1);
+    EXPECT_EQ(notified[0]["expire_timeout"], -1);
+    std::lock_guard lock(mutex);
+    ASSERT_EQ(completions.size(), 2u);
+    EXPECT_EQ(completions[1].error, std::nullopt);
+}
+
+TEST_F(TheLinuxIssueFilerService, GivesUpOnANotificationServiceThatHangsWithoutPilingUpPrompts) {
+    const auto address = startBus();
+    if (!address) {
+        GTEST_SKIP() << "no dbus-daemon, or python3 lacks dbus and gi: no private session bus";
+    }
+    ASSERT_TRUE(startNotifications(*address, "hang"));
+    auto service = make(address, 300ms, 1);
+    for (int i = 0; i < 4; ++i) {
+        service->createDraft(sampleDraft(), "vidcalld", "hung", recorder());
+    }
+    service->flush();
+
+    const auto lines = sinkLines();
+    EXPECT_EQ(withOp(lines, "draft").size(), 4u);
+    const auto prompts = withOp(lines, "prompt");
+    ASSERT_EQ(prompts.size(), 4u) << "one prompt line per draft";
+    std::map<int, int> perDraft;
+    int timedOut = 0;
+    int refused = 0;
+    for (const auto& p : prompts) {
+        ++perDraft[p["draft"].get<int>()];
+        EXPECT_EQ(p["shown"], false);
+        const std::string reason = p["reason"];
+        timedOut += reason == "the notification service did not answer within 300 ms";
+        refused += reason == "1 prompts are already waiting";
+    }
+    EXPECT_EQ(perDraft.size(), 4u);
+    EXPECT_GE(timedOut, 1);
+    EXPECT_GE(refused, 2) << "at most one prompt in flight and one waiting";
+    EXPECT_EQ(timedOut + refused, 4);
+    {
+        std::lock_guard lock(mutex);
+        EXPECT_EQ(completions.size(), 4u) << "every completion runs once";
+        EXPECT_EQ(notices.size(), 2u) << "the hang and the overflow, each once";
+    }
+
+    // A bus that takes the connection and then says nothing is given up on in time too.
+    const fs::path silent = state / "silent";
+    const int fd = listeningSocket(silent);
+    ASSERT_GE(fd, 0);
+    auto mute = make("unix:path=" + silent.string(), 300ms);
+    mute->createDraft(sampleDraft(), "vidcalld", "mute", {});
+    mute->flush();
+    ::close(fd);
+    const auto last = withOp(sinkLines(), "prompt").back();
+    EXPECT_EQ(last["reason"],
+              "the session bus at unix:path=" + silent.string() + " did not let us in in time");
+}
+
+}  // namespace
+}  // namespace qv
