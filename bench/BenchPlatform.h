@@ -12,10 +12,13 @@
 #include "platform/linux/LinuxClock.h"
 #include "platform/linux/LinuxConvoService.h"
 #include "platform/linux/LinuxDeviceInformation.h"
+#include "platform/linux/LinuxGaugeDataWriter.h"
 #include "platform/linux/LinuxNotificationCenter.h"
 #include "platform/linux/LinuxPreferenceStore.h"
 #include "platform/linux/LinuxProcessInfo.h"
+#include "platform/linux/LinuxSpanTraceRecorder.h"
 #include "platform/linux/LinuxSystemCondition.h"
+#include "platform/linux/LinuxThreadlineModelReader.h"
 #include "session/QVReportingLog.h"
 
 namespace qv::bench {
@@ -29,6 +32,12 @@ struct BenchPlatform {
     }
     ~BenchPlatform() { std::filesystem::remove_all(stateDir); }
 
+    static LinuxSpanTraceRecorder::Options traceOptions(const std::string& stateDir) {
+        LinuxSpanTraceRecorder::Options options;
+        options.traceDirectory = std::filesystem::path(stateDir) / "logs/Audio/Traces/raw";
+        return options;
+    }
+
     std::string stateDir;
     LinuxClock clock;
     LinuxDeviceInformation device{"/nonexistent", std::filesystem::path(stateDir) / "logs"};
@@ -41,8 +50,11 @@ struct BenchPlatform {
     LinuxConvoService convo{preferences, std::make_unique<JsonlSink>(
                                              stateDir, std::string(LinuxConvoService::kSinkName),
                                              clock, SinkCallbacks{})};
-    Platform platform{clock,     device, process, preferences, notifications, *analytics.service,
-                      condition, convo};
+    LinuxSpanTraceRecorder spanTrace{traceOptions(stateDir), {}};
+    LinuxThreadlineModelReader threadline;
+    LinuxGaugeDataWriter gaugeData;
+    Platform platform{clock,     device, process,   preferences, notifications, *analytics.service,
+                      condition, convo,  spanTrace, threadline,  gaugeData};
 };
 
 }  // namespace qv::bench

@@ -9,10 +9,13 @@ class AnalyticsService;
 class Clock;
 class ConvoService;
 class DeviceInformation;
+class GaugeDataWriter;
 class NotificationCenter;
 class PreferenceStore;
 class ProcessInfo;
+class SpanTraceRecorder;
 class SystemCondition;
+class ThreadlineModelReader;
 
 struct Platform {
     Clock& clock;
@@ -23,6 +26,9 @@ struct Platform {
     AnalyticsService& analytics;
     SystemCondition& condition;
     ConvoService& convo;
+    SpanTraceRecorder& spanTrace;
+    ThreadlineModelReader& threadline;
+    GaugeDataWriter& gaugeData;
 };
 
 }  // namespace qv

@@ -82,6 +82,9 @@ std::optional<QVReportingDaemonOptions> QVReportingParseDaemonOptions(int argc, 
     app.add_option("--max-clients", l.maxClients, "Most clients served at once")
         ->capture_default_str()
         ->check(CLI::PositiveNumber);
+    app.add_option("--tracefs", o.tracefsRoot,
+                   "tracefs mount for performance traces; default: /sys/kernel/tracing, else "
+                   "/sys/kernel/debug/tracing");
     try {
         app.parse(argc, argv);
     } catch (const CLI::ParseError& e) {

@@ -17,6 +17,9 @@ struct QVReportingDaemonOptions {
     std::string analyticsEventsFile;
     LogLevel logLevel = LogLevel::Info;
     QVReportingLimits limits;
+    // The tracefs root the trace recorder uses; empty: the first mounted of /sys/kernel/tracing
+    // and /sys/kernel/debug/tracing.
+    std::string tracefsRoot;
 };
 
 // Parses argv. Returns the options, or nothing after printing help, the version or an error;

@@ -18,10 +18,13 @@
 #include "platform/linux/LinuxClock.h"
 #include "platform/linux/LinuxConvoService.h"
 #include "platform/linux/LinuxDeviceInformation.h"
+#include "platform/linux/LinuxGaugeDataWriter.h"
 #include "platform/linux/LinuxNotificationCenter.h"
 #include "platform/linux/LinuxPreferenceStore.h"
 #include "platform/linux/LinuxProcessInfo.h"
+#include "platform/linux/LinuxSpanTraceRecorder.h"
 #include "platform/linux/LinuxSystemCondition.h"
+#include "platform/linux/LinuxThreadlineModelReader.h"
 #include "service/QVReportingDBusServer.h"
 #include "service/QVReportingDaemonOptions.h"
 #include "service/QVReportingService.h"
@@ -116,8 +119,17 @@ int main(int argc, char** argv) {
         preferences,
         std::make_unique<JsonlSink>(options->stateDir, std::string(LinuxConvoService::kSinkName),
                                     clock, sinkCallbacks));
+    LinuxSpanTraceRecorder::Options traceOptions;
+    traceOptions.traceDirectory = device.diagnosticLogsDirectory() / "Audio" / "Traces" / "raw";
+    traceOptions.tracefsRoot = options->tracefsRoot;
+    LinuxSpanTraceRecorder spanTrace(std::move(traceOptions), [](const std::string& message) {
+        QVLOG_ERROR(QVReportingTraceCategory(), "{}", message);
+    });
+    LinuxThreadlineModelReader threadline;
+    LinuxGaugeDataWriter gaugeData;
     const Platform platform{
-        clock, device, process, preferences, notifications, *analytics.service, condition, convo};
+        clock,     device, process,   preferences, notifications, *analytics.service,
+        condition, convo,  spanTrace, threadline,  gaugeData};
 
     QVReportingWorkerRegistry::setAllWorkerClasses(QVReportingAllWorkerClasses());
     SerialQueue& queue = QVReportingUtilityGetReportingServerQueue();

@@ -7,6 +7,7 @@
 #include "workers/derived/QVReportingSessionSummaryJsonFileWorker.h"
 #include "workers/derived/QVReportingSessionSummaryWorker.h"
 #include "workers/derived/QVReportingSessionVolumeMessagesWorker.h"
+#include "workers/diagnostics/QVReportingSessionTraceWorker.h"
 
 namespace qv {
 
@@ -15,6 +16,7 @@ QVReportingWorkerRegistry::ClassList QVReportingAllWorkerClasses() {
     // driver snapshot, system monitor, ICX, Pulsar, summary JSON file, audio registration, Convo,
     // IssueFiler. Only the classes that exist are listed.
     return {
+        &makeWorkerClass<QVReportingSessionTraceWorker>(),
         &makeWorkerClass<QVReportingSessionVolumeMessagesWorker>(),
         &makeWorkerClass<QVReportingSessionOrbitMessagesWorker>(),
         &makeWorkerClass<QVReportingSessionSummaryWorker>(),

@@ -4,7 +4,10 @@
 #include "fakes/FakeClock.h"
 #include "fakes/FakeConvoService.h"
 #include "fakes/FakeDeviceInformation.h"
+#include "fakes/FakeGaugeDataWriter.h"
 #include "fakes/FakeServices.h"
+#include "fakes/FakeSpanTraceRecorder.h"
+#include "fakes/FakeThreadlineModelReader.h"
 #include "platform/Platform.h"
 
 namespace qv::test {
@@ -14,14 +17,24 @@ struct FakePlatform {
     struct Replacements {
         AnalyticsService* analytics = nullptr;
         ConvoService* convo = nullptr;
+        SpanTraceRecorder* spanTrace = nullptr;
+        ThreadlineModelReader* threadline = nullptr;
+        GaugeDataWriter* gaugeData = nullptr;
     };
 
     // The fakes' platform with some services replaced, for a test that brings its own.
     Platform with(const Replacements& r) {
-        return Platform{clock,         device,
-                        process,       preferences,
-                        notifications, r.analytics ? *r.analytics : analytics,
-                        condition,     r.convo ? *r.convo : convo};
+        return Platform{clock,
+                        device,
+                        process,
+                        preferences,
+                        notifications,
+                        r.analytics ? *r.analytics : analytics,
+                        condition,
+                        r.convo ? *r.convo : convo,
+                        r.spanTrace ? *r.spanTrace : spanTrace,
+                        r.threadline ? *r.threadline : threadline,
+                        r.gaugeData ? *r.gaugeData : gaugeData};
     }
 
     FakeClock clock;
@@ -32,6 +45,9 @@ struct FakePlatform {
     FakeAnalyticsService analytics;
     FakeSystemCondition condition;
     FakeConvoService convo;
+    FakeSpanTraceRecorder spanTrace;
+    FakeThreadlineModelReader threadline;
+    FakeGaugeDataWriter gaugeData;
     Platform platform = with({});
 };
 
