@@ -132,21 +132,21 @@ class LinuxThreadlineModel final : public ThreadlineModel {
 
   private:
     // A probe as its dictionary describes it, with the counts that pairing finds.
-    struct Spec {
+    struct ProbePlan {
         std::string name;
         std::string begin;
         std::string end;
-        std::vector<Spec> children;
+        std::vector<ProbePlan> children;
         std::vector<ThreadlineEvent> events;
         std::uint64_t unpairedBegins = 0;
         std::uint64_t unmatchedEnds = 0;
     };
 
-    static bool buildSpec(const Dictionary& dictionary, const std::string& where, int depth,
-                          Spec& spec, std::vector<std::string>* problems);
-    static void collectLeaves(Spec& spec, std::vector<Spec*>& leaves);
-    static ThreadlineProbe toProbe(Spec&& spec);
-    void pair(const std::vector<Spec*>& leaves) const;
+    static bool buildPlan(const Dictionary& dictionary, const std::string& where, int depth,
+                          ProbePlan& plan, std::vector<std::string>* problems);
+    static void collectLeaves(ProbePlan& plan, std::vector<ProbePlan*>& leaves);
+    static ThreadlineProbe toProbe(ProbePlan&& plan);
+    void pair(const std::vector<ProbePlan*>& leaves) const;
 
     std::unordered_map<std::string, std::uint32_t, StringHash, std::equal_to<>> texts_;
     std::vector<Marker> markers_;
@@ -205,8 +205,9 @@ void LinuxThreadlineModel::addLine(std::string_view line) {
     markers_.push_back(marker);
 }
 
-bool LinuxThreadlineModel::buildSpec(const Dictionary& dictionary, const std::string& where,
-                                     int depth, Spec& spec, std::vector<std::string>* problems) {
+bool LinuxThreadlineModel::buildPlan(const Dictionary& dictionary, const std::string& where,
+                                     int depth, ProbePlan& plan,
+                                     std::vector<std::string>* problems) {
     const auto refuse = [&](std::string_view why) {
         if (problems) {
             problems->push_back(fmt::format("{}: {}", where, why));
@@ -222,29 +223,29 @@ bool LinuxThreadlineModel::buildSpec(const Dictionary& dictionary, const std::st
     if (!name || !name->isString() || name->asString()->empty()) {
         return refuse("no \"Name\" string");
     }
-    spec.name = *name->asString();
+    plan.name = *name->asString();
     const Value* children = dictionary.find(threadline::kProbeChildren);
     if (children && !children->isArray()) {
-        return refuse(fmt::format("\"{}\": \"Children\" is not an array", spec.name));
+        return refuse(fmt::format("\"{}\": \"Children\" is not an array", plan.name));
     }
     if (children && !children->asArray()->empty()) {
         std::size_t index = 0;
         for (const Value& child : *children->asArray()) {
             const std::string childWhere =
-                fmt::format("{} \"{}\" child {}", where, spec.name, index++);
+                fmt::format("{} \"{}\" child {}", where, plan.name, index++);
             if (!child.isDictionary()) {
                 if (problems) {
                     problems->push_back(childWhere + ": not a dictionary");
                 }
                 continue;
             }
-            Spec built;
-            if (buildSpec(*child.asDictionary(), childWhere, depth + 1, built, problems)) {
-                spec.children.push_back(std::move(built));
+            ProbePlan built;
+            if (buildPlan(*child.asDictionary(), childWhere, depth + 1, built, problems)) {
+                plan.children.push_back(std::move(built));
             }
         }
-        if (spec.children.empty()) {
-            return refuse(fmt::format("\"{}\": no valid child", spec.name));
+        if (plan.children.empty()) {
+            return refuse(fmt::format("\"{}\": no valid child", plan.name));
         }
         return true;
     }
@@ -252,33 +253,33 @@ bool LinuxThreadlineModel::buildSpec(const Dictionary& dictionary, const std::st
     const Value* begin = dictionary.find(threadline::kProbeBeginMarker);
     const Value* end = dictionary.find(threadline::kProbeEndMarker);
     if (begin && begin->isString()) {
-        spec.begin = trim(*begin->asString());
+        plan.begin = trim(*begin->asString());
     }
     if (end && end->isString()) {
-        spec.end = trim(*end->asString());
+        plan.end = trim(*end->asString());
     }
-    if (spec.begin.empty() || spec.end.empty()) {
+    if (plan.begin.empty() || plan.end.empty()) {
         return refuse(
-            fmt::format("\"{}\": needs \"BeginMarker\" and \"EndMarker\" strings", spec.name));
+            fmt::format("\"{}\": needs \"BeginMarker\" and \"EndMarker\" strings", plan.name));
     }
-    if (spec.begin == spec.end) {
+    if (plan.begin == plan.end) {
         return refuse(
-            fmt::format("\"{}\": \"BeginMarker\" and \"EndMarker\" are the same text", spec.name));
+            fmt::format("\"{}\": \"BeginMarker\" and \"EndMarker\" are the same text", plan.name));
     }
     return true;
 }
 
-void LinuxThreadlineModel::collectLeaves(Spec& spec, std::vector<Spec*>& leaves) {
-    if (spec.children.empty()) {
-        leaves.push_back(&spec);
+void LinuxThreadlineModel::collectLeaves(ProbePlan& plan, std::vector<ProbePlan*>& leaves) {
+    if (plan.children.empty()) {
+        leaves.push_back(&plan);
         return;
     }
-    for (auto& child : spec.children) {
+    for (auto& child : plan.children) {
         collectLeaves(child, leaves);
     }
 }
 
-void LinuxThreadlineModel::pair(const std::vector<Spec*>& leaves) const {
+void LinuxThreadlineModel::pair(const std::vector<ProbePlan*>& leaves) const {
     // Which leaves listen to which marker text: one pass over the markers serves every probe.
     struct Listener {
         std::uint32_t leaf;
@@ -333,7 +334,7 @@ void LinuxThreadlineModel::pair(const std::vector<Spec*>& leaves) const {
         std::stable_sort(found.begin(), found.end(), [](const Interval& a, const Interval& b) {
             return a.begin != b.begin ? a.begin < b.begin : a.pid < b.pid;
         });
-        Spec& leaf = *leaves[l];
+        ProbePlan& leaf = *leaves[l];
         leaf.events.reserve(found.size());
         for (const Interval& interval : found) {
             leaf.events.push_back({leaf.name, interval.duration});
@@ -341,20 +342,20 @@ void LinuxThreadlineModel::pair(const std::vector<Spec*>& leaves) const {
     }
 }
 
-ThreadlineProbe LinuxThreadlineModel::toProbe(Spec&& spec) {
+ThreadlineProbe LinuxThreadlineModel::toProbe(ProbePlan&& plan) {
     ThreadlineProbe probe;
-    probe.name = std::move(spec.name);
-    if (spec.children.empty()) {
+    probe.name = std::move(plan.name);
+    if (plan.children.empty()) {
         probe.description = fmt::format(
             "<ThreadlineProbe name=\"{}\" begin=\"{}\" end=\"{}\" events={} unpairedBegins={} "
             "unmatchedEnds={}>",
-            probe.name, spec.begin, spec.end, spec.events.size(), spec.unpairedBegins,
-            spec.unmatchedEnds);
-        probe.events = std::move(spec.events);
+            probe.name, plan.begin, plan.end, plan.events.size(), plan.unpairedBegins,
+            plan.unmatchedEnds);
+        probe.events = std::move(plan.events);
         return probe;
     }
     std::string names;
-    for (auto& child : spec.children) {
+    for (auto& child : plan.children) {
         names += names.empty() ? "" : ",";
         names += child.name;
         probe.children.push_back(toProbe(std::move(child)));
@@ -366,22 +367,22 @@ ThreadlineProbe LinuxThreadlineModel::toProbe(Spec&& spec) {
 
 std::vector<ThreadlineProbe> LinuxThreadlineModel::probesFromDictionaries(
     const std::vector<Dictionary>& dictionaries, std::vector<std::string>* problems) const {
-    std::vector<Spec> specs;
+    std::vector<ProbePlan> plans;
     for (std::size_t i = 0; i < dictionaries.size(); ++i) {
-        Spec spec;
-        if (buildSpec(dictionaries[i], fmt::format("probe {}", i), 0, spec, problems)) {
-            specs.push_back(std::move(spec));
+        ProbePlan plan;
+        if (buildPlan(dictionaries[i], fmt::format("probe {}", i), 0, plan, problems)) {
+            plans.push_back(std::move(plan));
         }
     }
-    std::vector<Spec*> leaves;
-    for (auto& spec : specs) {
-        collectLeaves(spec, leaves);
+    std::vector<ProbePlan*> leaves;
+    for (auto& plan : plans) {
+        collectLeaves(plan, leaves);
     }
     pair(leaves);
     std::vector<ThreadlineProbe> probes;
-    probes.reserve(specs.size());
-    for (auto& spec : specs) {
-        probes.push_back(toProbe(std::move(spec)));
+    probes.reserve(plans.size());
+    for (auto& plan : plans) {
+        probes.push_back(toProbe(std::move(plan)));
     }
     return probes;
 }
