@@ -15,12 +15,15 @@
 #include "platform/linux/LinuxConvoService.h"
 #include "platform/linux/LinuxDeviceInformation.h"
 #include "platform/linux/LinuxDiagnosticRequestService.h"
+#include "platform/linux/LinuxGaugeDataWriter.h"
 #include "platform/linux/LinuxIssueCaptureService.h"
 #include "platform/linux/LinuxIssueFilerService.h"
 #include "platform/linux/LinuxNotificationCenter.h"
 #include "platform/linux/LinuxPreferenceStore.h"
 #include "platform/linux/LinuxProcessInfo.h"
+#include "platform/linux/LinuxSpanTraceRecorder.h"
 #include "platform/linux/LinuxSystemCondition.h"
+#include "platform/linux/LinuxThreadlineModelReader.h"
 #include "session/QVReportingLog.h"
 #include "session/QVReportingStats.h"
 
@@ -37,6 +40,12 @@ struct BenchPlatform {
                                                    std::numeric_limits<std::size_t>::max());
     }
     ~BenchPlatform() { std::filesystem::remove_all(stateDir); }
+
+    static LinuxSpanTraceRecorder::Options traceOptions(const std::string& stateDir) {
+        LinuxSpanTraceRecorder::Options options;
+        options.traceDirectory = std::filesystem::path(stateDir) / "logs/Audio/Traces/raw";
+        return options;
+    }
 
     std::string stateDir;
     LinuxClock clock;
@@ -77,14 +86,48 @@ struct BenchPlatform {
             .spinlogsDirectory = std::filesystem::path(stateDir) / "logs/Audio/Spinlogs",
             .notice = nullptr}};
 
-    // The platform with the device information given instead (an internal build, say).
-    Platform withDevice(DeviceInformation& other) {
-        return Platform{
-            clock,     other, process,   preferences,  notifications, *analytics.service,
-            condition, convo, bluetooth, issueCapture, issueFiler,    diagnostics};
+    LinuxSpanTraceRecorder spanTrace{traceOptions(stateDir), {}};
+    LinuxThreadlineModelReader threadline;
+    LinuxGaugeDataWriter gaugeData;
+
+    // Services a benchmark puts in place of the Linux ones; those left null stay.
+    struct Replacements {
+        DeviceInformation* device = nullptr;
+        ProcessInfo* process = nullptr;
+        PreferenceStore* preferences = nullptr;
+        NotificationCenter* notifications = nullptr;
+        AnalyticsService* analytics = nullptr;
+        SystemCondition* condition = nullptr;
+        ConvoService* convo = nullptr;
+        BluetoothFacility* bluetooth = nullptr;
+        IssueCaptureService* issueCapture = nullptr;
+        IssueFilerService* issueFiler = nullptr;
+        DiagnosticRequestService* diagnostics = nullptr;
+        SpanTraceRecorder* spanTrace = nullptr;
+        ThreadlineModelReader* threadline = nullptr;
+        GaugeDataWriter* gaugeData = nullptr;
+    };
+
+    // The platform with some services replaced, for a benchmark that brings its own.
+    Platform with(const Replacements& r) {
+        return Platform{clock,
+                        r.device ? *r.device : device,
+                        r.process ? *r.process : process,
+                        r.preferences ? *r.preferences : preferences,
+                        r.notifications ? *r.notifications : notifications,
+                        r.analytics ? *r.analytics : *analytics.service,
+                        r.condition ? *r.condition : condition,
+                        r.convo ? *r.convo : convo,
+                        r.bluetooth ? *r.bluetooth : bluetooth,
+                        r.issueCapture ? *r.issueCapture : issueCapture,
+                        r.issueFiler ? *r.issueFiler : issueFiler,
+                        r.diagnostics ? *r.diagnostics : diagnostics,
+                        r.spanTrace ? *r.spanTrace : spanTrace,
+                        r.threadline ? *r.threadline : threadline,
+                        r.gaugeData ? *r.gaugeData : gaugeData};
     }
 
-    Platform platform = withDevice(device);
+    Platform platform = with({});
 };
 
 }  // namespace qv::bench

@@ -51,7 +51,7 @@ struct Env : bench::BenchPlatform {
     Env() : BenchPlatform("qv-icx-bench") {}
     LinuxDeviceInformation capableDevice{writeDeviceFile(stateDir),
                                          std::filesystem::path(stateDir) / "logs"};
-    Platform internal = withDevice(capableDevice);
+    Platform internal = with({.device = &capableDevice});
 };
 
 Env& env() {

@@ -13,10 +13,13 @@ class DeviceInformation;
 class IssueCaptureService;
 class DiagnosticRequestService;
 class IssueFilerService;
+class GaugeDataWriter;
 class NotificationCenter;
 class PreferenceStore;
 class ProcessInfo;
+class SpanTraceRecorder;
 class SystemCondition;
+class ThreadlineModelReader;
 
 struct Platform {
     Clock& clock;
@@ -31,6 +34,9 @@ struct Platform {
     IssueCaptureService& issueCapture;
     IssueFilerService& issueFiler;
     DiagnosticRequestService& diagnostics;
+    SpanTraceRecorder& spanTrace;
+    ThreadlineModelReader& threadline;
+    GaugeDataWriter& gaugeData;
 };
 
 }  // namespace qv

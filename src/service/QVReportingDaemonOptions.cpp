@@ -101,6 +101,9 @@ std::optional<QVReportingDaemonOptions> QVReportingParseDaemonOptions(int argc, 
     app.add_option("--journal-dir", o.journalDir,
                    "Directory of journal files that issue captures read (default: the local "
                    "journal)");
+    app.add_option("--tracefs", o.tracefsRoot,
+                   "tracefs mount for performance traces; default: /sys/kernel/tracing, else "
+                   "/sys/kernel/debug/tracing");
     try {
         app.parse(argc, argv);
     } catch (const CLI::ParseError& e) {

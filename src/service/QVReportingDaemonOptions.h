@@ -21,6 +21,9 @@ struct QVReportingDaemonOptions {
     std::string accessoryDir = "/etc/qvreportd/accessories";
     // Journal files the issue-capture service reads; empty: the local journal.
     std::string journalDir;
+    // The tracefs root the trace recorder uses; empty: the first mounted of /sys/kernel/tracing
+    // and /sys/kernel/debug/tracing.
+    std::string tracefsRoot;
 };
 
 // Parses argv. Returns the options, or nothing after printing help, the version or an error;

@@ -22,12 +22,15 @@
 #include "platform/linux/LinuxConvoService.h"
 #include "platform/linux/LinuxDeviceInformation.h"
 #include "platform/linux/LinuxDiagnosticRequestService.h"
+#include "platform/linux/LinuxGaugeDataWriter.h"
 #include "platform/linux/LinuxIssueCaptureService.h"
 #include "platform/linux/LinuxIssueFilerService.h"
 #include "platform/linux/LinuxNotificationCenter.h"
 #include "platform/linux/LinuxPreferenceStore.h"
 #include "platform/linux/LinuxProcessInfo.h"
+#include "platform/linux/LinuxSpanTraceRecorder.h"
 #include "platform/linux/LinuxSystemCondition.h"
+#include "platform/linux/LinuxThreadlineModelReader.h"
 #include "service/QVReportingDBusServer.h"
 #include "service/QVReportingDaemonOptions.h"
 #include "service/QVReportingService.h"
@@ -178,9 +181,19 @@ int main(int argc, char** argv) {
             .notice = [](const std::string& message) {
                 QVLOG_DEFAULT(QVReportingPulsarLogCategory(), "{}", message);
             }});
+    LinuxSpanTraceRecorder::Options traceOptions;
+    traceOptions.traceDirectory = device.diagnosticLogsDirectory() / "Audio" / "Traces" / "raw";
+    traceOptions.tracefsRoot = options->tracefsRoot;
+    LinuxSpanTraceRecorder spanTrace(std::move(traceOptions), [](const std::string& message) {
+        QVLOG_ERROR(QVReportingTraceCategory(), "{}", message);
+    });
+    LinuxThreadlineModelReader threadline;
+    LinuxGaugeDataWriter gaugeData;
+
     const Platform platform{
-        clock,     device, process,   preferences,  notifications, *analytics.service,
-        condition, convo,  bluetooth, issueCapture, issueFiler,    diagnostics};
+        clock,     device,     process,   preferences,  notifications, *analytics.service,
+        condition, convo,      bluetooth, issueCapture, issueFiler,    diagnostics,
+        spanTrace, threadline, gaugeData};
 
     QVReportingWorkerRegistry::setAllWorkerClasses(QVReportingAllWorkerClasses());
     SerialQueue& queue = QVReportingUtilityGetReportingServerQueue();

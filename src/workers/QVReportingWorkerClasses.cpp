@@ -11,6 +11,7 @@
 #include "workers/diagnostics/QVReportingSessionICXWorker.h"
 #include "workers/diagnostics/QVReportingSessionIssueFilerWorker.h"
 #include "workers/diagnostics/QVReportingSessionPulsarWorker.h"
+#include "workers/diagnostics/QVReportingSessionTraceWorker.h"
 
 namespace qv {
 
@@ -19,6 +20,7 @@ QVReportingWorkerRegistry::ClassList QVReportingAllWorkerClasses() {
     // driver snapshot, system monitor, ICX, Pulsar, summary JSON file, audio registration, Convo,
     // IssueFiler. Only the classes that exist are listed.
     return {
+        &makeWorkerClass<QVReportingSessionTraceWorker>(),
         &makeWorkerClass<QVReportingSessionVolumeMessagesWorker>(),
         &makeWorkerClass<QVReportingSessionOrbitMessagesWorker>(),
         &makeWorkerClass<QVReportingSessionSummaryWorker>(),

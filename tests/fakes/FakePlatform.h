@@ -6,9 +6,12 @@
 #include "fakes/FakeConvoService.h"
 #include "fakes/FakeDeviceInformation.h"
 #include "fakes/FakeDiagnosticRequestService.h"
+#include "fakes/FakeGaugeDataWriter.h"
 #include "fakes/FakeIssueCaptureService.h"
 #include "fakes/FakeIssueFilerService.h"
 #include "fakes/FakeServices.h"
+#include "fakes/FakeSpanTraceRecorder.h"
+#include "fakes/FakeThreadlineModelReader.h"
 #include "platform/Platform.h"
 
 namespace qv::test {
@@ -27,6 +30,9 @@ struct FakePlatform {
         IssueCaptureService* issueCapture = nullptr;
         IssueFilerService* issueFiler = nullptr;
         DiagnosticRequestService* diagnostics = nullptr;
+        SpanTraceRecorder* spanTrace = nullptr;
+        ThreadlineModelReader* threadline = nullptr;
+        GaugeDataWriter* gaugeData = nullptr;
     };
 
     // The fakes' platform with some services replaced, for a test that brings its own.
@@ -42,7 +48,10 @@ struct FakePlatform {
                         r.bluetooth ? *r.bluetooth : bluetooth,
                         r.issueCapture ? *r.issueCapture : issueCapture,
                         r.issueFiler ? *r.issueFiler : issueFiler,
-                        r.diagnostics ? *r.diagnostics : diagnostics};
+                        r.diagnostics ? *r.diagnostics : diagnostics,
+                        r.spanTrace ? *r.spanTrace : spanTrace,
+                        r.threadline ? *r.threadline : threadline,
+                        r.gaugeData ? *r.gaugeData : gaugeData};
     }
 
     FakeClock clock;
@@ -57,6 +66,9 @@ struct FakePlatform {
     FakeIssueCaptureService issueCapture;
     FakeIssueFilerService issueFiler;
     FakeDiagnosticRequestService diagnostics;
+    FakeSpanTraceRecorder spanTrace;
+    FakeThreadlineModelReader threadline;
+    FakeGaugeDataWriter gaugeData;
     Platform platform = with({});
 };
 
