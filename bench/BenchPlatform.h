@@ -15,6 +15,8 @@
 #include "platform/linux/LinuxNotificationCenter.h"
 #include "platform/linux/LinuxPreferenceStore.h"
 #include "platform/linux/LinuxProcessInfo.h"
+#include "platform/linux/LinuxProcessLauncher.h"
+#include "platform/linux/LinuxStatFeed.h"
 #include "platform/linux/LinuxSystemCondition.h"
 #include "session/QVReportingLog.h"
 
@@ -41,8 +43,11 @@ struct BenchPlatform {
     LinuxConvoService convo{preferences, std::make_unique<JsonlSink>(
                                              stateDir, std::string(LinuxConvoService::kSinkName),
                                              clock, SinkCallbacks{})};
-    Platform platform{clock,     device, process, preferences, notifications, *analytics.service,
-                      condition, convo};
+    LinuxStatFeed statFeed{"/", clock};
+    LinuxProcessLauncher processLauncher;
+    Platform platform{
+        clock,     device, process,  preferences,    notifications, *analytics.service,
+        condition, convo,  statFeed, processLauncher};
 };
 
 }  // namespace qv::bench

@@ -12,6 +12,8 @@ class DeviceInformation;
 class NotificationCenter;
 class PreferenceStore;
 class ProcessInfo;
+class ProcessLauncher;
+class StatFeed;
 class SystemCondition;
 
 struct Platform {
@@ -23,6 +25,8 @@ struct Platform {
     AnalyticsService& analytics;
     SystemCondition& condition;
     ConvoService& convo;
+    StatFeed& statFeed;
+    ProcessLauncher& processLauncher;
 };
 
 }  // namespace qv

@@ -82,6 +82,10 @@ std::optional<QVReportingDaemonOptions> QVReportingParseDaemonOptions(int argc, 
     app.add_option("--max-clients", l.maxClients, "Most clients served at once")
         ->capture_default_str()
         ->check(CLI::PositiveNumber);
+    app.add_option("--sysfs-root", o.sysfsRoot,
+                   "Directory standing for / when driver statistics are read from /proc and /sys "
+                   "(a fixture tree in tests)")
+        ->capture_default_str();
     try {
         app.parse(argc, argv);
     } catch (const CLI::ParseError& e) {

@@ -17,6 +17,8 @@ struct QVReportingDaemonOptions {
     std::string analyticsEventsFile;
     LogLevel logLevel = LogLevel::Info;
     QVReportingLimits limits;
+    // The directory that stands for "/" when kernel counters are read (driver statistics).
+    std::string sysfsRoot = "/";
 };
 
 // Parses argv. Returns the options, or nothing after printing help, the version or an error;

@@ -21,6 +21,8 @@
 #include "platform/linux/LinuxNotificationCenter.h"
 #include "platform/linux/LinuxPreferenceStore.h"
 #include "platform/linux/LinuxProcessInfo.h"
+#include "platform/linux/LinuxProcessLauncher.h"
+#include "platform/linux/LinuxStatFeed.h"
 #include "platform/linux/LinuxSystemCondition.h"
 #include "service/QVReportingDBusServer.h"
 #include "service/QVReportingDaemonOptions.h"
@@ -116,8 +118,11 @@ int main(int argc, char** argv) {
         preferences,
         std::make_unique<JsonlSink>(options->stateDir, std::string(LinuxConvoService::kSinkName),
                                     clock, sinkCallbacks));
+    LinuxStatFeed statFeed(options->sysfsRoot, clock);
+    LinuxProcessLauncher processLauncher;
     const Platform platform{
-        clock, device, process, preferences, notifications, *analytics.service, condition, convo};
+        clock,     device, process,  preferences,    notifications, *analytics.service,
+        condition, convo,  statFeed, processLauncher};
 
     QVReportingWorkerRegistry::setAllWorkerClasses(QVReportingAllWorkerClasses());
     SerialQueue& queue = QVReportingUtilityGetReportingServerQueue();

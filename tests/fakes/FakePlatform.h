@@ -4,7 +4,9 @@
 #include "fakes/FakeClock.h"
 #include "fakes/FakeConvoService.h"
 #include "fakes/FakeDeviceInformation.h"
+#include "fakes/FakeProcessLauncher.h"
 #include "fakes/FakeServices.h"
+#include "fakes/FakeStatFeed.h"
 #include "platform/Platform.h"
 
 namespace qv::test {
@@ -14,14 +16,22 @@ struct FakePlatform {
     struct Replacements {
         AnalyticsService* analytics = nullptr;
         ConvoService* convo = nullptr;
+        StatFeed* statFeed = nullptr;
+        ProcessLauncher* processLauncher = nullptr;
     };
 
     // The fakes' platform with some services replaced, for a test that brings its own.
     Platform with(const Replacements& r) {
-        return Platform{clock,         device,
-                        process,       preferences,
-                        notifications, r.analytics ? *r.analytics : analytics,
-                        condition,     r.convo ? *r.convo : convo};
+        return Platform{clock,
+                        device,
+                        process,
+                        preferences,
+                        notifications,
+                        r.analytics ? *r.analytics : analytics,
+                        condition,
+                        r.convo ? *r.convo : convo,
+                        r.statFeed ? *r.statFeed : statFeed,
+                        r.processLauncher ? *r.processLauncher : processLauncher};
     }
 
     FakeClock clock;
@@ -32,6 +42,8 @@ struct FakePlatform {
     FakeAnalyticsService analytics;
     FakeSystemCondition condition;
     FakeConvoService convo;
+    FakeStatFeed statFeed;
+    FakeProcessLauncher processLauncher;
     Platform platform = with({});
 };
 
