@@ -79,14 +79,24 @@ class DriverStatistics(DaemonTestCase):
         self.assertIn("couldn't find any channels for driver group KorvaneAE2MCA-(null)", log)
         self.assertIn("subscribed to group group pdm-(null)", log)
 
-        # A second session without changes gets no statistics; the daemon goes on.
-        c.create(701, service_type=TEST_SERVICE)
-        c.start(701)
-        c.reporting.GetAllReporters()
-        os.remove(os.path.join(self.sysfs, "proc/interrupts"))
-        self.assertTrue(c.stop(701))
-        self.assertEqual(len(self.daemon.events("com.korvane.qvsound.ChannelStats.")), 3)
-        self.assertEqual(list(c.reporting.GetAllReporters()), [700, 701])
+        # A second session without changes gets no statistics, though the interrupts are gone
+        # by its stop; a third, after which one counter moved, gets that one alone. The sink
+        # keeps the order of sending, so the third's message shows that the second sent none.
+        for rid in (701, 702):
+            c.create(rid, service_type=TEST_SERVICE)
+            c.start(rid)
+            c.reporting.GetAllReporters()
+            if rid == 701:
+                os.remove(os.path.join(self.sysfs, "proc/interrupts"))
+            else:
+                self.write("sys/class/net/lo/statistics/rx_packets", str(1000 + 13 * 17 + 1))
+            self.assertTrue(c.stop(rid))
+        simple = wait_until(lambda: self.daemon.events("com.korvane.qvsound.ChannelStats.Simple")
+                            [1:], what="the third session's statistics")
+        self.assertEqual({k: v for k, v in simple[0]["payload"].items() if "_Simple_" in k},
+                         {"lo_Rx_Simple_rxpackets": 1})
+        self.assertEqual(len(self.daemon.events("com.korvane.qvsound.ChannelStats.")), 4)
+        self.assertIn("StatFeedCreateSamples error 2", self.daemon.log_text())
 
 
 class MemoryLog(DaemonTestCase):
