@@ -148,9 +148,13 @@ TEST_F(TheLinuxStatFeed, FailsWhereNothingCanBeReadAndTheDaemonGoesOn) {
     EXPECT_FALSE(samples.ok());
     EXPECT_EQ(samples.error(), ENOENT);
 
-    // Channels of another library are refused.
-    auto foreign = std::make_shared<StatFeedChannelInfo>(*lo->front());
-    EXPECT_EQ(feed.createSubscription({foreign}).error(), EINVAL);
+    // Channels of another library are refused, however their ids fall.
+    for (const std::uint64_t id : {lo->front()->id, std::uint64_t{999999}}) {
+        auto foreign = std::make_shared<StatFeedChannelInfo>(*lo->front());
+        foreign->id = id;
+        foreign->name = "not here";
+        EXPECT_EQ(feed.createSubscription({foreign}).error(), EINVAL);
+    }
 }
 
 }  // namespace

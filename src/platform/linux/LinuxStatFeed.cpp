@@ -8,6 +8,7 @@
 #include <cctype>
 #include <cerrno>
 #include <charconv>
+#include <chrono>
 #include <cstring>
 #include <limits>
 #include <map>
@@ -897,21 +898,42 @@ StatFeedResult<StatFeed::ChannelSetRef> LinuxStatFeed::channelsInGroup(
     if (!exists(root_.string())) {
         return StatFeedError{ENOENT};
     }
-    auto set = std::make_shared<StatFeedChannelSet>();
-    std::vector<Published> all = discover();
-    std::lock_guard lock(mutex_);
-    for (Published& p : all) {
-        if ((group && p.info->group != group) || (subgroup && p.info->subgroup != subgroup)) {
-            continue;
+    const auto now = std::chrono::steady_clock::now();
+    std::shared_ptr<const Discovery> discovery;
+    {
+        std::lock_guard lock(mutex_);
+        if (discovery_ && now - discoveredAt_ < kDiscoveryReuse) {
+            discovery = discovery_;
         }
-        set->push_back(p.info);
-        const std::uint64_t id = p.info->id;
-        published_[id] = std::make_shared<const Published>(std::move(p));
+    }
+    if (!discovery) {
+        auto fresh = std::make_shared<Discovery>();
+        for (Published& p : discover()) {
+            fresh->push_back(std::make_shared<const Published>(std::move(p)));
+        }
+        std::lock_guard lock(mutex_);
+        for (const auto& p : *fresh) {
+            published_[p->info->id] = p;
+        }
+        discovery_ = fresh;
+        discoveredAt_ = now;
+        discovery = std::move(fresh);
+    }
+    auto set = std::make_shared<StatFeedChannelSet>();
+    for (const auto& p : *discovery) {
+        if ((!group || p->info->group == group) && (!subgroup || p->info->subgroup == subgroup)) {
+            set->push_back(p->info);
+        }
     }
     return ChannelSetRef(std::move(set));
 }
 
 namespace {
+
+bool sameChannel(const StatFeedChannelInfo& a, const StatFeedChannelInfo& b) {
+    return a.id == b.id && a.format == b.format && a.driverName == b.driverName &&
+           a.group == b.group && a.subgroup == b.subgroup && a.name == b.name;
+}
 
 // A subscription: its channels grouped by source, each source read once per sample.
 class LinuxSubscription final : public StatFeedSubscription {
@@ -937,7 +959,9 @@ StatFeedResult<StatFeed::Subscribed> LinuxStatFeed::createSubscription(
         std::lock_guard lock(mutex_);
         for (const auto& info : channels) {
             const auto it = info ? published_.find(info->id) : published_.end();
-            if (it == published_.end() || it->second->info != info) {
+            // A later discovery makes new descriptions of the same channels: the id and what it
+            // describes must match, not the object.
+            if (it == published_.end() || !sameChannel(*it->second->info, *info)) {
                 return StatFeedError{EINVAL};  // not a channel of this library
             }
             const Published& p = *it->second;

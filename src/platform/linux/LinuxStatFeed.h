@@ -44,19 +44,22 @@
 //   out of that sample; a sample in which no channel can be read fails with the first error.
 // - Names are trimmed, control characters become '?', and each is cut at 255 bytes.
 //
-// Channels are discovered afresh on every channelsInGroup(); a channel keeps its id for the life
-// of the object. Samples read only the files of the subscription, each once.
+// Channels are discovered afresh by channelsInGroup(), except that queries within a second of a
+// discovery reuse it (a client lists several groups in a burst); a channel keeps its id for the
+// life of the object. Samples read only the files of the subscription, each once.
 //
 // Thread safety: every member may be called from any thread. Reading is done on the caller's
 // thread: these are small in-memory kernel files, read in well under a millisecond each.
 #pragma once
 
+#include <chrono>
 #include <cstdint>
 #include <filesystem>
 #include <memory>
 #include <mutex>
 #include <string>
 #include <unordered_map>
+#include <vector>
 
 #include "platform/StatFeed.h"
 
@@ -85,11 +88,17 @@ class LinuxStatFeed final : public StatFeed {
     std::vector<Published> discover();
     std::uint64_t idFor(const std::string& key);
 
+    using Discovery = std::vector<std::shared_ptr<const Published>>;
+    static constexpr std::chrono::seconds kDiscoveryReuse{1};
+
     const std::filesystem::path root_;
     const Clock& clock_;
     std::mutex mutex_;
     std::unordered_map<std::string, std::uint64_t> ids_;  // guarded by mutex_
+    // Every channel ever discovered, by id: what subscriptions are made from.
     std::unordered_map<std::uint64_t, std::shared_ptr<const Published>> published_;  // mutex_
+    std::shared_ptr<const Discovery> discovery_;                                     // mutex_
+    std::chrono::steady_clock::time_point discoveredAt_;                             // mutex_
 };
 
 }  // namespace qv
