@@ -21,7 +21,9 @@
 #include "platform/linux/LinuxNotificationCenter.h"
 #include "platform/linux/LinuxPreferenceStore.h"
 #include "platform/linux/LinuxProcessInfo.h"
+#include "platform/linux/LinuxProcessLauncher.h"
 #include "platform/linux/LinuxSpanTraceRecorder.h"
+#include "platform/linux/LinuxStatFeed.h"
 #include "platform/linux/LinuxSystemCondition.h"
 #include "platform/linux/LinuxThreadlineModelReader.h"
 #include "session/QVReportingLog.h"
@@ -90,6 +92,9 @@ struct BenchPlatform {
     LinuxThreadlineModelReader threadline;
     LinuxGaugeDataWriter gaugeData;
 
+    LinuxStatFeed statFeed{"/", clock};
+    LinuxProcessLauncher processLauncher;
+
     // Services a benchmark puts in place of the Linux ones; those left null stay.
     struct Replacements {
         DeviceInformation* device = nullptr;
@@ -106,6 +111,8 @@ struct BenchPlatform {
         SpanTraceRecorder* spanTrace = nullptr;
         ThreadlineModelReader* threadline = nullptr;
         GaugeDataWriter* gaugeData = nullptr;
+        StatFeed* statFeed = nullptr;
+        ProcessLauncher* processLauncher = nullptr;
     };
 
     // The platform with some services replaced, for a benchmark that brings its own.
@@ -124,7 +131,9 @@ struct BenchPlatform {
                         r.diagnostics ? *r.diagnostics : diagnostics,
                         r.spanTrace ? *r.spanTrace : spanTrace,
                         r.threadline ? *r.threadline : threadline,
-                        r.gaugeData ? *r.gaugeData : gaugeData};
+                        r.gaugeData ? *r.gaugeData : gaugeData,
+                        r.statFeed ? *r.statFeed : statFeed,
+                        r.processLauncher ? *r.processLauncher : processLauncher};
     }
 
     Platform platform = with({});

@@ -18,6 +18,8 @@ class NotificationCenter;
 class PreferenceStore;
 class ProcessInfo;
 class SpanTraceRecorder;
+class ProcessLauncher;
+class StatFeed;
 class SystemCondition;
 class ThreadlineModelReader;
 
@@ -37,6 +39,8 @@ struct Platform {
     SpanTraceRecorder& spanTrace;
     ThreadlineModelReader& threadline;
     GaugeDataWriter& gaugeData;
+    StatFeed& statFeed;
+    ProcessLauncher& processLauncher;
 };
 
 }  // namespace qv

@@ -104,6 +104,10 @@ std::optional<QVReportingDaemonOptions> QVReportingParseDaemonOptions(int argc, 
     app.add_option("--tracefs", o.tracefsRoot,
                    "tracefs mount for performance traces; default: /sys/kernel/tracing, else "
                    "/sys/kernel/debug/tracing");
+    app.add_option("--sysfs-root", o.sysfsRoot,
+                   "Directory standing for / when driver statistics are read from /proc and /sys "
+                   "(a fixture tree in tests)")
+        ->capture_default_str();
     try {
         app.parse(argc, argv);
     } catch (const CLI::ParseError& e) {

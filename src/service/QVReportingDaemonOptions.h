@@ -24,6 +24,8 @@ struct QVReportingDaemonOptions {
     // The tracefs root the trace recorder uses; empty: the first mounted of /sys/kernel/tracing
     // and /sys/kernel/debug/tracing.
     std::string tracefsRoot;
+    // The directory that stands for "/" when kernel counters are read (driver statistics).
+    std::string sysfsRoot = "/";
 };
 
 // Parses argv. Returns the options, or nothing after printing help, the version or an error;

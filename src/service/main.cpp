@@ -28,7 +28,9 @@
 #include "platform/linux/LinuxNotificationCenter.h"
 #include "platform/linux/LinuxPreferenceStore.h"
 #include "platform/linux/LinuxProcessInfo.h"
+#include "platform/linux/LinuxProcessLauncher.h"
 #include "platform/linux/LinuxSpanTraceRecorder.h"
+#include "platform/linux/LinuxStatFeed.h"
 #include "platform/linux/LinuxSystemCondition.h"
 #include "platform/linux/LinuxThreadlineModelReader.h"
 #include "service/QVReportingDBusServer.h"
@@ -190,10 +192,13 @@ int main(int argc, char** argv) {
     LinuxThreadlineModelReader threadline;
     LinuxGaugeDataWriter gaugeData;
 
+    LinuxStatFeed statFeed(options->sysfsRoot, clock);
+    LinuxProcessLauncher processLauncher;
+
     const Platform platform{
-        clock,     device,     process,   preferences,  notifications, *analytics.service,
-        condition, convo,      bluetooth, issueCapture, issueFiler,    diagnostics,
-        spanTrace, threadline, gaugeData};
+        clock,     device,     process,   preferences,  notifications,  *analytics.service,
+        condition, convo,      bluetooth, issueCapture, issueFiler,     diagnostics,
+        spanTrace, threadline, gaugeData, statFeed,     processLauncher};
 
     QVReportingWorkerRegistry::setAllWorkerClasses(QVReportingAllWorkerClasses());
     SerialQueue& queue = QVReportingUtilityGetReportingServerQueue();
@@ -221,6 +226,9 @@ int main(int argc, char** argv) {
     service.stopAllSessions();
     server->flush();
     server.reset();
+    // Work the bus posted before it closed (a client leaving, say) runs while the service and
+    // its sessions still exist.
+    queue.sync([] {});
     JsonlSink::flushAll(std::chrono::steady_clock::now() + kShutdownFlushTimeout);
     QVReportingSystemMonitor::reset();
     QVLOG_DEFAULT(logCategory(), "stopped");

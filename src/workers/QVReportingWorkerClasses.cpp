@@ -1,5 +1,7 @@
 #include "workers/QVReportingWorkerClasses.h"
 
+#include "monitoring/QVReportingSessionDriverSnapshotWorker.h"
+#include "monitoring/QVReportingSessionMemoryLogWorker.h"
 #include "monitoring/QVReportingSessionSystemMonitorWorker.h"
 #include "workers/backends/QVReportingSessionAudioRegistrationWorker.h"
 #include "workers/backends/QVReportingSessionMetricsHubWorker.h"
@@ -26,6 +28,8 @@ QVReportingWorkerRegistry::ClassList QVReportingAllWorkerClasses() {
         &makeWorkerClass<QVReportingSessionSummaryWorker>(),
         &makeWorkerClass<QVReportingSessionInputMessagesWorker>(),
         &makeWorkerClass<QVReportingSessionMetricsHubWorker>(),
+        &makeWorkerClass<QVReportingSessionMemoryLogWorker>(),
+        &makeWorkerClass<QVReportingSessionDriverSnapshotWorker>(),
         &makeWorkerClass<QVReportingSessionSystemMonitorWorker>(),
         &makeWorkerClass<QVReportingSessionICXWorker>(),
         &makeWorkerClass<QVReportingSessionPulsarWorker>(),

@@ -181,8 +181,12 @@ class IssueFilerPrompt(DiagnosticsTestCase):
         self.assertEqual(drafts[0]["title"], "Invalid x/y coordinates during a Vidcall call (ITF)")
         self.assertEqual(drafts[0]["component"]["name"], "Vidcall Core - Callwire")
         self.assertEqual(prompts[0]["shown"], True)
-        with open(notified) as f:
-            notes = [json.loads(line) for line in f]
+        def notes_so_far():  # the server may answer before it writes down what it showed
+            if not os.path.exists(notified):
+                return []
+            with open(notified) as f:
+                return [json.loads(line) for line in f if line.endswith("\n")]
+        notes = wait_until(notes_so_far, what="the notification server's record")
         self.assertEqual(len(notes), 1)
         self.assertEqual(notes[0]["summary"], drafts[0]["title"])
         self.assertIn("python3: a Vidcall spatial positioning error occurred", notes[0]["body"])

@@ -9,8 +9,10 @@
 #include "fakes/FakeGaugeDataWriter.h"
 #include "fakes/FakeIssueCaptureService.h"
 #include "fakes/FakeIssueFilerService.h"
+#include "fakes/FakeProcessLauncher.h"
 #include "fakes/FakeServices.h"
 #include "fakes/FakeSpanTraceRecorder.h"
+#include "fakes/FakeStatFeed.h"
 #include "fakes/FakeThreadlineModelReader.h"
 #include "platform/Platform.h"
 
@@ -33,6 +35,8 @@ struct FakePlatform {
         SpanTraceRecorder* spanTrace = nullptr;
         ThreadlineModelReader* threadline = nullptr;
         GaugeDataWriter* gaugeData = nullptr;
+        StatFeed* statFeed = nullptr;
+        ProcessLauncher* processLauncher = nullptr;
     };
 
     // The fakes' platform with some services replaced, for a test that brings its own.
@@ -51,7 +55,9 @@ struct FakePlatform {
                         r.diagnostics ? *r.diagnostics : diagnostics,
                         r.spanTrace ? *r.spanTrace : spanTrace,
                         r.threadline ? *r.threadline : threadline,
-                        r.gaugeData ? *r.gaugeData : gaugeData};
+                        r.gaugeData ? *r.gaugeData : gaugeData,
+                        r.statFeed ? *r.statFeed : statFeed,
+                        r.processLauncher ? *r.processLauncher : processLauncher};
     }
 
     FakeClock clock;
@@ -69,6 +75,8 @@ struct FakePlatform {
     FakeSpanTraceRecorder spanTrace;
     FakeThreadlineModelReader threadline;
     FakeGaugeDataWriter gaugeData;
+    FakeStatFeed statFeed;
+    FakeProcessLauncher processLauncher;
     Platform platform = with({});
 };
 
