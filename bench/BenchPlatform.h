@@ -12,6 +12,8 @@
 #include "platform/linux/LinuxClock.h"
 #include "platform/linux/LinuxConvoService.h"
 #include "platform/linux/LinuxDeviceInformation.h"
+#include "platform/linux/LinuxEnergyLogService.h"
+#include "platform/linux/LinuxMTXMetricsService.h"
 #include "platform/linux/LinuxNotificationCenter.h"
 #include "platform/linux/LinuxPreferenceStore.h"
 #include "platform/linux/LinuxProcessInfo.h"
@@ -41,8 +43,12 @@ struct BenchPlatform {
     LinuxConvoService convo{preferences, std::make_unique<JsonlSink>(
                                              stateDir, std::string(LinuxConvoService::kSinkName),
                                              clock, SinkCallbacks{})};
+    LinuxMTXMetricsService mtx{std::make_unique<JsonlSink>(
+        stateDir, std::string(LinuxMTXMetricsService::kSinkName), clock, SinkCallbacks{})};
+    LinuxEnergyLogService energyLog{std::make_unique<JsonlSink>(
+        stateDir, std::string(LinuxEnergyLogService::kSinkName), clock, SinkCallbacks{})};
     Platform platform{clock,     device, process, preferences, notifications, *analytics.service,
-                      condition, convo};
+                      condition, convo,  mtx,     energyLog};
 };
 
 }  // namespace qv::bench

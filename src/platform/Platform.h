@@ -9,6 +9,8 @@ class AnalyticsService;
 class Clock;
 class ConvoService;
 class DeviceInformation;
+class EnergyLogService;
+class MTXMetricsService;
 class NotificationCenter;
 class PreferenceStore;
 class ProcessInfo;
@@ -23,6 +25,8 @@ struct Platform {
     AnalyticsService& analytics;
     SystemCondition& condition;
     ConvoService& convo;
+    MTXMetricsService& mtx;
+    EnergyLogService& energyLog;
 };
 
 }  // namespace qv

@@ -18,6 +18,8 @@
 #include "platform/linux/LinuxClock.h"
 #include "platform/linux/LinuxConvoService.h"
 #include "platform/linux/LinuxDeviceInformation.h"
+#include "platform/linux/LinuxEnergyLogService.h"
+#include "platform/linux/LinuxMTXMetricsService.h"
 #include "platform/linux/LinuxNotificationCenter.h"
 #include "platform/linux/LinuxPreferenceStore.h"
 #include "platform/linux/LinuxProcessInfo.h"
@@ -116,8 +118,13 @@ int main(int argc, char** argv) {
         preferences,
         std::make_unique<JsonlSink>(options->stateDir, std::string(LinuxConvoService::kSinkName),
                                     clock, sinkCallbacks));
+    LinuxMTXMetricsService mtx(std::make_unique<JsonlSink>(
+        options->stateDir, std::string(LinuxMTXMetricsService::kSinkName), clock, sinkCallbacks));
+    LinuxEnergyLogService energyLog(std::make_unique<JsonlSink>(
+        options->stateDir, std::string(LinuxEnergyLogService::kSinkName), clock, sinkCallbacks));
     const Platform platform{
-        clock, device, process, preferences, notifications, *analytics.service, condition, convo};
+        clock,     device, process, preferences, notifications, *analytics.service,
+        condition, convo,  mtx,     energyLog};
 
     QVReportingWorkerRegistry::setAllWorkerClasses(QVReportingAllWorkerClasses());
     SerialQueue& queue = QVReportingUtilityGetReportingServerQueue();
@@ -147,6 +154,8 @@ int main(int argc, char** argv) {
     server.reset();
     analytics.service->flush();
     convo.flush();
+    mtx.flush();
+    energyLog.flush();
     QVReportingSystemMonitor::reset();
     QVLOG_DEFAULT(logCategory(), "stopped");
     if (auto sink = logSink()) {

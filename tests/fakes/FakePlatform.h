@@ -4,6 +4,8 @@
 #include "fakes/FakeClock.h"
 #include "fakes/FakeConvoService.h"
 #include "fakes/FakeDeviceInformation.h"
+#include "fakes/FakeEnergyLogService.h"
+#include "fakes/FakeMTXMetricsService.h"
 #include "fakes/FakeServices.h"
 #include "platform/Platform.h"
 
@@ -14,14 +16,22 @@ struct FakePlatform {
     struct Replacements {
         AnalyticsService* analytics = nullptr;
         ConvoService* convo = nullptr;
+        MTXMetricsService* mtx = nullptr;
+        EnergyLogService* energyLog = nullptr;
     };
 
     // The fakes' platform with some services replaced, for a test that brings its own.
     Platform with(const Replacements& r) {
-        return Platform{clock,         device,
-                        process,       preferences,
-                        notifications, r.analytics ? *r.analytics : analytics,
-                        condition,     r.convo ? *r.convo : convo};
+        return Platform{clock,
+                        device,
+                        process,
+                        preferences,
+                        notifications,
+                        r.analytics ? *r.analytics : analytics,
+                        condition,
+                        r.convo ? *r.convo : convo,
+                        r.mtx ? *r.mtx : mtx,
+                        r.energyLog ? *r.energyLog : energyLog};
     }
 
     FakeClock clock;
@@ -32,6 +42,8 @@ struct FakePlatform {
     FakeAnalyticsService analytics;
     FakeSystemCondition condition;
     FakeConvoService convo;
+    FakeMTXMetricsService mtx;
+    FakeEnergyLogService energyLog;
     Platform platform = with({});
 };
 
