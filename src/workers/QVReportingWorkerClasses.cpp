@@ -1,6 +1,8 @@
 #include "workers/QVReportingWorkerClasses.h"
 
 #include "monitoring/QVReportingSessionSystemMonitorWorker.h"
+#include "workers/backends/QVReportingSessionEnergyLogWorker.h"
+#include "workers/backends/QVReportingSessionMTXWorker.h"
 #include "workers/backends/QVReportingSessionMetricsHubWorker.h"
 #include "workers/derived/QVReportingSessionInputMessagesWorker.h"
 #include "workers/derived/QVReportingSessionOrbitMessagesWorker.h"
@@ -20,6 +22,8 @@ QVReportingWorkerRegistry::ClassList QVReportingAllWorkerClasses() {
         &makeWorkerClass<QVReportingSessionSummaryWorker>(),
         &makeWorkerClass<QVReportingSessionInputMessagesWorker>(),
         &makeWorkerClass<QVReportingSessionMetricsHubWorker>(),
+        &makeWorkerClass<QVReportingSessionEnergyLogWorker>(),
+        &makeWorkerClass<QVReportingSessionMTXWorker>(),
         &makeWorkerClass<QVReportingSessionSystemMonitorWorker>(),
         &makeWorkerClass<QVReportingSessionSummaryJsonFileWorker>(),
     };
