@@ -45,7 +45,7 @@ class MTXSink(DaemonTestCase):
         c.start(70)
         c.send({"issue_type": "dropout", "node": dbus.Int32(12), "rtaid_client": "com.example",
                 "any_channel_silence_seconds": dbus.Int32(-3)}, IO, ISSUE_DETECTOR, [70])
-        # Every kind of value in every field, and none at all: records all the same.
+        # Values of other kinds in every field, and no keys at all: records all the same.
         c.send({"issue_type": dbus.Dictionary({"a": dbus.Array([1.5], signature="d")},
                                               signature="sv"),
                 "node": float("nan"), "rtaid_client": dbus.Boolean(True),
