@@ -15,9 +15,11 @@
 #include "platform/linux/LinuxConvoService.h"
 #include "platform/linux/LinuxDeviceInformation.h"
 #include "platform/linux/LinuxDiagnosticRequestService.h"
+#include "platform/linux/LinuxEnergyLogService.h"
 #include "platform/linux/LinuxGaugeDataWriter.h"
 #include "platform/linux/LinuxIssueCaptureService.h"
 #include "platform/linux/LinuxIssueFilerService.h"
+#include "platform/linux/LinuxMTXMetricsService.h"
 #include "platform/linux/LinuxNotificationCenter.h"
 #include "platform/linux/LinuxPreferenceStore.h"
 #include "platform/linux/LinuxProcessInfo.h"
@@ -95,6 +97,11 @@ struct BenchPlatform {
     LinuxStatFeed statFeed{"/", clock};
     LinuxProcessLauncher processLauncher;
 
+    LinuxMTXMetricsService mtx{std::make_unique<JsonlSink>(
+        stateDir, std::string(LinuxMTXMetricsService::kSinkName), clock, SinkCallbacks{})};
+    LinuxEnergyLogService energyLog{std::make_unique<JsonlSink>(
+        stateDir, std::string(LinuxEnergyLogService::kSinkName), clock, SinkCallbacks{})};
+
     // Services a benchmark puts in place of the Linux ones; those left null stay.
     struct Replacements {
         DeviceInformation* device = nullptr;
@@ -113,6 +120,8 @@ struct BenchPlatform {
         GaugeDataWriter* gaugeData = nullptr;
         StatFeed* statFeed = nullptr;
         ProcessLauncher* processLauncher = nullptr;
+        MTXMetricsService* mtx = nullptr;
+        EnergyLogService* energyLog = nullptr;
     };
 
     // The platform with some services replaced, for a benchmark that brings its own.
@@ -133,7 +142,9 @@ struct BenchPlatform {
                         r.threadline ? *r.threadline : threadline,
                         r.gaugeData ? *r.gaugeData : gaugeData,
                         r.statFeed ? *r.statFeed : statFeed,
-                        r.processLauncher ? *r.processLauncher : processLauncher};
+                        r.processLauncher ? *r.processLauncher : processLauncher,
+                        r.mtx ? *r.mtx : mtx,
+                        r.energyLog ? *r.energyLog : energyLog};
     }
 
     Platform platform = with({});

@@ -13,8 +13,8 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include "QVReportingCtlMTXRecord.h"
 #include "session/QVReportingVocabulary.h"
-#include "values/Base64.h"
 
 namespace qv::client {
 
@@ -236,20 +236,9 @@ std::string QVReportingCtlFormatSinkLine(std::string_view sink, std::string_view
         }
         return fmt::format("(unreadable) {} {}", sink, line);
     }
+    std::string decodedRecord;
     if (sink == kMTXSink) {
-        if (auto record = object.find("record"); record != object.end() && record->is_string()) {
-            if (auto bytes = QVReportingBase64Decode(record->get<std::string>())) {
-                std::string hex;
-                hex.reserve(bytes->size() * 2);
-                for (std::uint8_t b : *bytes) {
-                    hex += fmt::format("{:02x}", b);
-                }
-                object["record_hex"] = hex;
-                if (!json) {
-                    object.erase("record");
-                }
-            }
-        }
+        decodedRecord = QVReportingCtlDecodeMTXRecord(object, json);
     }
     if (json) {
         nlohmann::ordered_json out = {{"sink", sink}};
@@ -265,9 +254,14 @@ std::string QVReportingCtlFormatSinkLine(std::string_view sink, std::string_view
         time = QVReportingCtlFormatUTC(t->get<double>());
         object.erase("time");
     }
-    return fmt::format(
-        "{} {} {}", time, sink,
-        object.dump(-1, ' ', false, nlohmann::ordered_json::error_handler_t::replace));
+    std::string text =
+        fmt::format("{} {} {}", time, sink,
+                    object.dump(-1, ' ', false, nlohmann::ordered_json::error_handler_t::replace));
+    if (!decodedRecord.empty()) {
+        text += ' ';
+        text += decodedRecord;
+    }
+    return text;
 }
 
 std::vector<std::string> QVReportingSinkTail::readNewLines() {

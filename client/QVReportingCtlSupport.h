@@ -59,8 +59,8 @@ bool QVReportingCtlIsSinkName(std::string_view sink);
 
 // One sink line for output. For people: "<UTC time> <sink> <the other fields as JSON>", the
 // "time" field shown as an ISO 8601 date; for scripts: the line's object with "sink" first. An
-// "mtx" line's "record" (base64 of the metric's wire bytes) is shown decoded as lower-case hex,
-// under "record_hex" (the base64 text stays for scripts). A line that is not a JSON object is
+// "mtx" line's "record" (base64 of the metric's wire bytes) is shown decoded as an
+// AudioIssueDetected (see QVReportingCtlDecodeMTXRecord). A line that is not a JSON object is
 // shown as it is, marked unreadable.
 std::string QVReportingCtlFormatSinkLine(std::string_view sink, std::string_view line, bool json);
 

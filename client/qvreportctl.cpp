@@ -137,7 +137,7 @@ int run(int argc, char** argv) {
     c = app.add_subcommand("stats", "Print the daemon's guardrail counters (GetStats)");
     c->callback([&] { action = [&] { return bus.stats(); }; });
 
-    c = app.add_subcommand("sinks", "Print the sink files (MTX records decoded as hex)");
+    c = app.add_subcommand("sinks", "Print the sink files (MTX records decoded)");
     c->add_option("NAME", sink, "One sink (analytics, mtx, ...); default: all, merged by time");
     c->add_flag("-f,--follow", follow, "Keep printing lines as they are appended");
     c->callback([&] { action = [&] { return printSinks(options, sink, follow); }; });

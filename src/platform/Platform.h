@@ -14,6 +14,8 @@ class IssueCaptureService;
 class DiagnosticRequestService;
 class IssueFilerService;
 class GaugeDataWriter;
+class EnergyLogService;
+class MTXMetricsService;
 class NotificationCenter;
 class PreferenceStore;
 class ProcessInfo;
@@ -41,6 +43,8 @@ struct Platform {
     GaugeDataWriter& gaugeData;
     StatFeed& statFeed;
     ProcessLauncher& processLauncher;
+    MTXMetricsService& mtx;
+    EnergyLogService& energyLog;
 };
 
 }  // namespace qv

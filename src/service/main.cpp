@@ -22,9 +22,11 @@
 #include "platform/linux/LinuxConvoService.h"
 #include "platform/linux/LinuxDeviceInformation.h"
 #include "platform/linux/LinuxDiagnosticRequestService.h"
+#include "platform/linux/LinuxEnergyLogService.h"
 #include "platform/linux/LinuxGaugeDataWriter.h"
 #include "platform/linux/LinuxIssueCaptureService.h"
 #include "platform/linux/LinuxIssueFilerService.h"
+#include "platform/linux/LinuxMTXMetricsService.h"
 #include "platform/linux/LinuxNotificationCenter.h"
 #include "platform/linux/LinuxPreferenceStore.h"
 #include "platform/linux/LinuxProcessInfo.h"
@@ -195,10 +197,16 @@ int main(int argc, char** argv) {
     LinuxStatFeed statFeed(options->sysfsRoot, clock);
     LinuxProcessLauncher processLauncher;
 
+    LinuxMTXMetricsService mtx(std::make_unique<JsonlSink>(
+        options->stateDir, std::string(LinuxMTXMetricsService::kSinkName), clock, sinkCallbacks));
+    LinuxEnergyLogService energyLog(std::make_unique<JsonlSink>(
+        options->stateDir, std::string(LinuxEnergyLogService::kSinkName), clock, sinkCallbacks));
+
     const Platform platform{
-        clock,     device,     process,   preferences,  notifications,  *analytics.service,
-        condition, convo,      bluetooth, issueCapture, issueFiler,     diagnostics,
-        spanTrace, threadline, gaugeData, statFeed,     processLauncher};
+        clock,     device,     process,   preferences,  notifications,   *analytics.service,
+        condition, convo,      bluetooth, issueCapture, issueFiler,      diagnostics,
+        spanTrace, threadline, gaugeData, statFeed,     processLauncher, mtx,
+        energyLog};
 
     QVReportingWorkerRegistry::setAllWorkerClasses(QVReportingAllWorkerClasses());
     SerialQueue& queue = QVReportingUtilityGetReportingServerQueue();

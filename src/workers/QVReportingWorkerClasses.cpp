@@ -4,6 +4,8 @@
 #include "monitoring/QVReportingSessionMemoryLogWorker.h"
 #include "monitoring/QVReportingSessionSystemMonitorWorker.h"
 #include "workers/backends/QVReportingSessionAudioRegistrationWorker.h"
+#include "workers/backends/QVReportingSessionEnergyLogWorker.h"
+#include "workers/backends/QVReportingSessionMTXWorker.h"
 #include "workers/backends/QVReportingSessionMetricsHubWorker.h"
 #include "workers/derived/QVReportingSessionInputMessagesWorker.h"
 #include "workers/derived/QVReportingSessionOrbitMessagesWorker.h"
@@ -28,7 +30,9 @@ QVReportingWorkerRegistry::ClassList QVReportingAllWorkerClasses() {
         &makeWorkerClass<QVReportingSessionSummaryWorker>(),
         &makeWorkerClass<QVReportingSessionInputMessagesWorker>(),
         &makeWorkerClass<QVReportingSessionMetricsHubWorker>(),
+        &makeWorkerClass<QVReportingSessionEnergyLogWorker>(),
         &makeWorkerClass<QVReportingSessionMemoryLogWorker>(),
+        &makeWorkerClass<QVReportingSessionMTXWorker>(),
         &makeWorkerClass<QVReportingSessionDriverSnapshotWorker>(),
         &makeWorkerClass<QVReportingSessionSystemMonitorWorker>(),
         &makeWorkerClass<QVReportingSessionICXWorker>(),

@@ -83,7 +83,7 @@ TEST(AReplayScriptParser, NumbersLinesStopsAtTheFirstBadOneAndAcceptsTheShippedE
     auto result = QVReportingParseReplayScript(script);
     ASSERT_TRUE(std::holds_alternative<QVReportingReplayError>(result));
     EXPECT_EQ(std::get<QVReportingReplayError>(result).line, 4u);
-    for (const char* name : {"playback.jsonl", "recording.jsonl"}) {
+    for (const char* name : {"playback.jsonl", "recording.jsonl", "haptics.jsonl"}) {
         std::ifstream in(std::string(QV_SOURCE_DIR) + "/examples/" + name);
         auto ops = QVReportingParseReplayScript(in);
         ASSERT_TRUE(std::holds_alternative<std::vector<QVReportingReplayOperation>>(ops)) << name;

@@ -6,9 +6,11 @@
 #include "fakes/FakeConvoService.h"
 #include "fakes/FakeDeviceInformation.h"
 #include "fakes/FakeDiagnosticRequestService.h"
+#include "fakes/FakeEnergyLogService.h"
 #include "fakes/FakeGaugeDataWriter.h"
 #include "fakes/FakeIssueCaptureService.h"
 #include "fakes/FakeIssueFilerService.h"
+#include "fakes/FakeMTXMetricsService.h"
 #include "fakes/FakeProcessLauncher.h"
 #include "fakes/FakeServices.h"
 #include "fakes/FakeSpanTraceRecorder.h"
@@ -37,6 +39,8 @@ struct FakePlatform {
         GaugeDataWriter* gaugeData = nullptr;
         StatFeed* statFeed = nullptr;
         ProcessLauncher* processLauncher = nullptr;
+        MTXMetricsService* mtx = nullptr;
+        EnergyLogService* energyLog = nullptr;
     };
 
     // The fakes' platform with some services replaced, for a test that brings its own.
@@ -57,7 +61,9 @@ struct FakePlatform {
                         r.threadline ? *r.threadline : threadline,
                         r.gaugeData ? *r.gaugeData : gaugeData,
                         r.statFeed ? *r.statFeed : statFeed,
-                        r.processLauncher ? *r.processLauncher : processLauncher};
+                        r.processLauncher ? *r.processLauncher : processLauncher,
+                        r.mtx ? *r.mtx : mtx,
+                        r.energyLog ? *r.energyLog : energyLog};
     }
 
     FakeClock clock;
@@ -77,6 +83,8 @@ struct FakePlatform {
     FakeGaugeDataWriter gaugeData;
     FakeStatFeed statFeed;
     FakeProcessLauncher processLauncher;
+    FakeMTXMetricsService mtx;
+    FakeEnergyLogService energyLog;
     Platform platform = with({});
 };
 

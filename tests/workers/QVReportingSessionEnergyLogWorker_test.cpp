@@ -1,0 +1,165 @@
+#include "workers/backends/QVReportingSessionEnergyLogWorker.h"
+
+#include <gtest/gtest.h>
+
+#include <cmath>
+#include <string>
+#include <vector>
+
+#include "fakes/FakePlatform.h"
+#include "fakes/MemoryLogSink.h"
+#include "session/QVReportingSession.h"
+#include "session/QVReportingWorkerRegistry.h"
+
+namespace qv {
+namespace {
+
+std::vector<std::string> keysOf(const Dictionary& d) {
+    std::vector<std::string> keys;
+    for (const auto& [key, value] : d) {
+        keys.push_back(key);
+    }
+    return keys;
+}
+
+class AnEnergyLogWorker : public ::testing::Test {
+  protected:
+    void SetUp() override {
+        QVReportingWorkerRegistry::TEST_reset(
+            {&makeWorkerClass<QVReportingSessionEnergyLogWorker>()});
+    }
+    void TearDown() override { QVReportingWorkerRegistry::TEST_reset({}); }
+
+    std::shared_ptr<QVReportingSession> make(const char* appName) {
+        auto session = QVReportingSession::initWithID(fake.platform, 7, {1234});
+        if (appName != nullptr) {
+            const Dictionary config{{"KXHostApplicationDisplayID", appName}};
+            session->updateConfigurationWithContentsOfConfiguration(&config);
+        }
+        return session;
+    }
+    static std::shared_ptr<QVReportingSessionMessage> message(
+        Dictionary payload, AudioEventType t = type::kEnergyLog,
+        AudioEventCategory c = category::kGeneric) {
+        return std::make_shared<QVReportingSessionMessage>(std::move(payload), c, t);
+    }
+    static std::vector<std::string> energyLogLines(test::MemoryLogSink& log) {
+        std::vector<std::string> lines;
+        for (const auto& line : log.lines()) {
+            if (line.category == "qvrp") {
+                EXPECT_EQ(line.level, LogLevel::Error);
+                lines.push_back(line.text.substr(line.text.find(".cpp:") + 5 + 6));
+            }
+        }
+        return lines;
+    }
+
+    test::FakePlatform fake;
+};
+
+TEST_F(AnEnergyLogWorker, RebuildsOneMessageIntoUpToThreeRecordsInAFixedOrder) {
+    test::ScopedMemoryLog log;
+    auto session = make("com.example.haptics");
+    session->setIsSingleMessageSession(true);  // it serves those too
+    session->start();
+    const Value clients = Array{"com.a", "com.b"};
+    const double stamp = fake.clock.now() - 2;
+    session->sendMessage(message({{"Haptic_Active_Hardware_Time_Seconds", 3600.5},
+                                  {"Active_Clients", clients},
+                                  {"EngineState", "EngineOn"},
+                                  {"EngineOnTime", 12.25},
+                                  {"qvreporting_timestamp", stamp}},
+                                 type::kEnergyLog, category::kPrefixHAL | category::kOutput));
+    const auto events = fake.energyLog.events();
+    ASSERT_EQ(events.size(), 3u);
+    for (const auto& e : events) {
+        EXPECT_EQ(e.registryID, 28u);
+        EXPECT_FALSE(e.options.has_value());
+    }
+    EXPECT_EQ(events[0].name, "Vantrel_Haptics_EngineOnDuration");
+    EXPECT_EQ(keysOf(events[0].payload),
+              (std::vector<std::string>{"EngineOnDuration", "ApplicationName", "TimestampEnd"}));
+    EXPECT_EQ(events[0].payload, (Dictionary{{"EngineOnDuration", 12.25},
+                                             {"ApplicationName", "com.example.haptics"},
+                                             {"TimestampEnd", stamp}}));
+    EXPECT_EQ(events[1].name, "Vantrel_Haptics_ClientStatus");
+    EXPECT_EQ(keysOf(events[1].payload),
+              (std::vector<std::string>{"Status", "ApplicationName", "TimestampEnd"}));
+    EXPECT_EQ(events[1].payload.find("Status")->kind(), Value::Kind::Int);
+    EXPECT_EQ(events[2].name, "LeakedHapticsSessionInfo");
+    EXPECT_EQ(keysOf(events[2].payload),
+              (std::vector<std::string>{"Haptic_Active_Hardware_Time_Seconds", "Active_Clients"}));
+    EXPECT_EQ(*events[2].payload.find("Active_Clients"), clients);
+
+    // None of the keys, or another type holding them all: nothing, and no log line.
+    fake.energyLog.clear();
+    session->sendMessage(message({{"EngineOnTimeX", 1}, {"enginestate", "EngineOn"}}));
+    for (AudioEventType t : {type::kGeneric, type::kIssueDetector, AudioEventType{9}}) {
+        session->sendMessage(message({{"EngineOnTime", 1},
+                                      {"EngineState", "EngineOn"},
+                                      {"Haptic_Active_Hardware_Time_Seconds", 2}},
+                                     t));
+    }
+    EXPECT_TRUE(fake.energyLog.events().empty());
+    EXPECT_TRUE(energyLogLines(*log).empty());
+}
+
+TEST_F(AnEnergyLogWorker, GivesStatusOneOnlyForTheExactStringEngineOn) {
+    auto session = make("a");
+    auto worker = QVReportingSessionEnergyLogWorker::initWithSession(session);
+    for (const auto& [state, status] : std::vector<std::pair<Value, int>>{{"EngineOn", 1},
+                                                                          {"engineon", 0},
+                                                                          {"EngineOn ", 0},
+                                                                          {"EngineOff", 0},
+                                                                          {1, 0},
+                                                                          {true, 0},
+                                                                          {std::nan(""), 0},
+                                                                          {Array{"EngineOn"}, 0}}) {
+        fake.energyLog.clear();
+        worker->handleMessage(message({{"EngineState", state}}));
+        const auto events = fake.energyLog.events();
+        ASSERT_EQ(events.size(), 1u) << state.description();
+        EXPECT_EQ(*events[0].payload.find("Status"), Value(status)) << state.description();
+    }
+}
+
+TEST_F(AnEnergyLogWorker, TreatsAMissingOrUnknownAppNameAndTimestampDifferentlyPerRecord) {
+    struct Case {
+        const char* what;
+        const char* configuredName;  // null: none configured
+        bool sessionGone;
+        const char* clientStatusName;  // ApplicationName of the ClientStatus record; null: none
+    };
+    for (const auto& c : std::vector<Case>{{"no name configured", nullptr, false, "Unknown"},
+                                           {"the name Unknown", "Unknown", false, "Unknown"},
+                                           {"session gone", "com.example", true, nullptr}}) {
+        test::ScopedMemoryLog log;
+        fake.energyLog.clear();
+        auto session = make(c.configuredName);
+        auto worker = QVReportingSessionEnergyLogWorker::initWithSession(session);
+        if (c.sessionGone) {
+            session.reset();
+        }
+        // No timestamp: only the engine-on-duration handler says so. Values go out as they are;
+        // a null value is no value.
+        const Value onTime = Dictionary{{"odd", "but copied"}};
+        worker->handleMessage(message({{"EngineOnTime", onTime},
+                                       {"EngineState", "EngineOff"},
+                                       {"Haptic_Active_Hardware_Time_Seconds", nullptr}}));
+        const auto events = fake.energyLog.events();
+        ASSERT_EQ(events.size(), 2u) << c.what;
+        EXPECT_EQ(events[0].payload, (Dictionary{{"EngineOnDuration", onTime}})) << c.what;
+        Dictionary status{{"Status", 0}};
+        if (c.clientStatusName != nullptr) {
+            status.set("ApplicationName", c.clientStatusName);
+        }
+        EXPECT_EQ(events[1].payload, status) << c.what;
+        EXPECT_EQ(energyLogLines(*log),
+                  (std::vector<std::string>{"failed to get app name for energylog",
+                                            "failed to get QVReporting timestamp for energylog"}))
+            << c.what;
+    }
+}
+
+}  // namespace
+}  // namespace qv

@@ -1,0 +1,164 @@
+#include "workers/backends/QVReportingSessionMTXWorker.h"
+
+#include <gtest/gtest.h>
+
+#include <cmath>
+#include <cstdint>
+#include <limits>
+#include <string>
+#include <vector>
+
+#include "fakes/FakePlatform.h"
+#include "fakes/MemoryLogSink.h"
+#include "session/QVReportingSession.h"
+#include "session/QVReportingWorkerRegistry.h"
+#include "workers/backends/mtx/AudioIssueDetected.h"
+
+namespace qv {
+namespace {
+
+using namespace std::string_literals;
+using mtxmetrics::AudioIssueDetected;
+
+class AnMTXWorker : public ::testing::Test {
+  protected:
+    void SetUp() override {
+        QVReportingWorkerRegistry::TEST_reset({&makeWorkerClass<QVReportingSessionMTXWorker>()});
+        session = QVReportingSession::initWithID(fake.platform, 7, {1234});
+        worker = QVReportingSessionMTXWorker::initWithSession(session);
+    }
+    void TearDown() override { QVReportingWorkerRegistry::TEST_reset({}); }
+
+    static std::shared_ptr<QVReportingSessionMessage> message(
+        Dictionary payload, AudioEventType t = type::kIssueDetector,
+        AudioEventCategory c = category::kIO) {
+        return std::make_shared<QVReportingSessionMessage>(std::move(payload), c, t);
+    }
+    // The one record posted since the last call, read back from its wire bytes.
+    AudioIssueDetected posted() {
+        const auto all = fake.mtx.posted();
+        fake.mtx.clear();
+        AudioIssueDetected record;
+        EXPECT_EQ(all.size(), 1u);
+        if (all.size() == 1) {
+            mtxmetrics::Reader reader(all[0].wire);
+            EXPECT_TRUE(record.readFrom(reader));
+        }
+        return record;
+    }
+
+    test::FakePlatform fake;
+    std::shared_ptr<QVReportingSession> session;
+    std::shared_ptr<QVReportingSessionMTXWorker> worker;
+};
+
+TEST_F(AnMTXWorker, PostsOneRecordPerIssueDetectorMessageOfAnyCategory) {
+    session->setIsSingleMessageSession(true);  // it serves those too
+    session->start();
+    session->sendMessage(message({{"issue_type", "dropout"},
+                                  {"node", 12},
+                                  {"rtaid_client", "com.example"},
+                                  {"any_channel_silence_seconds", 5}},
+                                 type::kIssueDetector, category::kPrefixHAL | category::kOutput));
+    const auto all = fake.mtx.posted();
+    ASSERT_EQ(all.size(), 1u);
+    EXPECT_EQ(all[0].metricID, 5963779u);
+    EXPECT_EQ(all[0].wire,
+              "\x10\x05\x1a\x07"
+              "dropout\x22\x02"
+              "12\x2a\x0b"
+              "com.example"s)
+        << "fields 2 to 5 in order, no field 1";
+    fake.mtx.clear();
+
+    for (AudioEventType t :
+         {type::kGeneric, type::kError, type::kEnergyLog, AudioEventType{0xFFFF}}) {
+        session->sendMessage(message({{"issue_type", "x"}, {"t", t}}, t, category::kError));
+    }
+    worker->handleMessage(nullptr);
+    EXPECT_TRUE(fake.mtx.posted().empty());
+}
+
+TEST_F(AnMTXWorker, LogsEachMissingKeyInOrderAndPostsWhatItFound) {
+    test::ScopedMemoryLog log;
+    worker->handleMessage(message({}));
+    EXPECT_EQ(posted(), AudioIssueDetected{});
+    std::vector<std::string> lines;
+    for (const auto& line : log->lines()) {
+        ASSERT_EQ(line.category, "qvra");
+        EXPECT_EQ(line.level, LogLevel::Error);
+        // After "%25s:%-5d ": the file name, a colon, the line number in 5 columns, a blank.
+        lines.push_back(line.text.substr(line.text.find(".cpp:") + 5 + 6));
+    }
+    EXPECT_EQ(lines, (std::vector<std::string>{
+                         "Failed to get issue_type for AudioIssueDetected",
+                         "Failed to get rtaid_client for AudioIssueDetected",
+                         "Failed to get node for AudioIssueDetected",
+                         "Failed to get any_channel_silence_seconds for AudioIssueDetected"}));
+
+    // A null value counts as missing; the fields found still go out, even with the session gone.
+    log->clear();
+    session.reset();
+    worker->handleMessage(message({{"issue_type", "x"}, {"node", nullptr}}));
+    EXPECT_EQ(posted().issuetype, "x");
+    EXPECT_TRUE(log->contains("Failed to get node for AudioIssueDetected"));
+    EXPECT_FALSE(log->contains("Failed to get issue_type"));
+}
+
+TEST_F(AnMTXWorker, StoresTheTextOfAnyValueAndTheIntegerValueCutTo32Bits) {
+    const std::vector<std::pair<Value, std::string>> texts = {
+        {12, "12"},
+        {std::numeric_limits<std::uint64_t>::max(), "18446744073709551615"},
+        {2.5, "2.5"},
+        {std::nan(""), "nan"},
+        {true, "1"},
+        {Date{0}, "1970-01-01 00:00:00 +0000"},
+        {Array{1, "a b"}, "(\n    1,\n    \"a b\"\n)"},
+        {Dictionary{{"k", 1}}, "{\n    k = 1;\n}"},
+        {"ab\0cd"s, "ab"},       // a NUL-terminated string ends at its first NUL
+        {"bad \xff utf-8", ""},  // no byte-string form: stored empty
+    };
+    for (const auto& [value, text] : texts) {
+        worker->handleMessage(
+            message({{"issue_type", value}, {"rtaid_client", value}, {"node", value}}));
+        const auto record = posted();
+        EXPECT_EQ(record.issuetype, text) << value.description();
+        EXPECT_EQ(record.rtaidclient, text) << value.description();
+        EXPECT_EQ(record.node, text) << value.description();
+    }
+
+    const double inf = std::numeric_limits<double>::infinity();
+    const std::vector<std::pair<Value, std::int32_t>> durations = {
+        {-1, -1},
+        {std::int64_t{4294967301}, 5},
+        {std::int64_t{2147483648}, std::numeric_limits<std::int32_t>::min()},
+        {std::uint64_t{4294967303}, 7},
+        {std::numeric_limits<std::uint64_t>::max(), -1},
+        {-5.9, -5},
+        {std::nan(""), 0},
+        {inf, -1},  // saturates at INT64_MAX, whose low 32 bits are all ones
+        {-inf, 0},  // INT64_MIN
+        {true, 1},
+        {"  -3.9s", -3},
+        {"+4294967297", 1},
+        {"99999999999999999999", -1},
+        {"-99999999999999999999", 0},
+        {"abc", 0},
+        {"- 1", 0},
+        {Date{1000}, 0},
+        {Array{5}, 0},
+        {Dictionary{{"a", 5}}, 0},
+    };
+    for (const auto& [value, duration] : durations) {
+        EXPECT_EQ(QVReportingSessionMTXWorker::durationFromValue(value), duration)
+            << value.description();
+    }
+    // Through the worker, a negative duration goes out as a ten-byte varint.
+    worker->handleMessage(message({{"any_channel_silence_seconds", -2.5}}));
+    EXPECT_EQ(fake.mtx.posted().at(0).wire.substr(0, 11),
+              "\x10\xfe\xff\xff\xff\xff\xff\xff\xff\xff\x01"s);
+    EXPECT_EQ(posted().duration, -2);
+}
+
+}  // namespace
+}  // namespace qv
