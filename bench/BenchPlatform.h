@@ -16,6 +16,7 @@
 #include "platform/linux/LinuxPreferenceStore.h"
 #include "platform/linux/LinuxProcessInfo.h"
 #include "platform/linux/LinuxSystemCondition.h"
+#include "platform/linux/LinuxTaskExecutor.h"
 #include "session/QVReportingLog.h"
 
 namespace qv::bench {
@@ -41,8 +42,9 @@ struct BenchPlatform {
     LinuxConvoService convo{preferences, std::make_unique<JsonlSink>(
                                              stateDir, std::string(LinuxConvoService::kSinkName),
                                              clock, SinkCallbacks{})};
+    LinuxTaskExecutor executor;
     Platform platform{clock,     device, process, preferences, notifications, *analytics.service,
-                      condition, convo};
+                      condition, convo,  executor};
 };
 
 }  // namespace qv::bench

@@ -13,6 +13,7 @@ class NotificationCenter;
 class PreferenceStore;
 class ProcessInfo;
 class SystemCondition;
+class TaskExecutor;
 
 struct Platform {
     Clock& clock;
@@ -23,6 +24,7 @@ struct Platform {
     AnalyticsService& analytics;
     SystemCondition& condition;
     ConvoService& convo;
+    TaskExecutor& executor;
 };
 
 }  // namespace qv

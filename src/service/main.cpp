@@ -22,6 +22,7 @@
 #include "platform/linux/LinuxPreferenceStore.h"
 #include "platform/linux/LinuxProcessInfo.h"
 #include "platform/linux/LinuxSystemCondition.h"
+#include "platform/linux/LinuxTaskExecutor.h"
 #include "service/QVReportingDBusServer.h"
 #include "service/QVReportingDaemonOptions.h"
 #include "service/QVReportingService.h"
@@ -54,6 +55,10 @@ std::unique_ptr<sdbus::IConnection> connectTo(const std::string& bus) {
 // arenas. Once this much lies free, it is handed back to the system, so that the daemon's
 // footprint follows its load instead of its busiest moment.
 constexpr std::size_t kFreeBytesWorthReturning = 1u << 20;
+
+// How long a stop waits for the pool's work: the longest wait a worker starts there (the Convo
+// worker's 9 s for backends) with a margin, inside the 10 s a stop may take.
+constexpr std::chrono::milliseconds kPoolDrainTimeout{9500};
 
 void returnFreeMemory() {
     if (mallinfo2().fordblks > kFreeBytesWorthReturning) {
@@ -116,8 +121,10 @@ int main(int argc, char** argv) {
         preferences,
         std::make_unique<JsonlSink>(options->stateDir, std::string(LinuxConvoService::kSinkName),
                                     clock, sinkCallbacks));
-    const Platform platform{
-        clock, device, process, preferences, notifications, *analytics.service, condition, convo};
+    LinuxTaskExecutor executor;
+    const Platform platform{clock,       device,        process,
+                            preferences, notifications, *analytics.service,
+                            condition,   convo,         executor};
 
     QVReportingWorkerRegistry::setAllWorkerClasses(QVReportingAllWorkerClasses());
     SerialQueue& queue = QVReportingUtilityGetReportingServerQueue();
@@ -145,6 +152,12 @@ int main(int argc, char** argv) {
     service.stopAllSessions();
     server->flush();
     server.reset();
+    // Work the sessions left on the pool (the Convo summaries and flushes) goes into the sinks
+    // before they are flushed; a Convo wait for backends ends within its 9 s.
+    if (!executor.waitUntilIdle(kPoolDrainTimeout)) {
+        QVLOG_ERROR(logCategory(), "background work still running after {} s; leaving anyway",
+                    std::chrono::duration<double>(kPoolDrainTimeout).count());
+    }
     analytics.service->flush();
     convo.flush();
     QVReportingSystemMonitor::reset();

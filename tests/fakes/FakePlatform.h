@@ -5,6 +5,7 @@
 #include "fakes/FakeConvoService.h"
 #include "fakes/FakeDeviceInformation.h"
 #include "fakes/FakeServices.h"
+#include "fakes/FakeTaskExecutor.h"
 #include "platform/Platform.h"
 
 namespace qv::test {
@@ -14,14 +15,20 @@ struct FakePlatform {
     struct Replacements {
         AnalyticsService* analytics = nullptr;
         ConvoService* convo = nullptr;
+        TaskExecutor* executor = nullptr;
     };
 
     // The fakes' platform with some services replaced, for a test that brings its own.
     Platform with(const Replacements& r) {
-        return Platform{clock,         device,
-                        process,       preferences,
-                        notifications, r.analytics ? *r.analytics : analytics,
-                        condition,     r.convo ? *r.convo : convo};
+        return Platform{clock,
+                        device,
+                        process,
+                        preferences,
+                        notifications,
+                        r.analytics ? *r.analytics : analytics,
+                        condition,
+                        r.convo ? *r.convo : convo,
+                        r.executor ? *r.executor : executor};
     }
 
     FakeClock clock;
@@ -32,6 +39,7 @@ struct FakePlatform {
     FakeAnalyticsService analytics;
     FakeSystemCondition condition;
     FakeConvoService convo;
+    FakeTaskExecutor executor{clock};
     Platform platform = with({});
 };
 
