@@ -1,6 +1,7 @@
 #include "workers/QVReportingWorkerClasses.h"
 
 #include "monitoring/QVReportingSessionSystemMonitorWorker.h"
+#include "workers/backends/QVReportingSessionConvoWorker.h"
 #include "workers/backends/QVReportingSessionMetricsHubWorker.h"
 #include "workers/derived/QVReportingSessionInputMessagesWorker.h"
 #include "workers/derived/QVReportingSessionOrbitMessagesWorker.h"
@@ -22,6 +23,7 @@ QVReportingWorkerRegistry::ClassList QVReportingAllWorkerClasses() {
         &makeWorkerClass<QVReportingSessionMetricsHubWorker>(),
         &makeWorkerClass<QVReportingSessionSystemMonitorWorker>(),
         &makeWorkerClass<QVReportingSessionSummaryJsonFileWorker>(),
+        &makeWorkerClass<QVReportingSessionConvoWorker>(),
     };
 }
 
