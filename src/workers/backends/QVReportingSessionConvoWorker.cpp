@@ -4,8 +4,6 @@
 
 #include <algorithm>
 #include <cstdlib>
-#include <iterator>
-#include <unordered_map>
 #include <utility>
 
 #include "platform/ConvoService.h"
@@ -30,6 +28,9 @@ constexpr std::string_view kForwardTask =
 constexpr std::string_view kSendMessage = "-[QVReportingSessionConvoWorker _sendMessage:]";
 constexpr std::string_view kStopTask = "-[QVReportingSessionConvoWorker stop]_block_invoke";
 
+// Room left in a forwarded message's payload, as in every message, for keys stamped later.
+constexpr std::size_t kStampedKeyRoom = 4;
+
 // The sink a message dropped before it reached the Convo service is counted against.
 constexpr std::string_view kConvoSinkName = "convo";
 
@@ -38,32 +39,6 @@ float clientVersion() {
     static const float version =
         std::strtof(std::string(QVReportingVersionNumber).c_str(), nullptr);
     return version;
-}
-
-// Appends what "%@" prints for v: a string as it is, anything else by its description. The
-// scalar kinds are written in place (the summary of a long session prints millions of them);
-// they print exactly as Value::description() does.
-void appendDescription(std::string& out, const Value& v) {
-    switch (v.kind()) {
-        case Value::Kind::String:
-            out += *v.asString();
-            return;
-        case Value::Kind::Int:
-            fmt::format_to(std::back_inserter(out), "{}", *v.asInt64());
-            return;
-        case Value::Kind::UInt:
-            fmt::format_to(std::back_inserter(out), "{}", *v.asUInt64());
-            return;
-        case Value::Kind::Double:
-            fmt::format_to(std::back_inserter(out), "{}", *v.asDouble());
-            return;
-        case Value::Kind::Bool:
-            out += v.boolValue() ? '1' : '0';
-            return;
-        default:
-            out += v.description();
-            return;
-    }
 }
 
 std::string describeBackends(const std::vector<std::string>& backends) {
@@ -144,45 +119,42 @@ void QVReportingSessionConvoWorker::handleMessage(
     if (!message) {
         return;
     }
-    auto copy = std::make_shared<QVReportingSessionMessage>(message->message(), message->category(),
-                                                            message->type());
     const bool queued = convoReportingQueue().tryAsync(
-        [self = shared_from_this(), copy = std::move(copy)] { self->forwardTask(*copy); });
+        [self = shared_from_this(), copy = FrozenPayload(message->message()),
+         category = message->category(),
+         type = message->type()] { self->forwardTask(copy, category, type); });
     if (!queued) {
         QVReportingStats::shared().noteSinkLineLost(kConvoSinkName);
     }
 }
 
 void QVReportingSessionConvoWorker::stop() {
-    // The session empties its list after its workers stop, and later workers may still write the
-    // stored messages, so the summary works on copies taken now. Messages the summary skips
-    // (redundant, not sent while the session ran, or addressed only to other workers) are left
-    // out of the copy; an empty list is told apart, as it sends no summary at all.
-    std::vector<Dictionary> kept;
+    // The session empties its list once its workers have stopped, and workers that stop later may
+    // still write the stored messages, so the summary is made of copies taken now: the values of
+    // the messages it folds in (not redundant, sent while the session ran, and not addressed only
+    // to other workers). An empty list is told apart, as it sends no summary at all.
+    const auto owner = session();
+    QVReportingConvoSessionSummary summary(owner ? owner->serviceType() : service::kUnknown);
     bool listWasEmpty = true;
-    AudioServiceType serviceType = service::kUnknown;
     ReporterID reporterID = 0;
-    if (const auto owner = session()) {
+    if (owner) {
         const QVReportingWorkerClass* const self =
             &makeWorkerClass<QVReportingSessionConvoWorker>();
-        const auto& messages = owner->messages();
-        listWasEmpty = messages.empty();
-        kept.reserve(messages.size());
-        for (const auto& m : messages) {
+        listWasEmpty = owner->messages().empty();
+        reporterID = owner->reporterID();
+        for (const auto& m : owner->messages()) {
             const auto& destinations = m->destinationWorkers();
             if (m->isRedundant() || !m->isSessionStarted() ||
                 (!destinations.empty() &&
                  std::find(destinations.begin(), destinations.end(), self) == destinations.end())) {
                 continue;
             }
-            kept.push_back(m->message());
+            summary.add(m->message());
         }
-        serviceType = owner->serviceType();
-        reporterID = owner->reporterID();
     }
     convoReportingQueue().async(
-        [self = shared_from_this(), kept = std::move(kept), listWasEmpty, serviceType, reporterID] {
-            self->stopTask(kept, listWasEmpty, serviceType, reporterID);
+        [self = shared_from_this(), summary = std::move(summary), listWasEmpty, reporterID] {
+            self->stopTask(summary, listWasEmpty, reporterID);
         });
 }
 
@@ -268,8 +240,10 @@ void QVReportingSessionConvoWorker::finishBackendWait(bool signalled) {
     convoReportingAgentToken_.reset();
 }
 
-void QVReportingSessionConvoWorker::forwardTask(QVReportingSessionMessage& message) {
+void QVReportingSessionConvoWorker::forwardTask(const FrozenPayload& payload,
+                                                AudioEventCategory category, AudioEventType type) {
     if (backend_->convoReportingSessionStarted.load()) {
+        QVReportingSessionMessage message(payload.thaw(kStampedKeyRoom), category, type);
         _sendMessage(message);
     } else {
         QVLOG_DEFAULT(logCategory(), "Session never started. {}", kForwardTask);
@@ -298,23 +272,23 @@ void QVReportingSessionConvoWorker::_sendMessage(QVReportingSessionMessage& mess
     }
 }
 
-void QVReportingSessionConvoWorker::stopTask(const std::vector<Dictionary>& kept, bool listWasEmpty,
-                                             AudioServiceType serviceType, ReporterID reporterID) {
+void QVReportingSessionConvoWorker::stopTask(const QVReportingConvoSessionSummary& summary,
+                                             bool listWasEmpty, ReporterID reporterID) {
     const auto& log = logCategory();
     if (!backend_->convoReportingSessionStarted.load()) {
         QVLOG_DEFAULT(log, "Session never started. {}", kStopTask);
         return;
     }
     if (!listWasEmpty) {
-        Dictionary summary = summaryPayload(kept, serviceType);
+        Dictionary payload = summary.joined();
         QVLOG_DEFAULT(log, "sending convo summary event. reporterID={}", reporterID);
         if (logEnabled(LogLevel::Debug)) {
-            for (const auto& [key, joined] : summary) {
+            for (const auto& [key, joined] : payload) {
                 QVLOG_DEBUG(log, "sending convo summary event. reporterID={} {}=\"{}\"", reporterID,
                             key, *joined.asString());
             }
         }
-        QVReportingSessionMessage event(std::move(summary), category::kUnknown, type::kUnknown);
+        QVReportingSessionMessage event(std::move(payload), category::kUnknown, type::kUnknown);
         _sendMessage(event);
     }
     QVLOG_DEBUG(log, "entering convoreporting {}", kStopTask);
@@ -325,57 +299,6 @@ void QVReportingSessionConvoWorker::stopTask(const std::vector<Dictionary>& kept
     convoReportingAgentToken_.reset();
     backend_->convoReportingSessionStarted.store(false);
     QVLOG_DEBUG(log, "stopping and setting session to nil");
-}
-
-Dictionary QVReportingSessionConvoWorker::summaryPayload(const std::vector<Dictionary>& kept,
-                                                         AudioServiceType serviceType) {
-    // One column per key, in the order keys first appear; each holds its values' texts already
-    // joined, and how many there are. Messages of one kind list their keys in the same order, so
-    // the column of the key at the same place in the previous message is tried before the index.
-    struct Column {
-        std::string_view key;
-        std::string joined;
-        std::size_t count = 0;
-    };
-    std::vector<Column> columns;
-    std::unordered_map<std::string_view, std::size_t> index;
-    columns.push_back({kSummaryEventKey, fmt::to_string(serviceType), 1});
-    index.emplace(kSummaryEventKey, 0);
-    std::vector<std::size_t> byPosition;
-
-    for (const Dictionary& payload : kept) {
-        std::size_t position = 0;
-        for (const auto& [key, value] : payload) {
-            std::size_t at;
-            if (position < byPosition.size() && columns[byPosition[position]].key == key) {
-                at = byPosition[position];
-            } else {
-                const auto [it, added] = index.try_emplace(key, columns.size());
-                if (added) {
-                    columns.push_back({key, {}, 0});
-                }
-                at = it->second;
-                if (position < byPosition.size()) {
-                    byPosition[position] = at;
-                } else {
-                    byPosition.push_back(at);
-                }
-            }
-            Column& column = columns[at];
-            if (column.count++ > 0) {
-                column.joined += ',';
-            }
-            appendDescription(column.joined, value);
-            ++position;
-        }
-    }
-
-    Dictionary summary;
-    summary.reserve(columns.size());
-    for (Column& column : columns) {
-        summary.set(column.key, std::move(column.joined));
-    }
-    return summary;
 }
 
 }  // namespace qv

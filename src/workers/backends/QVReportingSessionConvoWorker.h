@@ -16,10 +16,11 @@
 // sent in order afterwards, exactly as if the queue's thread had blocked, while no thread, no
 // other session and never the reporting server queue waits with it.
 //
-// Memory. A message held for the Convo queue is a copy of its top level (nested containers are
-// shared). At most kMaxHeldMessages wait at a time; a message beyond that is dropped and counted
-// as a line lost to the "convo" sink (QVReportingStats), so a flood during a wait cannot grow a
-// session without bound. Start and stop tasks are never dropped.
+// Memory. A message held for the Convo queue is a copy of its top level (a FrozenPayload: two
+// allocations, nested containers shared), taken on the session's queue. At most kMaxHeldMessages
+// wait at a time; a message beyond that is dropped and counted as a line lost to the "convo" sink
+// (QVReportingStats), so a flood during a wait cannot grow a session without bound. Start and stop
+// tasks are never dropped.
 //
 // Lifetime. Queued tasks hold the worker, so a session destroyed while its Convo queue is busy or
 // waiting still has its messages dropped or sent, its summary sent and its Convo session flushed.
@@ -45,7 +46,9 @@
 #include "session/PooledSerialQueue.h"
 #include "session/QVReportingSessionWorker.h"
 #include "session/QVReportingVocabulary.h"
+#include "values/FrozenPayload.h"
 #include "values/Value.h"
+#include "workers/backends/QVReportingConvoSessionSummary.h"
 
 namespace qv {
 
@@ -69,7 +72,6 @@ class QVReportingSessionConvoWorker final
     static constexpr std::size_t kMaxHeldMessages = 16384;
     // The Convo service's client type number for this daemon.
     static constexpr std::int64_t kClientType = 19;
-    static constexpr std::string_view kSummaryEventKey = "QV_Session_Summary_Event";
     static constexpr std::string_view kUserInfoSessionIDKey = "QVReportingSessionID";
 
     static bool handleSingleMessageSession() { return true; }
@@ -118,17 +120,13 @@ class QVReportingSessionConvoWorker final
     // The tasks of the Convo queue.
     void startTask(const StartArguments& arguments);
     void finishBackendWait(bool signalled);
-    void forwardTask(QVReportingSessionMessage& message);
-    // kept: copies of the payloads the summary folds in; listWasEmpty: the session held no
+    void forwardTask(const FrozenPayload& payload, AudioEventCategory category,
+                     AudioEventType type);
+    // summary: the kept messages' values, copied at stop; listWasEmpty: the session held no
     // message at all (then no summary is sent).
-    void stopTask(const std::vector<Dictionary>& kept, bool listWasEmpty,
-                  AudioServiceType serviceType, ReporterID reporterID);
+    void stopTask(const QVReportingConvoSessionSummary& summary, bool listWasEmpty,
+                  ReporterID reporterID);
     void _sendMessage(QVReportingSessionMessage& message);
-
-    // The summary event's payload: "QV_Session_Summary_Event" = the service type, then every key
-    // of the kept messages with its values joined by ",".
-    static Dictionary summaryPayload(const std::vector<Dictionary>& kept,
-                                     AudioServiceType serviceType);
 
     ConvoService& convo_;
     TaskExecutor& executor_;
