@@ -128,7 +128,9 @@ void LinuxTaskExecutor::run() {
             wake_.wait(lock);
             continue;
         } else {
-            wake_.wait_until(lock, timers_.begin()->first.first);
+            // A copy: the timer may be cancelled, and its node freed, while this thread waits.
+            const TimePoint due = timers_.begin()->first.first;
+            wake_.wait_until(lock, due);
             continue;
         }
         ++running_;
