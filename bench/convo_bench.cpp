@@ -10,12 +10,17 @@
 //   consumer. Only the calling thread is timed; the pool, the Convo service and the sinks work
 //   on their own threads meanwhile, as in the daemon, and drop what they cannot keep up with
 //   (counted, reported as convo_lost / analytics_lost).
-// - BM_ConvoStopSummary/<n>: stop of a session of n messages with the Convo worker alone, from
+// - BM_ConvoStopSummary/<n>/1: stop of a session of n messages with the Convo worker alone, from
 //   the stop call until the pool is idle again: the copy taken on the server queue, the summary
 //   built, sent and flushed on the Convo queue. The fill and its forwarding are not timed.
+//   BM_ConvoStopSummary/<n>/0 is the same session without the worker: what the session's own
+//   stop costs (sorting and freeing its messages), to subtract.
+//
+// QV_ONE=1 runs each stop once (for valgrind --tool=callgrind).
 #include <benchmark/benchmark.h>
 
 #include <chrono>
+#include <cstdlib>
 #include <memory>
 #include <string>
 
@@ -111,7 +116,12 @@ BENCHMARK(BM_Intake)->Arg(0)->Arg(1)->Iterations(200000)->Repetitions(3)->Unit(
     benchmark::kNanosecond);
 
 void BM_ConvoStopSummary(benchmark::State& state) {
-    QVReportingWorkerRegistry::TEST_reset({&makeWorkerClass<QVReportingSessionConvoWorker>()});
+    const bool withConvo = state.range(1) == 1;
+    QVReportingWorkerRegistry::TEST_reset(
+        withConvo ? QVReportingWorkerRegistry::ClassList{&makeWorkerClass<
+                        QVReportingSessionConvoWorker>()}
+                  : QVReportingWorkerRegistry::ClassList{});
+    state.SetLabel(withConvo ? "convo" : "no worker");
     const std::int64_t n = state.range(0);
     double serverQueue = 0;  // the stop call, copy included (ms, summed)
     double convoQueue = 0;   // from its return until the pool is idle (ms, summed)
@@ -144,9 +154,11 @@ void BM_ConvoStopSummary(benchmark::State& state) {
     state.SetItemsProcessed(state.iterations() * n);
 }
 BENCHMARK(BM_ConvoStopSummary)
-    ->Arg(10000)
-    ->Arg(100000)
-    ->Iterations(getenv("QV_ONE") ? 1 : 5)
+    ->Args({10000, 0})
+    ->Args({10000, 1})
+    ->Args({100000, 0})
+    ->Args({100000, 1})
+    ->Iterations(std::getenv("QV_ONE") ? 1 : 5)
     ->Unit(benchmark::kMillisecond);
 
 }  // namespace

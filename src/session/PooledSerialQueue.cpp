@@ -1,5 +1,6 @@
 #include "session/PooledSerialQueue.h"
 
+#include <cstdint>
 #include <deque>
 #include <mutex>
 
@@ -9,12 +10,13 @@
 namespace qv {
 
 struct PooledSerialQueue::State : std::enable_shared_from_this<State> {
-    State(std::string l, TaskExecutor& e, std::size_t c)
-        : label(std::move(l)), executor(e), capacity(c) {}
+    State(std::string l, TaskExecutor& e, std::size_t c, std::chrono::nanoseconds d)
+        : label(std::move(l)), executor(e), capacity(c), gatherDelay(d) {}
 
-    // Queues task (ahead of the others when first), unless bounded and full; schedules a turn on
-    // the executor when the queue is neither running nor suspended.
-    bool enqueue(Task task, bool bounded);
+    // Queues task, unless bounded and full. Schedules a turn on the executor when the queue is
+    // neither running nor suspended: at once when urgent (or without a gathering delay), else
+    // once gatherDelay has passed or a turn's worth of tasks is waiting, whichever comes first.
+    bool enqueue(Task task, bool bounded, bool urgent);
     // Lifts the suspension with the continuation as the next task.
     void resume(Task next);
     // One turn on an executor thread.
@@ -22,15 +24,32 @@ struct PooledSerialQueue::State : std::enable_shared_from_this<State> {
     void post() {
         executor.execute([self = shared_from_this()] { self->drain(); });
     }
+    // Sets a timer that starts a turn unless one was started meanwhile (by generation).
+    void arm(std::uint64_t generation) {
+        executor.schedule(gatherDelay, [self = shared_from_this(), generation] {
+            {
+                std::lock_guard lock(self->mutex);
+                if (!self->gathering || self->gatherGeneration != generation) {
+                    return;  // a turn was started before the delay ran out
+                }
+                self->gathering = false;
+                self->scheduled = true;
+            }
+            self->drain();
+        });
+    }
 
     const std::string label;
     TaskExecutor& executor;
     const std::size_t capacity;
+    const std::chrono::nanoseconds gatherDelay;
     mutable std::mutex mutex;
-    std::deque<Task> tasks;  // guarded by mutex
-    Task next;               // guarded by mutex; a wait's continuation, run before tasks
-    bool scheduled = false;  // guarded by mutex; a turn is posted or running
-    bool suspended = false;  // guarded by mutex; a wait is pending
+    std::deque<Task> tasks;              // guarded by mutex
+    Task next;                           // guarded by mutex; a wait's continuation, run first
+    bool scheduled = false;              // guarded by mutex; a turn is posted or running
+    bool suspended = false;              // guarded by mutex; a wait is pending
+    bool gathering = false;              // guarded by mutex; a timer will start the next turn
+    std::uint64_t gatherGeneration = 0;  // guarded by mutex; numbers the gathering timers
 };
 
 namespace {
@@ -40,19 +59,30 @@ thread_local const void* tCurrent = nullptr;
 
 }  // namespace
 
-bool PooledSerialQueue::State::enqueue(Task task, bool bounded) {
-    bool start;
+bool PooledSerialQueue::State::enqueue(Task task, bool bounded, bool urgent) {
+    bool start = false;
+    std::uint64_t armGeneration = 0;
     {
         std::lock_guard lock(mutex);
         if (bounded && tasks.size() >= capacity) {
             return false;
         }
         tasks.push_back(std::move(task));
-        start = !scheduled && !suspended;
-        scheduled = scheduled || start;
+        if (!scheduled && !suspended) {
+            if (urgent || gatherDelay.count() <= 0 || tasks.size() >= kTasksPerTurn) {
+                start = true;
+                scheduled = true;
+                gathering = false;  // a timer still pending finds its generation stale
+            } else if (!gathering) {
+                gathering = true;
+                armGeneration = ++gatherGeneration;
+            }
+        }
     }
     if (start) {
         post();
+    } else if (armGeneration != 0) {
+        arm(armGeneration);
     }
     return true;
 }
@@ -66,6 +96,7 @@ void PooledSerialQueue::State::resume(Task continuation) {
         // A wait that ends inside waitThen() finds its own turn still running.
         start = !scheduled;
         scheduled = true;
+        gathering = false;
     }
     if (start) {
         post();
@@ -104,19 +135,19 @@ void PooledSerialQueue::State::drain() {
 }
 
 PooledSerialQueue::PooledSerialQueue(std::string label, TaskExecutor& executor,
-                                     std::size_t capacity)
-    : state_(std::make_shared<State>(std::move(label), executor, capacity)) {}
+                                     std::size_t capacity, std::chrono::nanoseconds gatherDelay)
+    : state_(std::make_shared<State>(std::move(label), executor, capacity, gatherDelay)) {}
 
 const std::string& PooledSerialQueue::label() const {
     return state_->label;
 }
 
 void PooledSerialQueue::async(Task task) {
-    state_->enqueue(std::move(task), /*bounded=*/false);
+    state_->enqueue(std::move(task), /*bounded=*/false, /*urgent=*/true);
 }
 
 bool PooledSerialQueue::tryAsync(Task task) {
-    return state_->enqueue(std::move(task), /*bounded=*/true);
+    return state_->enqueue(std::move(task), /*bounded=*/true, /*urgent=*/false);
 }
 
 void PooledSerialQueue::waitThen(const AsyncSemaphore& semaphore, std::chrono::nanoseconds timeout,

@@ -13,6 +13,12 @@
 // Fairness. A queue with a long backlog hands its thread back to the executor after
 // kTasksPerTurn tasks, so one session's burst cannot starve the others.
 //
+// Gathering. A queue may be given a gathering delay for its tryAsync() tasks: an idle queue then
+// waits that long (or until kTasksPerTurn tasks are waiting) before it asks the executor for a
+// thread, so a steady stream of small tasks wakes the pool once per batch instead of once per
+// task. async() tasks and the end of a wait start a turn at once, running whatever was gathered
+// before them first: the order never changes.
+//
 // Memory. tryAsync() refuses a task once `capacity` tasks are waiting; the caller decides what a
 // refusal means (the Convo worker drops the message and counts it). async() always takes the
 // task: it is for the few control tasks whose number follows the client's calls.
@@ -45,8 +51,10 @@ class PooledSerialQueue {
     // Tasks a queue runs before it gives its thread back to the executor.
     static constexpr std::size_t kTasksPerTurn = 64;
 
-    // executor must outlive every task of the queue.
-    PooledSerialQueue(std::string label, TaskExecutor& executor, std::size_t capacity = kUnbounded);
+    // executor must outlive every task of the queue. gatherDelay: see Gathering above (zero: a
+    // turn starts as soon as there is a task).
+    PooledSerialQueue(std::string label, TaskExecutor& executor, std::size_t capacity = kUnbounded,
+                      std::chrono::nanoseconds gatherDelay = std::chrono::nanoseconds(0));
 
     PooledSerialQueue(const PooledSerialQueue&) = delete;
     PooledSerialQueue& operator=(const PooledSerialQueue&) = delete;
@@ -56,7 +64,7 @@ class PooledSerialQueue {
     // Posts a task; it runs after every task posted before it.
     void async(Task task);
     // Posts a task unless `capacity` tasks are already waiting; false when refused (the task is
-    // destroyed unrun).
+    // destroyed unrun). It may be gathered with the next ones before it runs.
     bool tryAsync(Task task);
 
     // From a task running on this queue: once that task returns, the queue runs nothing until the

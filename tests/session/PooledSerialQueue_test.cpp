@@ -119,6 +119,34 @@ TEST_F(APooledSerialQueue, BoundsTryAsyncButNotAsyncAndSharesThePoolFairly) {
     EXPECT_EQ(ran.back(), "y");
 }
 
+TEST_F(APooledSerialQueue, GathersTryAsyncTasksUntilTheDelayATurnsWorthOrAnAsyncTask) {
+    PooledSerialQueue queue("gathering", executor, PooledSerialQueue::kUnbounded, milliseconds(5));
+    queue.tryAsync(note("a"));
+    clock.advance(0.004);
+    executor.runUntilIdle();
+    EXPECT_TRUE(ran.empty());
+    clock.advance(0.001);
+    executor.runUntilIdle();
+    EXPECT_EQ(ran, (std::vector<std::string>{"a"}));
+
+    // A control task goes at once, after what was gathered before it; the timer set for the
+    // gathered one finds nothing left to start.
+    queue.tryAsync(note("b"));
+    queue.async(note("c"));
+    executor.runUntilIdle();
+    EXPECT_EQ(ran, (std::vector<std::string>{"a", "b", "c"}));
+    ran.clear();
+    for (std::size_t i = 0; i < PooledSerialQueue::kTasksPerTurn; ++i) {
+        queue.tryAsync(note("n"));
+    }
+    executor.runUntilIdle();
+    EXPECT_EQ(ran.size(), PooledSerialQueue::kTasksPerTurn) << "a turn's worth goes at once";
+    clock.advance(1);
+    executor.runUntilIdle();
+    EXPECT_EQ(ran.size(), PooledSerialQueue::kTasksPerTurn);
+    EXPECT_EQ(executor.pendingTimers(), 0u);
+}
+
 TEST_F(APooledSerialQueue, RunsItsTasksAfterItsOwnerLetGoEvenWhileWaiting) {
     auto owned = std::make_shared<int>(7);
     std::weak_ptr<int> watch = owned;

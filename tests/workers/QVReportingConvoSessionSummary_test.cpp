@@ -7,7 +7,7 @@
 #include <string>
 #include <vector>
 
-#include "values/FrozenPayload.h"
+#include "values/FrozenPayloads.h"
 
 namespace qv {
 namespace {
@@ -37,6 +37,12 @@ TEST(AConvoSessionSummary, JoinsEachKeysValuesInMessageOrderWithKeysInOrderOfFir
     EXPECT_EQ(text(d, "a"), "1,2,3");
     EXPECT_EQ(text(d, "b"), "x,y z") << "strings as they are, blanks included";
     EXPECT_EQ(text(d, "c"), "1");
+
+    // A key left out entirely: no column, and the others keep theirs.
+    QVReportingConvoSessionSummary untimed(service::kGeneric, "t");
+    untimed.add({{"t", 1.5}, {"a", 1}});
+    untimed.add({{"a", 2}, {"t", 2.5}});
+    EXPECT_EQ(untimed.joined(), (Dictionary{{"QV_Session_Summary_Event", "0"}, {"a", "1,2"}}));
 
     // Only the service type when nothing is folded in; the unknown type prints in decimal.
     EXPECT_EQ(QVReportingConvoSessionSummary(service::kUnknown).joined(),
@@ -79,17 +85,22 @@ TEST(AConvoSessionSummary, PrintsEveryKindOfValueAsItsDescriptionAndRepeatsOnlyE
     EXPECT_EQ(text(summary.joined(), "v"), expected);
 }
 
-TEST(AFrozenPayload, ComesBackEqualInOrderSharingNestedContainersAndBlindToLaterChanges) {
+TEST(FrozenPayloads, ComeBackEqualInOrderSharingNestedContainersAndBlindToLaterChanges) {
     const Value nested(Array{1, 2});
     Dictionary source{{"long key past the short-string size", "a string past the short size"},
                       {"n", 1.5},
                       {"", ""},
                       {"list", nested},
                       {"u", std::numeric_limits<std::uint64_t>::max()}};
-    const FrozenPayload frozen(source);
+    FrozenPayloads frozen;
+    frozen.append(Dictionary{});
+    frozen.append(source);
+    frozen.append(Dictionary{{"last", 1}});
     source.set("n", 99);
     source.set("added", true);
-    const Dictionary thawed = frozen.thaw(2);
+    ASSERT_EQ(frozen.size(), 3u);
+    EXPECT_TRUE(frozen.thaw(0).empty());
+    const Dictionary thawed = frozen.thaw(1, 2);
     EXPECT_EQ(keysOf(thawed), (std::vector<std::string>{"long key past the short-string size", "n",
                                                         "", "list", "u"}));
     EXPECT_EQ(*thawed.find("n"), Value(1.5));
@@ -97,7 +108,7 @@ TEST(AFrozenPayload, ComesBackEqualInOrderSharingNestedContainersAndBlindToLater
               Value("a string past the short size"));
     EXPECT_EQ(thawed.find("list")->asArray(), nested.asArray()) << "shared, not copied";
     EXPECT_EQ(thawed.find("u")->asUInt64(), std::numeric_limits<std::uint64_t>::max());
-    EXPECT_TRUE(FrozenPayload(Dictionary{}).thaw().empty());
+    EXPECT_EQ(frozen.thaw(2), (Dictionary{{"last", 1}}));
 }
 
 }  // namespace

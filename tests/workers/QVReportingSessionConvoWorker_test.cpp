@@ -56,6 +56,11 @@ class AConvoWorker : public ::testing::Test {
         return s;
     }
     void run() { fake.executor.runUntilIdle(); }
+    // Runs what is due once forwarded messages have been gathered.
+    void deliver() {
+        fake.clock.advance(std::chrono::duration<double>(Worker::kForwardingGatherDelay).count());
+        run();
+    }
     static void send(QVReportingSession& s, Dictionary payload, AudioEventCategory c = 4,
                      AudioEventType t = 18) {
         s.sendMessage(std::make_shared<QVReportingSessionMessage>(std::move(payload), c, t));
@@ -141,7 +146,14 @@ TEST_F(AConvoWorker, HoldsMessagesDuringTheWaitAndForwardsThemInOrderOnceBackend
     std::thread([&] { fake.convo.completePending(std::vector<std::string>{"jsonl", "b"}); }).join();
     EXPECT_TRUE(worker->getConvoReportingStartedState());
     run();
+    EXPECT_EQ(sent().size(), 3u) << "held messages go as soon as the wait ends";
+
+    // A live session's messages are gathered a few milliseconds, then go together.
     send(*session, {{"i", 4}}, category::kVolume, type::kState);
+    fake.clock.advance(0.004);
+    run();
+    EXPECT_EQ(sent().size(), 3u);
+    fake.clock.advance(0.001);
     run();
     const auto messages = sent();
     ASSERT_EQ(messages.size(), 4u);
@@ -166,10 +178,10 @@ TEST_F(AConvoWorker, HoldsMessagesDuringTheWaitAndForwardsThemInOrderOnceBackend
     fake.convo.holdCompletions = false;
     auto internal = started(service::kGeneric, 77);
     send(*internal, {{"i", 5}});
-    run();
+    deliver();
     fake.convo.sendError = "disk full";
     send(*internal, {{"i", 6}});
-    run();
+    deliver();
     ASSERT_EQ(sent(1).size(), 1u);
     EXPECT_TRUE(sent(1)[0].payload.contains("qvreporting_timestamp"));
     EXPECT_EQ(log->count("error sending message disk full"), 1u);

@@ -7,7 +7,9 @@
 
 namespace qv {
 
-QVReportingConvoSessionSummary::QVReportingConvoSessionSummary(AudioServiceType serviceType) {
+QVReportingConvoSessionSummary::QVReportingConvoSessionSummary(AudioServiceType serviceType,
+                                                               std::string_view omittedKey)
+    : omittedKey_(omittedKey) {
     Column& first = columns_.emplace_back();
     first.key = kSummaryEventKey;
     first.cells.push_back({Cell::Kind::UInt, 0, serviceType});
@@ -35,6 +37,10 @@ QVReportingConvoSessionSummary::Column& QVReportingConvoSessionSummary::columnFo
 void QVReportingConvoSessionSummary::add(const Dictionary& payload) {
     std::size_t position = 0;
     for (const auto& [key, value] : payload) {
+        if (!omittedKey_.empty() && key == omittedKey_) {
+            ++position;
+            continue;
+        }
         const std::size_t hint = position < byPosition_.size() ? byPosition_[position] : 0;
         Column& column = position < byPosition_.size() && columns_[hint].key == key
                              ? columns_[hint]

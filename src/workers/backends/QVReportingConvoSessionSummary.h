@@ -31,7 +31,10 @@ class QVReportingConvoSessionSummary {
   public:
     static constexpr std::string_view kSummaryEventKey = "QV_Session_Summary_Event";
 
-    explicit QVReportingConvoSessionSummary(AudioServiceType serviceType);
+    // omittedKey: a key whose values are not kept at all, for a summary that would lose its
+    // column before anyone sees it (empty: every key is kept).
+    explicit QVReportingConvoSessionSummary(AudioServiceType serviceType,
+                                            std::string_view omittedKey = {});
 
     // Appends every value of payload to its key's column, in the payload's order.
     void add(const Dictionary& payload);
@@ -57,6 +60,7 @@ class QVReportingConvoSessionSummary {
     // in its payload).
     Column& columnFor(std::string_view key, std::size_t position);
 
+    std::string omittedKey_;
     std::vector<Column> columns_;
     // Column number by key (looked up by view, without making a string).
     struct KeyHash {

@@ -76,8 +76,9 @@ std::shared_ptr<QVReportingSessionConvoWorker> QVReportingSessionConvoWorker::in
 
 PooledSerialQueue& QVReportingSessionConvoWorker::convoReportingQueue() {
     if (!convoReportingQueue_) {
-        convoReportingQueue_ = std::make_unique<PooledSerialQueue>(std::string(kQueueName),
-                                                                   executor_, kMaxHeldMessages);
+        convoReportingQueue_ = std::make_unique<PooledSerialQueue>(
+            std::string(kQueueName), executor_, PooledSerialQueue::kUnbounded,
+            kForwardingGatherDelay);
     }
     return *convoReportingQueue_;
 }
@@ -105,6 +106,7 @@ bool QVReportingSessionConvoWorker::start() {
     if (!owner || owner->serviceType() == service::kTest) {
         return false;
     }
+    outbox_.reset();  // later messages follow the start
     StartArguments arguments{owner->configuration(), owner->serviceName() + "_session",
                              owner->serviceType(), owner->reporterID(),
                              owner->isSingleMessageSession()};
@@ -119,13 +121,25 @@ void QVReportingSessionConvoWorker::handleMessage(
     if (!message) {
         return;
     }
-    const bool queued = convoReportingQueue().tryAsync(
-        [self = shared_from_this(), copy = FrozenPayload(message->message()),
-         category = message->category(),
-         type = message->type()] { self->forwardTask(copy, category, type); });
-    if (!queued) {
+    if (heldMessages_.load(std::memory_order_relaxed) >= kMaxHeldMessages) {
         QVReportingStats::shared().noteSinkLineLost(kConvoSinkName);
+        return;
     }
+    ++heldMessages_;
+    if (outbox_) {
+        std::lock_guard lock(outbox_->mutex);
+        if (!outbox_->taken) {
+            outbox_->payloads.append(message->message());
+            outbox_->kinds.emplace_back(message->category(), message->type());
+            return;
+        }
+    }
+    // No open outbox: a new one, and the task that will take it.
+    outbox_ = std::make_shared<Outbox>();
+    outbox_->payloads.append(message->message());
+    outbox_->kinds.emplace_back(message->category(), message->type());
+    convoReportingQueue().tryAsync(
+        [self = shared_from_this(), outbox = outbox_] { self->forwardTask(*outbox); });
 }
 
 void QVReportingSessionConvoWorker::stop() {
@@ -134,7 +148,12 @@ void QVReportingSessionConvoWorker::stop() {
     // the messages it folds in (not redundant, sent while the session ran, and not addressed only
     // to other workers). An empty list is told apart, as it sends no summary at all.
     const auto owner = session();
-    QVReportingConvoSessionSummary summary(owner ? owner->serviceType() : service::kUnknown);
+    // A customer build sends the summary without its time stamps: unless the debug lines show
+    // them, they are not even collected.
+    const bool timesUnseen = !internalBuild_ && !logEnabled(LogLevel::Debug);
+    QVReportingConvoSessionSummary summary(
+        owner ? owner->serviceType() : service::kUnknown,
+        timesUnseen ? QVReportingMessageKeyQVTimestamp : std::string_view());
     bool listWasEmpty = true;
     ReporterID reporterID = 0;
     if (owner) {
@@ -152,6 +171,7 @@ void QVReportingSessionConvoWorker::stop() {
             summary.add(m->message());
         }
     }
+    outbox_.reset();  // later messages follow the stop
     convoReportingQueue().async(
         [self = shared_from_this(), summary = std::move(summary), listWasEmpty, reporterID] {
             self->stopTask(summary, listWasEmpty, reporterID);
@@ -240,13 +260,24 @@ void QVReportingSessionConvoWorker::finishBackendWait(bool signalled) {
     convoReportingAgentToken_.reset();
 }
 
-void QVReportingSessionConvoWorker::forwardTask(const FrozenPayload& payload,
-                                                AudioEventCategory category, AudioEventType type) {
-    if (backend_->convoReportingSessionStarted.load()) {
-        QVReportingSessionMessage message(payload.thaw(kStampedKeyRoom), category, type);
-        _sendMessage(message);
-    } else {
-        QVLOG_DEFAULT(logCategory(), "Session never started. {}", kForwardTask);
+void QVReportingSessionConvoWorker::forwardTask(Outbox& outbox) {
+    FrozenPayloads payloads;
+    std::vector<std::pair<AudioEventCategory, AudioEventType>> kinds;
+    {
+        std::lock_guard lock(outbox.mutex);
+        outbox.taken = true;
+        payloads = std::move(outbox.payloads);
+        kinds = std::move(outbox.kinds);
+    }
+    heldMessages_ -= kinds.size();
+    for (std::size_t i = 0; i < kinds.size(); ++i) {
+        if (backend_->convoReportingSessionStarted.load()) {
+            QVReportingSessionMessage message(payloads.thaw(i, kStampedKeyRoom), kinds[i].first,
+                                              kinds[i].second);
+            _sendMessage(message);
+        } else {
+            QVLOG_DEFAULT(logCategory(), "Session never started. {}", kForwardTask);
+        }
     }
 }
 

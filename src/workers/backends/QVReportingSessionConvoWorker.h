@@ -14,13 +14,19 @@
 // completion signals the semaphore or 9 s have passed since the wait began (a timer of the
 // executor), and runs the rest of the start first. So messages sent during the wait are held and
 // sent in order afterwards, exactly as if the queue's thread had blocked, while no thread, no
-// other session and never the reporting server queue waits with it.
+// other session and never the reporting server queue waits with it. Forwarded messages are
+// gathered for up to kForwardingGatherDelay (or a turn's worth) before the pool is woken for
+// them; start and stop tasks run at once, after whatever was gathered before them.
 //
-// Memory. A message held for the Convo queue is a copy of its top level (a FrozenPayload: two
-// allocations, nested containers shared), taken on the session's queue. At most kMaxHeldMessages
-// wait at a time; a message beyond that is dropped and counted as a line lost to the "convo" sink
-// (QVReportingStats), so a flood during a wait cannot grow a session without bound. Start and stop
-// tasks are never dropped.
+// Intake. handleMessage() must cost the server queue little: a message for the Convo queue is a
+// copy of its top level appended to the worker's open outbox (FrozenPayloads: keys and texts in
+// one buffer, nested containers shared), and one Convo-queue task takes a whole outbox, so a
+// stream of messages allocates and frees in batches rather than per message. A start or stop
+// closes the open outbox before it queues its task, so messages keep their place among them.
+//
+// Memory. At most kMaxHeldMessages messages wait for the Convo queue; a message beyond that is
+// dropped and counted as a line lost to the "convo" sink (QVReportingStats), so a flood during a
+// wait cannot grow a session without bound. Start and stop tasks are never dropped.
 //
 // Lifetime. Queued tasks hold the worker, so a session destroyed while its Convo queue is busy or
 // waiting still has its messages dropped or sent, its summary sent and its Convo session flushed.
@@ -37,6 +43,7 @@
 #include <cstddef>
 #include <cstdint>
 #include <memory>
+#include <mutex>
 #include <optional>
 #include <string>
 #include <string_view>
@@ -46,7 +53,7 @@
 #include "session/PooledSerialQueue.h"
 #include "session/QVReportingSessionWorker.h"
 #include "session/QVReportingVocabulary.h"
-#include "values/FrozenPayload.h"
+#include "values/FrozenPayloads.h"
 #include "values/Value.h"
 #include "workers/backends/QVReportingConvoSessionSummary.h"
 
@@ -68,6 +75,9 @@ class QVReportingSessionConvoWorker final
     static constexpr std::string_view kQueueName = "com.korvane.qvsound.session.convoreporting";
     // How long the start waits for the service to name the backends.
     static constexpr std::chrono::nanoseconds kBackendWait{9'000'000'000};
+    // How long forwarded messages are gathered before the pool is woken for them: Convo traffic
+    // goes out in batches anyway, and a wake-up per message would cost more than the message.
+    static constexpr std::chrono::milliseconds kForwardingGatherDelay{5};
     // Messages held for the Convo queue at most (see Memory above).
     static constexpr std::size_t kMaxHeldMessages = 16384;
     // The Convo service's client type number for this daemon.
@@ -109,6 +119,14 @@ class QVReportingSessionConvoWorker final
         AsyncSemaphore convoreportingBackendSemaphore;
     };
 
+    // Messages for one forwarding task: filled on the session's queue until the task takes them.
+    struct Outbox {
+        std::mutex mutex;
+        FrozenPayloads payloads;                                           // guarded by mutex
+        std::vector<std::pair<AudioEventCategory, AudioEventType>> kinds;  // guarded by mutex
+        bool taken = false;                                                // guarded by mutex
+    };
+
     struct StartArguments {
         Dictionary configuration;
         std::string serviceSessionName;  // the service name followed by "_session"
@@ -120,8 +138,7 @@ class QVReportingSessionConvoWorker final
     // The tasks of the Convo queue.
     void startTask(const StartArguments& arguments);
     void finishBackendWait(bool signalled);
-    void forwardTask(const FrozenPayload& payload, AudioEventCategory category,
-                     AudioEventType type);
+    void forwardTask(Outbox& outbox);
     // summary: the kept messages' values, copied at stop; listWasEmpty: the session held no
     // message at all (then no summary is sent).
     void stopTask(const QVReportingConvoSessionSummary& summary, bool listWasEmpty,
@@ -134,6 +151,11 @@ class QVReportingSessionConvoWorker final
     const std::shared_ptr<Backend> backend_;
     // Made on first use, on the session's queue.
     std::unique_ptr<PooledSerialQueue> convoReportingQueue_;
+    // The outbox messages go to, until a task takes it or a start or stop closes it (session's
+    // queue only).
+    std::shared_ptr<Outbox> outbox_;
+    // Messages in outboxes not yet taken.
+    std::atomic<std::size_t> heldMessages_{0};
     // Convo queue only.
     std::shared_ptr<ConvoSession> convoReportingSession_;
     std::optional<std::string> convoReportingAgentToken_;

@@ -1,38 +1,33 @@
-#include "values/FrozenPayload.h"
+#include "values/FrozenPayloads.h"
 
 namespace qv {
 
-FrozenPayload::FrozenPayload(const Dictionary& payload) {
-    std::size_t chars = 0;
-    for (const auto& [key, value] : payload) {
-        chars += key.size();
-        if (const std::string* s = value.asString()) {
-            chars += s->size();
-        }
-    }
-    text_.reserve(chars);
-    entries_.reserve(payload.size());
+void FrozenPayloads::append(const Dictionary& payload) {
+    starts_.push_back(entries_.size());
     for (const auto& [key, value] : payload) {
         const std::string* s = value.asString();
         Entry& e =
             s ? entries_.emplace_back() : entries_.emplace_back(Entry{0, 0, 0, 0, false, value});
-        // Offsets fit 32 bits: a payload is bounded far below that on its way in.
-        e.keyBegin = static_cast<std::uint32_t>(text_.size());
+        e.keyBegin = text_.size();
         e.keyLength = static_cast<std::uint32_t>(key.size());
         text_ += key;
         if (s) {
             e.isText = true;
-            e.textBegin = static_cast<std::uint32_t>(text_.size());
+            e.textBegin = text_.size();
+            // A string is bounded far below 4 GiB on its way in.
             e.textLength = static_cast<std::uint32_t>(s->size());
             text_ += *s;
         }
     }
 }
 
-Dictionary FrozenPayload::thaw(std::size_t extra) const {
+Dictionary FrozenPayloads::thaw(std::size_t i, std::size_t extra) const {
+    const std::size_t begin = starts_[i];
+    const std::size_t end = i + 1 < starts_.size() ? starts_[i + 1] : entries_.size();
     Dictionary d;
-    d.reserve(entries_.size() + extra);
-    for (const Entry& e : entries_) {
+    d.reserve(end - begin + extra);
+    for (std::size_t n = begin; n < end; ++n) {
+        const Entry& e = entries_[n];
         const std::string_view key(text_.data() + e.keyBegin, e.keyLength);
         d.set(key, e.isText ? Value(std::string_view(text_.data() + e.textBegin, e.textLength))
                             : e.value);
