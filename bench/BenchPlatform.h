@@ -27,6 +27,7 @@
 #include "platform/linux/LinuxSpanTraceRecorder.h"
 #include "platform/linux/LinuxStatFeed.h"
 #include "platform/linux/LinuxSystemCondition.h"
+#include "platform/linux/LinuxTaskExecutor.h"
 #include "platform/linux/LinuxThreadlineModelReader.h"
 #include "session/QVReportingLog.h"
 #include "session/QVReportingStats.h"
@@ -102,6 +103,8 @@ struct BenchPlatform {
     LinuxEnergyLogService energyLog{std::make_unique<JsonlSink>(
         stateDir, std::string(LinuxEnergyLogService::kSinkName), clock, SinkCallbacks{})};
 
+    LinuxTaskExecutor executor;
+
     // Services a benchmark puts in place of the Linux ones; those left null stay.
     struct Replacements {
         DeviceInformation* device = nullptr;
@@ -122,6 +125,7 @@ struct BenchPlatform {
         ProcessLauncher* processLauncher = nullptr;
         MTXMetricsService* mtx = nullptr;
         EnergyLogService* energyLog = nullptr;
+        TaskExecutor* executor = nullptr;
     };
 
     // The platform with some services replaced, for a benchmark that brings its own.
@@ -144,7 +148,8 @@ struct BenchPlatform {
                         r.statFeed ? *r.statFeed : statFeed,
                         r.processLauncher ? *r.processLauncher : processLauncher,
                         r.mtx ? *r.mtx : mtx,
-                        r.energyLog ? *r.energyLog : energyLog};
+                        r.energyLog ? *r.energyLog : energyLog,
+                        r.executor ? *r.executor : executor};
     }
 
     Platform platform = with({});

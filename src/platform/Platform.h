@@ -24,6 +24,7 @@ class ProcessLauncher;
 class StatFeed;
 class SystemCondition;
 class ThreadlineModelReader;
+class TaskExecutor;
 
 struct Platform {
     Clock& clock;
@@ -45,6 +46,7 @@ struct Platform {
     ProcessLauncher& processLauncher;
     MTXMetricsService& mtx;
     EnergyLogService& energyLog;
+    TaskExecutor& executor;
 };
 
 }  // namespace qv

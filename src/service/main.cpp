@@ -34,6 +34,7 @@
 #include "platform/linux/LinuxSpanTraceRecorder.h"
 #include "platform/linux/LinuxStatFeed.h"
 #include "platform/linux/LinuxSystemCondition.h"
+#include "platform/linux/LinuxTaskExecutor.h"
 #include "platform/linux/LinuxThreadlineModelReader.h"
 #include "service/QVReportingDBusServer.h"
 #include "service/QVReportingDaemonOptions.h"
@@ -68,8 +69,10 @@ std::unique_ptr<sdbus::IConnection> connectTo(const std::string& bus) {
 // footprint follows its load instead of its busiest moment.
 constexpr std::size_t kFreeBytesWorthReturning = 1u << 20;
 
-// The sinks' share of the 10 seconds a stop may take.
-constexpr auto kShutdownFlushTimeout = std::chrono::seconds(5);
+// A stop has 10 seconds: the pool's work (Convo summaries and flushes) gets at most this long,
+// then the sinks get theirs.
+constexpr std::chrono::milliseconds kPoolDrainTimeout{5000};
+constexpr auto kShutdownFlushTimeout = std::chrono::seconds(4);
 
 void returnFreeMemory() {
     if (mallinfo2().fordblks > kFreeBytesWorthReturning) {
@@ -202,11 +205,13 @@ int main(int argc, char** argv) {
     LinuxEnergyLogService energyLog(std::make_unique<JsonlSink>(
         options->stateDir, std::string(LinuxEnergyLogService::kSinkName), clock, sinkCallbacks));
 
+    LinuxTaskExecutor executor;
+
     const Platform platform{
         clock,     device,     process,   preferences,  notifications,   *analytics.service,
         condition, convo,      bluetooth, issueCapture, issueFiler,      diagnostics,
         spanTrace, threadline, gaugeData, statFeed,     processLauncher, mtx,
-        energyLog};
+        energyLog, executor};
 
     QVReportingWorkerRegistry::setAllWorkerClasses(QVReportingAllWorkerClasses());
     SerialQueue& queue = QVReportingUtilityGetReportingServerQueue();
@@ -237,6 +242,12 @@ int main(int argc, char** argv) {
     // Work the bus posted before it closed (a client leaving, say) runs while the service and
     // its sessions still exist.
     queue.sync([] {});
+    // Work the sessions left on the pool (the Convo summaries and flushes) goes into the sinks
+    // before they are flushed.
+    if (!executor.waitUntilIdle(kPoolDrainTimeout)) {
+        QVLOG_ERROR(logCategory(), "background work still running after {} s; leaving anyway",
+                    std::chrono::duration<double>(kPoolDrainTimeout).count());
+    }
     JsonlSink::flushAll(std::chrono::steady_clock::now() + kShutdownFlushTimeout);
     QVReportingSystemMonitor::reset();
     QVLOG_DEFAULT(logCategory(), "stopped");

@@ -6,6 +6,7 @@
 // Workers run on the reporting server queue, like their session.
 #pragma once
 
+#include <atomic>
 #include <memory>
 
 #include "session/QVReportingSessionMessage.h"
@@ -24,8 +25,9 @@ class QVReportingSessionWorkerProtocol {
 
     std::shared_ptr<QVReportingSession> session() const { return session_.lock(); }
     void setSession(const std::weak_ptr<QVReportingSession>& session) { session_ = session; }
-    bool started() const { return started_; }
-    void setStarted(bool started) { started_ = started; }
+    // Atomic: a platform service's completion may mark a worker started from its own thread.
+    bool started() const { return started_.load(std::memory_order_relaxed); }
+    void setStarted(bool started) { started_.store(started, std::memory_order_relaxed); }
     // The class this worker was made from; set by the session when it adds the worker.
     const QVReportingWorkerClass* workerClass() const { return workerClass_; }
     void setWorkerClass(const QVReportingWorkerClass* cls) { workerClass_ = cls; }
@@ -38,7 +40,7 @@ class QVReportingSessionWorkerProtocol {
 
   private:
     std::weak_ptr<QVReportingSession> session_;
-    bool started_ = false;
+    std::atomic<bool> started_{false};
     const QVReportingWorkerClass* workerClass_ = nullptr;
 };
 

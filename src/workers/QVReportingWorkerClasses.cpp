@@ -4,6 +4,7 @@
 #include "monitoring/QVReportingSessionMemoryLogWorker.h"
 #include "monitoring/QVReportingSessionSystemMonitorWorker.h"
 #include "workers/backends/QVReportingSessionAudioRegistrationWorker.h"
+#include "workers/backends/QVReportingSessionConvoWorker.h"
 #include "workers/backends/QVReportingSessionEnergyLogWorker.h"
 #include "workers/backends/QVReportingSessionMTXWorker.h"
 #include "workers/backends/QVReportingSessionMetricsHubWorker.h"
@@ -22,7 +23,7 @@ namespace qv {
 QVReportingWorkerRegistry::ClassList QVReportingAllWorkerClasses() {
     // Fixed order: trace, volume, orbit, summary, input, MetricsHub, EnergyLog, memory log, MTX,
     // driver snapshot, system monitor, ICX, Pulsar, summary JSON file, audio registration, Convo,
-    // IssueFiler. Only the classes that exist are listed.
+    // IssueFiler.
     return {
         &makeWorkerClass<QVReportingSessionTraceWorker>(),
         &makeWorkerClass<QVReportingSessionVolumeMessagesWorker>(),
@@ -39,6 +40,7 @@ QVReportingWorkerRegistry::ClassList QVReportingAllWorkerClasses() {
         &makeWorkerClass<QVReportingSessionPulsarWorker>(),
         &makeWorkerClass<QVReportingSessionSummaryJsonFileWorker>(),
         &makeWorkerClass<QVReportingSessionAudioRegistrationWorker>(),
+        &makeWorkerClass<QVReportingSessionConvoWorker>(),
         &makeWorkerClass<QVReportingSessionIssueFilerWorker>(),
     };
 }

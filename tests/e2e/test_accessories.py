@@ -110,11 +110,16 @@ class AccessoryTestCase(unittest.TestCase):
             return json.load(f)
 
     def convo(self):
+        """The registration report's lines of the convo sink, where every session also mirrors
+        itself."""
         path = os.path.join(self.state, "sinks", "convo.jsonl")
         if not os.path.exists(path):
             return []
         with open(path) as f:
-            return [json.loads(line) for line in f if line.strip()]
+            lines = [json.loads(line) for line in f if line.strip()]
+        reports = {l["session"] for l in lines if l["op"] == "session"
+                   and l["userInfo"].get("ClientName") == "Earlink_Telemetry"}
+        return [l for l in lines if l["session"] in reports]
 
     def session_with_trigger(self, client, rid):
         client.create(rid, service_type=1)

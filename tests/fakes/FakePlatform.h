@@ -15,6 +15,7 @@
 #include "fakes/FakeServices.h"
 #include "fakes/FakeSpanTraceRecorder.h"
 #include "fakes/FakeStatFeed.h"
+#include "fakes/FakeTaskExecutor.h"
 #include "fakes/FakeThreadlineModelReader.h"
 #include "platform/Platform.h"
 
@@ -41,6 +42,7 @@ struct FakePlatform {
         ProcessLauncher* processLauncher = nullptr;
         MTXMetricsService* mtx = nullptr;
         EnergyLogService* energyLog = nullptr;
+        TaskExecutor* executor = nullptr;
     };
 
     // The fakes' platform with some services replaced, for a test that brings its own.
@@ -63,7 +65,8 @@ struct FakePlatform {
                         r.statFeed ? *r.statFeed : statFeed,
                         r.processLauncher ? *r.processLauncher : processLauncher,
                         r.mtx ? *r.mtx : mtx,
-                        r.energyLog ? *r.energyLog : energyLog};
+                        r.energyLog ? *r.energyLog : energyLog,
+                        r.executor ? *r.executor : executor};
     }
 
     FakeClock clock;
@@ -85,6 +88,7 @@ struct FakePlatform {
     FakeProcessLauncher processLauncher;
     FakeMTXMetricsService mtx;
     FakeEnergyLogService energyLog;
+    FakeTaskExecutor executor{clock};
     Platform platform = with({});
 };
 

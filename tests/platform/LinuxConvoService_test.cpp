@@ -1,0 +1,114 @@
+#include "platform/linux/LinuxConvoService.h"
+
+#include <gtest/gtest.h>
+
+#include <condition_variable>
+#include <fstream>
+#include <mutex>
+#include <nlohmann/json.hpp>
+#include <optional>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "fakes/FakeClock.h"
+#include "fakes/FakeServices.h"
+#include "fakes/TempDirectory.h"
+
+namespace qv {
+namespace {
+
+using Backends = std::optional<std::vector<std::string>>;
+
+class ALinuxConvoService : public ::testing::Test {
+  protected:
+    std::vector<nlohmann::ordered_json> lines() {
+        service.flush();
+        std::vector<nlohmann::ordered_json> out;
+        std::ifstream file(tmp.path() / "sinks" / "convo.jsonl");
+        for (std::string line; std::getline(file, line);) {
+            out.push_back(nlohmann::ordered_json::parse(line));
+        }
+        return out;
+    }
+    // The answer to a configuration, and the thread it came on.
+    std::pair<Backends, std::thread::id> configure(ConvoSession& session) {
+        std::mutex m;
+        std::condition_variable cv;
+        std::optional<std::pair<Backends, std::thread::id>> answer;
+        session.startConfiguration([&](const Backends& backends) {
+            std::lock_guard lock(m);
+            answer.emplace(backends, std::this_thread::get_id());
+            cv.notify_one();
+        });
+        std::unique_lock lock(m);
+        cv.wait(lock, [&] { return answer.has_value(); });
+        return *answer;
+    }
+
+    test::TempDirectory tmp{"qvconvo"};
+    test::FakeClock clock;
+    test::FakePreferenceStore preferences;
+    LinuxConvoService service{preferences, std::make_unique<JsonlSink>(tmp.path().string(), "convo",
+                                                                       clock, SinkCallbacks{})};
+};
+
+TEST_F(ALinuxConvoService, AnswersFromItsSuiteReadAfreshAtEveryQuestion) {
+    const std::string suite(LinuxConvoService::kSuite);
+    const auto token = service.newHierarchyTokenFromParentToken(std::nullopt);
+    ASSERT_TRUE(token);
+    EXPECT_NE(*token, *service.newHierarchyTokenFromParentToken(std::nullopt));
+    auto session = service.createSession({{"SessionID", 9}}, {}, std::nullopt);
+
+    // No suite: the one default backend, on the service's thread, not the caller's.
+    const auto [defaults, thread] = configure(*session);
+    EXPECT_EQ(defaults, (Backends{{"jsonl"}}));
+    EXPECT_NE(thread, std::this_thread::get_id());
+
+    preferences.setValue(suite, "Backends", Array{"a", 3, "", "b"});
+    EXPECT_EQ(configure(*session).first, (Backends{{"a", "b"}})) << "names only";
+    for (const Value& none : {Value(Array{}), Value(Array{Value(""), Value(1)}), Value("jsonl")}) {
+        preferences.setValue(suite, "Backends", none);
+        EXPECT_EQ(configure(*session).first, std::nullopt) << none.description();
+    }
+
+    preferences.setValue(suite, "Enabled", false);
+    EXPECT_EQ(service.newHierarchyTokenFromParentToken(std::nullopt), std::nullopt);
+    preferences.setValue(suite, "Enabled", "YES");
+    EXPECT_TRUE(service.newHierarchyTokenFromParentToken(std::nullopt));
+}
+
+TEST_F(ALinuxConvoService, WritesEachSessionItsMessagesAndFlushesAsSinkLines) {
+    auto first = service.createSession({{"SessionID", 42}, {"BatchEvent", true}},
+                                       {{"ServiceName", "generic_session"}}, std::nullopt);
+    auto second = service.createSession({}, {}, std::nullopt);
+    EXPECT_EQ(first->sendMessage(4, 18, {{"n", 1.5}, {"s", "x"}}), std::nullopt);
+    EXPECT_EQ(second->sendMessage(0xFFFF, 0xFFFF, {}), std::nullopt);
+    first->flush();
+    EXPECT_EQ(first->description(), "<ConvoSession 1 sessionID=42>");
+
+    const auto got = lines();
+    ASSERT_EQ(got.size(), 5u);
+    for (const auto& line : got) {
+        EXPECT_EQ(line.begin().key(), "time");
+    }
+    EXPECT_EQ(got[0]["op"], "session");
+    EXPECT_EQ(got[0]["session"], 1);
+    EXPECT_EQ(got[0]["sessionInfo"],
+              nlohmann::ordered_json::parse(R"({"SessionID":42,"BatchEvent":true})"));
+    EXPECT_EQ(got[0]["userInfo"]["ServiceName"], "generic_session");
+    EXPECT_EQ(got[1]["session"], 2);
+    EXPECT_EQ(got[2]["op"], "message");
+    EXPECT_EQ(got[2]["sessionID"], 42);
+    EXPECT_EQ(got[2]["category"], 4);
+    EXPECT_EQ(got[2]["type"], 18);
+    EXPECT_EQ(got[2]["payload"]["n"], 1.5);
+    EXPECT_EQ(got[3]["session"], 2);
+    EXPECT_TRUE(got[3]["sessionID"].is_null()) << "a session without an ID";
+    EXPECT_EQ(got[3]["category"], 65535);
+    EXPECT_EQ(got[4]["op"], "flush");
+    EXPECT_EQ(got[4]["session"], 1);
+}
+
+}  // namespace
+}  // namespace qv
