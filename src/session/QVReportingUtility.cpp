@@ -4,6 +4,7 @@
 #include <charconv>
 #include <cmath>
 #include <cstdlib>
+#include <ctime>
 #include <limits>
 #include <mutex>
 #include <system_error>
@@ -231,6 +232,15 @@ bool QVReportingUtilityKeyIsPresentAndHasChanged(std::string_view key, const Dic
         return false;
     }
     return *now != *before;
+}
+
+std::string QVReportingUtilityFileTimestamp(double wallSeconds) {
+    const auto seconds = std::isfinite(wallSeconds) ? static_cast<time_t>(wallSeconds) : 0;
+    tm local{};
+    localtime_r(&seconds, &local);
+    char text[32];
+    const std::size_t n = strftime(text, sizeof text, "%Y%m%d-%H%M%S%z", &local);
+    return std::string(text, n);
 }
 
 }  // namespace qv

@@ -64,4 +64,8 @@ std::optional<std::string> QVReportingUtilityBucketNumberToString(
 bool QVReportingUtilityKeyIsPresentAndHasChanged(std::string_view key, const Dictionary* current,
                                                  const Dictionary* previous);
 
+// The local time of wallSeconds as "yyyyMMdd-HHmmssZ" (e.g. "20240131-142501+0100"), the stamp
+// that begins the names of the files sessions leave behind; a time that is not finite is 1970.
+std::string QVReportingUtilityFileTimestamp(double wallSeconds);
+
 }  // namespace qv

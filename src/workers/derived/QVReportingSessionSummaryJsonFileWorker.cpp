@@ -33,16 +33,6 @@ const QVReportingLogCategory& logCategory() {
     return QVReportingSummaryLogCategory();
 }
 
-// The local time of wallSeconds as "yyyyMMdd-HHmmssZ", e.g. "20240131-142501+0100".
-std::string fileTimestamp(double wallSeconds) {
-    const auto seconds = std::isfinite(wallSeconds) ? static_cast<time_t>(wallSeconds) : 0;
-    tm local{};
-    localtime_r(&seconds, &local);
-    char text[32];
-    const std::size_t n = strftime(text, sizeof text, "%Y%m%d-%H%M%S%z", &local);
-    return std::string(text, n);
-}
-
 }  // namespace
 
 std::filesystem::path QVReportingLogsDirectory(const Platform& platform) {
@@ -82,7 +72,8 @@ void QVReportingSessionSummaryJsonFileWorker::openFile() {
     }
     // Whatever the client named its application, the name stays one file in this directory.
     const std::string name = fmt::format(
-        "{}-{}-{}-{}.json", fileTimestamp(owner->platform().clock.now()), owner->reporterID(),
+        "{}-{}-{}-{}.json", QVReportingUtilityFileTimestamp(owner->platform().clock.now()),
+        owner->reporterID(),
         QVReportingSafeFileComponent(QVReportingUtilityRetrieveAppName(owner->configuration())),
         QVReportingSafeFileComponent(owner->serviceName(), 64));
     reportPath_ = (directory / name).string();

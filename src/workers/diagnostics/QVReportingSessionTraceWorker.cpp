@@ -26,16 +26,6 @@ const QVReportingLogCategory& logCategory() {
     return QVReportingTraceCategory();
 }
 
-// The local time of wallSeconds as "yyyyMMdd-HHmmssZ", e.g. "20240131-142501+0100".
-std::string fileTimestamp(double wallSeconds) {
-    const auto seconds = std::isfinite(wallSeconds) ? static_cast<time_t>(wallSeconds) : 0;
-    tm local{};
-    localtime_r(&seconds, &local);
-    char text[32];
-    const std::size_t n = strftime(text, sizeof text, "%Y%m%d-%H%M%S%z", &local);
-    return std::string(text, n);
-}
-
 std::optional<std::string> configuredString(const Dictionary& configuration, std::string_view key) {
     const Value* value = configuration.find(key);
     if (value && value->isString()) {
@@ -382,7 +372,7 @@ void QVReportingSessionTraceWorker::createGaugeWriter() {
     } else {
         // The application name comes from the client: it is made safe like any file name.
         mOutputFile_ = fmt::format(
-            "{}-{}-{}-{}.gdj", fileTimestamp(platform.clock.now()), "qvsound",
+            "{}-{}-{}-{}.gdj", QVReportingUtilityFileTimestamp(platform.clock.now()), "qvsound",
             QVReportingSafeFileComponent(QVReportingUtilityRetrieveAppName(configuration)),
             QVReportingSafeFileComponent(owner->serviceName(), 64));
     }
