@@ -84,7 +84,9 @@ const OperationShape& shapeFor(const Json& op) {
 }
 
 void checkKeys(const Json& object, const OperationShape& shape) {
-    for (const auto& [key, value] : object.items()) {
+    for (const auto& item : object.items()) {
+        // A named variable, not a structured binding: clang before 16 cannot capture those.
+        const std::string& key = item.key();
         if (key == "op") {
             continue;
         }

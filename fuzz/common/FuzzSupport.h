@@ -1,14 +1,19 @@
 // What the fuzz targets share: reading a fuzzer's bytes as a stream of choices, a check that stops
-// the run, values of every kind made from bytes, and a comparison of values stricter than Value's
-// own (kinds, key order and the bits of doubles must match, so that NaN equals itself and 1 does
-// not pass for 1.0).
+// the run, a scratch directory for readers of files, values of every kind made from bytes, and a
+// comparison of values stricter than Value's own (kinds, key order and the bits of doubles must
+// match, so that NaN equals itself and 1 does not pass for 1.0).
 #pragma once
+
+#include <stdlib.h>
+#include <unistd.h>
 
 #include <algorithm>
 #include <cmath>
 #include <cstddef>
 #include <cstdint>
 #include <cstring>
+#include <filesystem>
+#include <fstream>
 #include <limits>
 #include <string>
 #include <string_view>
@@ -22,6 +27,37 @@ inline void check(bool condition) {
     if (!condition) {
         __builtin_trap();
     }
+}
+
+// A private directory for readers that only take a path, made once per process (in memory when
+// /dev/shm is there, so that writing and syncing files costs little) and removed at exit.
+inline const std::string& scratchDirectory() {
+    // Never destroyed: the exit handler that removes the directory runs after static objects
+    // made later than it are gone.
+    static const std::string* const directory = [] {
+        auto* made = new std::string(
+            std::string(::access("/dev/shm", W_OK) == 0 ? "/dev/shm" : "/tmp") + "/qv-fuzz-XXXXXX");
+        check(::mkdtemp(made->data()) != nullptr);
+        std::atexit([] {
+            std::error_code ignored;
+            std::filesystem::remove_all(scratchDirectory(), ignored);
+        });
+        return made;
+    }();
+    return *directory;
+}
+
+// Replaces the file's contents with text.
+inline void writeFile(const std::string& path, const std::string& text) {
+    std::ofstream out(path, std::ios::binary | std::ios::trunc);
+    out << text;
+    out.close();
+    check(static_cast<bool>(out));
+}
+
+inline std::string readFile(const std::string& path) {
+    std::ifstream in(path, std::ios::binary);
+    return std::string(std::istreambuf_iterator<char>(in), std::istreambuf_iterator<char>());
 }
 
 // The input, read front to back; reads past the end give zeros, so that every input means

@@ -273,7 +273,7 @@ bool build(FuzzInput& in, int fd, Built& out) {
                 out.message.openDictEntry("sv");
                 // Few distinct keys, so that duplicates occur.
                 out.message << ((in.byte() & 3) ? qv::fuzz::validText(in, 8)
-                                                 : std::string("k") + std::to_string(i % 3));
+                                                : std::string("k") + std::to_string(i % 3));
                 builder.value({'v', {}});
                 out.message.closeDictEntry();
             }
