@@ -88,8 +88,9 @@ TEST(AQVReportingDBusCodec, CountsWhatVariantsHoldNotTheirWrapping) {
     expectRereads(one.dictionary, 1, 1);
 
     // An array of two numbers is three values and two levels, at the limits and just past them.
-    sdbus::PlainMessage array =
-        payload("ax", [](sdbus::Message& w) { w << std::vector<std::int64_t>{7, 8}; });
+    sdbus::PlainMessage array = payload("ax", [](sdbus::Message& w) {
+        w << std::vector<std::int64_t>{7, 8};
+    });
     const QVReportingDecodeResult atLimits = decode(array, 3, 2);
     ASSERT_FALSE(atLimits.error) << atLimits.error->message;
     expectRereads(atLimits.dictionary, 3, 2);
