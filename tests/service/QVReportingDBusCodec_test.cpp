@@ -67,9 +67,10 @@ TEST(AQVReportingDBusCodec, CountsPairsOfNonStringKeysAsTheDecodedPayloadHoldsTh
 
     const QVReportingDecodeResult fits = decode(m, 7, 3);
     ASSERT_FALSE(fits.error) << fits.error->message;
-    const Value expected(Dictionary{
-        {"k", Value(Array{Value(Array{Value(1), Value(2)}), Value(Array{Value(3), Value(4)})})}});
-    EXPECT_EQ(Value(fits.dictionary), expected);
+    Dictionary expected;
+    expected.set("k",
+                 Value(Array{Value(Array{Value(1), Value(2)}), Value(Array{Value(3), Value(4)})}));
+    EXPECT_EQ(Value(fits.dictionary), Value(expected));
     EXPECT_EQ(Value(fits.dictionary).depth(), 3u);
     EXPECT_EQ(Value(fits.dictionary).valueCount() - 1, 7u);
     expectRereads(fits.dictionary, 7, 3);
@@ -84,7 +85,11 @@ TEST(AQVReportingDBusCodec, CountsWhatVariantsHoldNotTheirWrapping) {
     });
     const QVReportingDecodeResult one = decode(nested, 1, 1);
     ASSERT_FALSE(one.error) << one.error->message;
-    EXPECT_EQ(Value(one.dictionary), Value(Dictionary{{"k", Value(5)}}));
+    const Value* k = one.dictionary.find("k");
+    ASSERT_NE(k, nullptr);
+    EXPECT_EQ(k->kind(), Value::Kind::Int);
+    EXPECT_EQ(*k, Value(5));
+    EXPECT_EQ(one.dictionary.size(), 1u);
     expectRereads(one.dictionary, 1, 1);
 
     // An array of two numbers is three values and two levels, at the limits and just past them.
