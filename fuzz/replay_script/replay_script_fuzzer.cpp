@@ -8,8 +8,8 @@
 //   payloads and configurations are JSON objects;
 // - every accepted operation, written back as a script line of its own, parses to the same
 //   operation (numbers for categories and types, the same ids, payload and seconds);
-// - a script it refuses names a line that is not blank, after which nothing was read, whose own
-//   parse gives the same message, and before which every line that is not blank parses.
+// - a script it refuses names a line that is not blank, whose own parse gives the same message,
+//   and before which every line that is not blank parses (the first bad line is the one named).
 #include <cstddef>
 #include <cstdint>
 #include <cstring>
