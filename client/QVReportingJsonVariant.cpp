@@ -5,6 +5,7 @@
 #include <limits>
 #include <vector>
 
+#include <sdbus-c++/Error.h>
 #include <sdbus-c++/Message.h>
 
 // Exported by libsdbus-c++ 1.2 (variants are built on it) but declared in its public headers only
@@ -18,6 +19,12 @@ namespace qv::client {
 namespace {
 
 constexpr const char* kNowKey = "$now";
+
+// The bus refuses some values JSON can hold (containers nested deeper than a message may go,
+// strings holding NUL): they have no D-Bus form either.
+QVReportingJsonConversionError noDBusForm(const std::string& path, const sdbus::Error& e) {
+    return QVReportingJsonConversionError(path + ": has no D-Bus form (" + e.getMessage() + ")");
+}
 
 sdbus::Variant toVariant(const nlohmann::ordered_json& json,
                          const QVReportingJsonConversionOptions& options, const std::string& path,
@@ -226,13 +233,21 @@ bool readValue(sdbus::Message& m, nlohmann::ordered_json& out) {
 sdbus::Variant QVReportingJsonToVariant(const nlohmann::ordered_json& json,
                                         const QVReportingJsonConversionOptions& options,
                                         const std::string& path) {
-    return toVariant(json, options, path, 0);
+    try {
+        return toVariant(json, options, path, 0);
+    } catch (const sdbus::Error& e) {
+        throw noDBusForm(path, e);
+    }
 }
 
 VariantMap QVReportingJsonToVariantMap(const nlohmann::ordered_json& json,
                                        const QVReportingJsonConversionOptions& options,
                                        const std::string& path) {
-    return toVariantMap(json, options, path, 0);
+    try {
+        return toVariantMap(json, options, path, 0);
+    } catch (const sdbus::Error& e) {
+        throw noDBusForm(path, e);
+    }
 }
 
 nlohmann::ordered_json QVReportingVariantToJson(const sdbus::Variant& variant) {

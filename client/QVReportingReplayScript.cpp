@@ -19,6 +19,10 @@ using Json = nlohmann::ordered_json;
 // Longer pauses are almost surely a slip (200 for 0.2) and would look like a hang.
 constexpr double kMaxSleepSeconds = 3600;
 
+// Deeper lines are refused before they are parsed: copying and converting JSON recurse once per
+// level, so a hostile line could otherwise exhaust the stack.
+constexpr int kMaxNesting = 64;
+
 // Keys besides "op"; unused places are empty.
 using Keys = std::array<std::string_view, 2>;
 
@@ -84,7 +88,9 @@ const OperationShape& shapeFor(const Json& op) {
 }
 
 void checkKeys(const Json& object, const OperationShape& shape) {
-    for (const auto& [key, value] : object.items()) {
+    for (const auto& item : object.items()) {
+        // A named variable, not a structured binding: clang before 16 cannot capture those.
+        const std::string& key = item.key();
         if (key == "op") {
             continue;
         }
@@ -113,7 +119,35 @@ void checkDictionary(const Json& json, std::string_view what) {
     }
 }
 
+// Deepest nesting of arrays and objects in a line, strings skipped; stops counting once beyond
+// the limit.
+int nestingDepth(std::string_view text) {
+    int depth = 0;
+    int deepest = 0;
+    bool inString = false;
+    for (std::size_t i = 0; i < text.size() && deepest <= kMaxNesting; ++i) {
+        const char c = text[i];
+        if (inString) {
+            if (c == '\\') {
+                ++i;
+            } else if (c == '"') {
+                inString = false;
+            }
+        } else if (c == '"') {
+            inString = true;
+        } else if (c == '[' || c == '{') {
+            deepest = std::max(deepest, ++depth);
+        } else if (c == ']' || c == '}') {
+            --depth;
+        }
+    }
+    return deepest;
+}
+
 QVReportingReplayOperation parse(std::string_view text, std::size_t line) {
+    if (nestingDepth(text) > kMaxNesting) {
+        throw Bad{"nested more than " + std::to_string(kMaxNesting) + " deep"};
+    }
     const Json object = Json::parse(text.begin(), text.end(), nullptr, false);
     if (object.is_discarded()) {
         throw Bad{"not valid JSON"};

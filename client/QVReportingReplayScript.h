@@ -15,8 +15,8 @@
 // is resolved when the line runs, not when it is read. Blank lines are skipped.
 //
 // The whole script is checked before anything runs: a line that is not a JSON object, an
-// unknown operation or key, a missing or mistyped argument, or a value with no D-Bus form fails
-// with its line number.
+// unknown operation or key, a missing or mistyped argument, a value with no D-Bus form, or
+// nesting more than 64 deep fails with its line number.
 //
 // Thread safety: pure functions.
 #pragma once

@@ -36,6 +36,19 @@ class Reader {
         }
         return true;
     }
+    // Values are counted as the payload will hold them, so that what is accepted keeps to the
+    // limit once decoded.
+    bool countValue() {
+        if (++values_ > budget_.maxValues) {
+            return refuse(QVReportingStats::Limit::PayloadValues,
+                          fmt::format("a payload may hold at most {} values", budget_.maxValues));
+        }
+        return true;
+    }
+    bool refuseDepth() {
+        return refuse(QVReportingStats::Limit::PayloadDepth,
+                      fmt::format("a payload may nest at most {} deep", budget_.maxDepth));
+    }
     bool refuse(QVReportingStats::Limit which, std::string why) {
         limit = which;
         error = QVReportingError::limitsExceeded(std::move(why));
@@ -70,9 +83,9 @@ bool Reader::read(std::size_t depth, Value& out) {
     if (atEnd(type, contents)) {
         return false;
     }
-    if (++values_ > budget_.maxValues) {
-        return refuse(QVReportingStats::Limit::PayloadValues,
-                      fmt::format("a payload may hold at most {} values", budget_.maxValues));
+    // A variant only wraps a value; what it holds is counted instead.
+    if (type[0] != 'v' && !countValue()) {
+        return false;
     }
     switch (type[0]) {
         case 'b': {
@@ -140,8 +153,7 @@ bool Reader::read(std::size_t depth, Value& out) {
 
 bool Reader::readArray(const std::string& contents, std::size_t depth, Value& out) {
     if (depth > budget_.maxDepth) {
-        return refuse(QVReportingStats::Limit::PayloadDepth,
-                      fmt::format("a payload may nest at most {} deep", budget_.maxDepth));
+        return refuseDepth();
     }
     if (!charge(4)) {
         return false;
@@ -180,8 +192,7 @@ bool Reader::readArray(const std::string& contents, std::size_t depth, Value& ou
 
 bool Reader::readStruct(const std::string& contents, std::size_t depth, Value& out) {
     if (depth > budget_.maxDepth) {
-        return refuse(QVReportingStats::Limit::PayloadDepth,
-                      fmt::format("a payload may nest at most {} deep", budget_.maxDepth));
+        return refuseDepth();
     }
     m_.enterStruct(contents);
     Array items;
@@ -202,6 +213,11 @@ bool Reader::readDictionary(const std::string& entrySignature, std::size_t depth
                             bool isTopLevel) {
     m_.enterContainer("{" + entrySignature + "}");
     const bool stringKeys = !entrySignature.empty() && entrySignature[0] == 's';
+    // Entries with keys of another type become [key, value] pairs: a value each, one level down.
+    const std::size_t entryDepth = stringKeys ? depth : depth + 1;
+    if (!stringKeys && entryDepth > budget_.maxDepth) {
+        return refuseDepth();
+    }
     Dictionary dict;
     Array pairs;
     std::string type, inner;
@@ -217,10 +233,10 @@ bool Reader::readDictionary(const std::string& entrySignature, std::size_t depth
             if (isTopLevel) {
                 key.assign(name);  // named in errors; its buffer is reused entry after entry
             }
-        } else if (!read(depth, k)) {
+        } else if (!countValue() || !read(entryDepth, k)) {
             return false;
         }
-        if (!read(depth, v)) {
+        if (!read(entryDepth, v)) {
             return false;
         }
         m_.exitDictEntry();

@@ -3,7 +3,10 @@
 // Reading: b is a bool; y n q i u x signed integers; t an unsigned integer; d a double; s o g
 // strings; ay bytes; other arrays and structs arrays; a{s?} dictionaries (a dictionary with keys
 // of another type becomes an array of [key, value] pairs); variants unwrap. A unix fd, or input
-// beyond the limits, is refused with a reason naming the key. Writing: dates go out as doubles.
+// beyond the limits, is refused with a reason naming the key. The limits measure what the payload
+// will hold: each value counts (a pair too, a variant's wrapping not), and each level of nesting
+// (a pair's too), so that a payload read back from the daemon's own writing fits them as well.
+// Writing: dates go out as doubles.
 //
 // Thread safety: the functions keep no state; a message must only be touched by one thread.
 #pragma once

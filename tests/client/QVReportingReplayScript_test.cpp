@@ -78,6 +78,37 @@ TEST(AReplayScriptParser, RefusesMalformedLinesAndArgumentsOutsideTheirRange) {
     }
 }
 
+// A payload of n nested dictionaries inside the line's own object and its payload.
+std::string nestedSend(std::size_t n) {
+    std::string payload = "1";
+    for (std::size_t i = 0; i < n; ++i) {
+        payload = R"({"a":)" + payload + "}";
+    }
+    return R"({"op":"send","category":1,"type":1,"payload":{"a":)" + payload + "}}";
+}
+
+TEST(AReplayScriptParser, RefusesLinesNestedTooDeepWithoutExhaustingTheStack) {
+    // 2 + 62 levels is the most a line may hold, though the bus refuses a payload this deep:
+    // refused, not thrown. Brackets inside strings do not count.
+    EXPECT_NE(refusal(nestedSend(62).c_str()).find("payload: has no D-Bus form"),
+              std::string::npos);
+    EXPECT_EQ(refusal(nestedSend(30).c_str()), "");
+    EXPECT_NE(refusal(nestedSend(63).c_str()).find("nested more than 64 deep"), std::string::npos);
+    const std::string quoted =
+        R"({"op":"send","category":1,"type":1,"payload":{"a":")" + std::string(100, '[') + R"("}})";
+    EXPECT_EQ(refusal(quoted.c_str()), "");
+    // Deep enough to overflow the stack once copied or converted.
+    const std::string hostile = R"({"op":"send","category":1,"type":1,"payload":{"a":)" +
+                                std::string(200000, '[') + std::string(200000, ']') + "}}";
+    EXPECT_NE(refusal(hostile.c_str()).find("nested more than 64 deep"), std::string::npos);
+    std::istringstream script(R"({"op":"list"})"
+                              "\n" +
+                              nestedSend(63) + "\n");
+    const auto result = QVReportingParseReplayScript(script);
+    ASSERT_TRUE(std::holds_alternative<QVReportingReplayError>(result));
+    EXPECT_EQ(std::get<QVReportingReplayError>(result).line, 2u);
+}
+
 TEST(AReplayScriptParser, NumbersLinesStopsAtTheFirstBadOneAndAcceptsTheShippedExamples) {
     std::istringstream script("{\"op\":\"create\",\"id\":5}\n\n   \r\n{\"op\":\"stop\"}\n");
     auto result = QVReportingParseReplayScript(script);
