@@ -717,9 +717,10 @@ class Soak:
             conn = bus.connect()
             r = dbus.Interface(conn.get_object(BUS_NAME, OBJECT_PATH, introspect=False), INTERFACE)
             r.CreateReportingSession(dbus.Int64(rid))
-            r.SetConfiguration({"HostApplicationDisplayID": f"soak.{rid}"}, dbus.Int64(rid))
+            r.SetConfiguration(dbus.Dictionary({"HostApplicationDisplayID": f"soak.{rid}"}, signature="sv"), dbus.Int64(rid))
             r.StartReportingSession(dbus.Int64(rid), ignore_reply=True)
-            r.SendMessage({"soak_rid": dbus.Int64(rid), "soak_seq": dbus.Int64(0)}, dbus.UInt32(4),
+            r.SendMessage(dbus.Dictionary({"soak_rid": dbus.Int64(rid), "soak_seq": dbus.Int64(0)},
+                                          signature="sv"), dbus.UInt32(4),
                           dbus.UInt16(1), [dbus.Int64(rid)])
             index = AnalyticsIndex(state)
             wait_until(lambda: 0 in index.update().qvsound.get(rid, ()) and
@@ -763,13 +764,13 @@ class Soak:
             payload = {"soak_rid": dbus.Int64(rid), "soak_seq": dbus.Int64(seq)}
             if padding:
                 payload["padding"] = "p" * padding
-            daemon.reporting.SendMessage(payload, dbus.UInt32(4), dbus.UInt16(1),
+            daemon.reporting.SendMessage(dbus.Dictionary(payload, signature="sv"), dbus.UInt32(4), dbus.UInt16(1),
                                          [dbus.Int64(rid)], timeout=60)
 
     def begin_session(self, daemon):
         rid = self.ids(1)
         daemon.reporting.CreateReportingSession(dbus.Int64(rid))
-        daemon.reporting.SetConfiguration({"HostApplicationDisplayID": f"soak.{rid}"},
+        daemon.reporting.SetConfiguration(dbus.Dictionary({"HostApplicationDisplayID": f"soak.{rid}"}, signature="sv"),
                                           dbus.Int64(rid))
         daemon.reporting.StartReportingSession(dbus.Int64(rid), ignore_reply=True)
         return rid
