@@ -46,8 +46,8 @@ from soaklib import (BUS_NAME, CLIENT_COMM, INTERFACE, OBJECT_PATH, SOURCE_DIR, 
                      unparsable_lines, wait_until, whole_lines)
 
 # What each form does. Messages are per client, spread over its sessions.
-SHORT = dict(churn_clients=6, churn_messages=600, churn_sessions=2, churn_kill_fraction=0.5,
-             churn_rss=False, sigterm_rounds=1, sigterm_clients=4, sigterm_leavers=3,
+SHORT = dict(churn_clients=10, churn_messages=2000, churn_sessions=2, churn_kill_fraction=0.5,
+             churn_rss=False, sigterm_rounds=2, sigterm_clients=6, sigterm_leavers=4,
              sigkill_clients=4, faults_messages=400)
 FULL = dict(churn_clients=50, churn_messages=10000, churn_sessions=2, churn_kill_fraction=0.4,
             churn_rss=True, sigterm_rounds=5, sigterm_clients=16, sigterm_leavers=8,
