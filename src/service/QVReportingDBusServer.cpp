@@ -48,6 +48,11 @@ QVReportingDBusServer::QVReportingDBusServer(std::unique_ptr<sdbus::IConnection>
 }
 
 QVReportingDBusServer::~QVReportingDBusServer() {
+    stop();
+    ::close(wakeFd_);
+}
+
+void QVReportingDBusServer::stop() {
     if (notifications_) {
         notifications_->setPostObserver(nullptr);
     }
@@ -62,7 +67,6 @@ QVReportingDBusServer::~QVReportingDBusServer() {
         });
         loopThread_.join();
     }
-    ::close(wakeFd_);
 }
 
 void QVReportingDBusServer::start() {

@@ -34,7 +34,7 @@ class QVReportingDBusServer {
     // notifications may be null (no notification center object is served then).
     QVReportingDBusServer(std::unique_ptr<sdbus::IConnection> connection,
                           QVReportingService& service, LinuxNotificationCenter* notifications);
-    // Leaves the bus: unregisters the objects first, then ends the loop.
+    // Leaves the bus (stop()) if it has not yet.
     ~QVReportingDBusServer();
 
     QVReportingDBusServer(const QVReportingDBusServer&) = delete;
@@ -47,6 +47,10 @@ class QVReportingDBusServer {
     bool post(std::function<void()> fn);
     // Blocks until every reply and signal posted so far has been handed to the bus.
     void flush();
+    // Leaves the bus: unregisters the objects first, then ends the loop. Work still queued
+    // elsewhere may answer calls afterwards (the answers are dropped), so the server must outlive
+    // it: stop, drain the queues, then destroy.
+    void stop();
 
     // The bus connections of clients now served (for tests and the stats).
     std::size_t clientCount() const { return clientCount_.load(); }

@@ -238,9 +238,9 @@ int main(int argc, char** argv) {
     // the sinks and the log are written through before the process leaves.
     service.stopAllSessions();
     server->flush();
-    server.reset();
-    // Work the bus posted before it closed (a client leaving, say) runs while the service and
-    // its sessions still exist.
+    server->stop();
+    // Work the bus posted before it closed (a client leaving, a call still queued) runs while
+    // the service, its sessions and the server it answers through still exist.
     queue.sync([] {});
     // Work the sessions left on the pool (the Convo summaries and flushes) goes into the sinks
     // before they are flushed.
@@ -248,6 +248,7 @@ int main(int argc, char** argv) {
         QVLOG_ERROR(logCategory(), "background work still running after {} s; leaving anyway",
                     std::chrono::duration<double>(kPoolDrainTimeout).count());
     }
+    server.reset();
     JsonlSink::flushAll(std::chrono::steady_clock::now() + kShutdownFlushTimeout);
     QVReportingSystemMonitor::reset();
     QVLOG_DEFAULT(logCategory(), "stopped");

@@ -210,12 +210,12 @@ TEST_F(AJsonlSink, LosesOnlyWhatAFullDiskRefusesAndKeepsLaterLinesWhole) {
     for (std::string line; std::getline(in, line);) {
         const auto json = ordered_json::parse(line, nullptr, false);
         if (json.is_discarded()) {
-            ++fragments;  // the line the limit cut, ended so the next ones stay whole
+            ++fragments;  // the start of a line the limit cut: it must have been taken off
             continue;
         }
         written.push_back(json["i"].get<int>());
     }
-    EXPECT_LE(fragments, 1u);
+    EXPECT_EQ(fragments, 0u);
     EXPECT_EQ(written.size(), 20 - lostWhileFull + 1);
     EXPECT_EQ(written.back(), 20);
     EXPECT_TRUE(std::is_sorted(written.begin(), written.end()));

@@ -204,13 +204,29 @@ void JsonlSink::writeText(const std::string& text, std::size_t lines) {
     const int error = errno;
     const std::string_view written(text.data(), text.size() - rest.size());
     if (!written.empty()) {  // else an earlier torn line is still torn
-        tornByUs_ = written.back() != '\n';
+        const auto lastEnd = written.rfind('\n');
+        const std::size_t fragment =
+            lastEnd == std::string_view::npos ? written.size() : written.size() - lastEnd - 1;
+        const bool cut = fragment == 0 || cutOwnFragment(fragment);
+        // Without a line feed in this write, an earlier fragment may still sit before this one.
+        tornByUs_ = lastEnd == std::string_view::npos ? tornByUs_ || !cut : !cut;
     }
     const auto whole = static_cast<std::size_t>(std::count(written.begin(), written.end(), '\n'));
     reason = fmt::format("cannot write to {}: {}", path_, errnoText(error));
     // A descriptor that failed once is not trusted again: the next lines open the file afresh.
     closeFile();
     lose(reason, lines - whole);
+}
+
+// The file's last bytes are the start of a line that did not fit: taking them off keeps every
+// line of the file whole JSON. Shrinking a file needs no space, so this works on a full disk.
+bool JsonlSink::cutOwnFragment(std::size_t bytes) {
+    struct stat st {};
+    if (::fstat(fd_, &st) != 0 || !S_ISREG(st.st_mode) ||
+        static_cast<std::size_t>(st.st_size) < bytes) {
+        return false;
+    }
+    return ::ftruncate(fd_, st.st_size - static_cast<off_t>(bytes)) == 0;
 }
 
 bool JsonlSink::openFile(std::string& reason) {

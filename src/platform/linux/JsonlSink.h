@@ -105,6 +105,7 @@ class JsonlSink {
     // On the first open: a last line cut short by a crash is removed, so the file stays whole
     // JSON lines.
     void repairTornTail();
+    bool cutOwnFragment(std::size_t bytes);
     void closeFile();
     void lose(const std::string& reason, std::size_t lines = 1);
 
