@@ -1,5 +1,6 @@
 #include "platform/linux/LinuxIssueCaptureService.h"
 
+#include <fmt/format.h>
 #include <gtest/gtest.h>
 #include <nlohmann/json.hpp>
 
@@ -115,7 +116,7 @@ class ALinuxIssueCaptureService : public ::testing::Test {
 TEST_F(ALinuxIssueCaptureService, KeepsTheDailyLimitOverARollingDayAcrossRestarts) {
     set(LinuxIssueCaptureService::kDailyLimitKey, 3);
     for (int n = 0; n < 3; ++n) {
-        EXPECT_EQ(reason(snapshot(signature("S" + std::to_string(n)))), std::nullopt);
+        EXPECT_EQ(reason(snapshot(signature(fmt::format("S{}", n)))), std::nullopt);
         clock.advance(3600);
     }
     EXPECT_EQ(reason(snapshot(signature("S9"))), kIssueCaptureErrorDailyLimitExceeded);
@@ -295,7 +296,7 @@ TEST_F(ALinuxIssueCaptureService, BoundsTheRequestsWaitingForItsThreadAndItsPend
     holding.get_future().wait();
     std::atomic<int> answered{0};
     for (std::size_t n = 0; n < LinuxIssueCaptureService::kMaxQueuedRequests; ++n) {
-        ASSERT_TRUE(reporter->startSessionWithSignature(signature("q" + std::to_string(n)), 60,
+        ASSERT_TRUE(reporter->startSessionWithSignature(signature(fmt::format("q{}", n)), 60,
                                                         std::nullopt, std::nullopt, std::nullopt,
                                                         [&](const Dictionary&) { ++answered; }));
     }

@@ -1,5 +1,6 @@
 #include "session/QVReportingSession.h"
 
+#include <fmt/format.h>
 #include <gtest/gtest.h>
 
 #include <cmath>
@@ -123,7 +124,7 @@ TEST_F(ASession, RemembersABoundedNumberOfDistinctKeysAndKeepsUpdatingKnownOnes)
     auto s = make();
     Dictionary many;
     for (std::size_t i = 0; i < kMax - 10; ++i) {
-        many.set("k" + std::to_string(i), 0);
+        many.set(fmt::format("k{}", i), 0);
     }
     s->sendMessage(msg(many));  // stamping adds four keys: six places are left
     ASSERT_EQ(s->previousValues().size(), kMax - 6);

@@ -1,5 +1,6 @@
 #include "workers/backends/BTAccess.h"
 
+#include <fmt/format.h>
 #include <gtest/gtest.h>
 
 #include <string>
@@ -20,7 +21,7 @@ Dictionary accessory(const std::string& key, std::size_t count = 15,
                      const std::string& model = "M4801") {
     Array versions;
     for (std::size_t i = 0; i < count; ++i) {
-        versions.emplace_back("e" + std::to_string(i) + "-" + key);
+        versions.emplace_back(fmt::format("e{}-{}", i, key));
     }
     versions[1] = model;
     versions[3] = key;
