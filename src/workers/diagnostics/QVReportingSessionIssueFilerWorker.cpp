@@ -41,8 +41,7 @@ QVReportingSessionIssueFilerWorker::initWithSession(
         return nullptr;
     }
     auto worker = std::make_shared<QVReportingSessionIssueFilerWorker>(
-        platform.clock, platform.preferences, platform.issueFiler,
-        backOff->doubleValue());
+        platform.clock, platform.preferences, platform.issueFiler, backOff->doubleValue());
     worker->setSession(session);
     return worker;
 }
