@@ -8,6 +8,7 @@
 
 #include "QVReportingCtlSupport.h"
 #include "QVReportingJsonVariant.h"
+#include "values/ValueJson.h"
 
 namespace qv::client {
 
@@ -119,33 +120,8 @@ void checkDictionary(const Json& json, std::string_view what) {
     }
 }
 
-// Deepest nesting of arrays and objects in a line, strings skipped; stops counting once beyond
-// the limit.
-int nestingDepth(std::string_view text) {
-    int depth = 0;
-    int deepest = 0;
-    bool inString = false;
-    for (std::size_t i = 0; i < text.size() && deepest <= kMaxNesting; ++i) {
-        const char c = text[i];
-        if (inString) {
-            if (c == '\\') {
-                ++i;
-            } else if (c == '"') {
-                inString = false;
-            }
-        } else if (c == '"') {
-            inString = true;
-        } else if (c == '[' || c == '{') {
-            deepest = std::max(deepest, ++depth);
-        } else if (c == ']' || c == '}') {
-            --depth;
-        }
-    }
-    return deepest;
-}
-
 QVReportingReplayOperation parse(std::string_view text, std::size_t line) {
-    if (nestingDepth(text) > kMaxNesting) {
+    if (QVReportingJsonNestsDeeperThan(text, kMaxNesting)) {
         throw Bad{"nested more than " + std::to_string(kMaxNesting) + " deep"};
     }
     const Json object = Json::parse(text.begin(), text.end(), nullptr, false);

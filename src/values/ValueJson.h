@@ -19,6 +19,8 @@
 
 #include <nlohmann/json_fwd.hpp>
 
+#include <string_view>
+
 #include "values/Value.h"
 
 namespace qv {
@@ -31,6 +33,10 @@ nlohmann::ordered_json QVReportingDictionaryToJson(const Dictionary& dictionary)
 // files and of every sink line spend most of their time there). indent < 0 is the compact form.
 // False, with out as it was, when a string is not valid UTF-8: the caller decides what to do.
 bool QVReportingAppendJsonText(std::string& out, const Value& value, int indent = -1);
+
+// True when JSON text nests arrays and objects more than limit deep (strings skipped), checked
+// before parsing: the parser recurses once per level, so text from outside is refused first.
+bool QVReportingJsonNestsDeeperThan(std::string_view text, int limit);
 
 Value QVReportingValueFromJson(const nlohmann::ordered_json& json);
 Value QVReportingValueFromJson(const nlohmann::json& json);

@@ -64,34 +64,6 @@ double realNow() {
     return secondsOf(ts);
 }
 
-// Deepest nesting of arrays and objects in JSON text, strings skipped; stops counting once
-// beyond limit.
-int nestingDepth(std::string_view text, int limit) {
-    int depth = 0;
-    int deepest = 0;
-    bool inString = false;
-    for (std::size_t i = 0; i < text.size(); ++i) {
-        const char c = text[i];
-        if (inString) {
-            if (c == '\\') {
-                ++i;
-            } else if (c == '"') {
-                inString = false;
-            }
-        } else if (c == '"') {
-            inString = true;
-        } else if (c == '[' || c == '{') {
-            deepest = std::max(deepest, ++depth);
-            if (deepest > limit) {
-                break;
-            }
-        } else if (c == ']' || c == '}') {
-            --depth;
-        }
-    }
-    return deepest;
-}
-
 // Reads the whole file; false with errno set when it cannot.
 bool readAll(int fd, std::string& out) {
     char buffer[16384];
@@ -235,7 +207,7 @@ const Dictionary& LinuxPreferenceStore::loadLocked(const std::string& path, Prob
         entry.problem = path + " is too large to be a defaults file";
     } else if (!readAll(fd.get(), text)) {
         entry.problem = "cannot read " + path + ": " + errnoText(errno);
-    } else if (nestingDepth(text, kMaximumNesting) > kMaximumNesting) {
+    } else if (QVReportingJsonNestsDeeperThan(text, kMaximumNesting)) {
         entry.problem = path + " is nested too deeply";
     } else {
         const auto json = nlohmann::ordered_json::parse(text, nullptr, /*allow_exceptions=*/false);
