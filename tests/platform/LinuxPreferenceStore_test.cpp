@@ -105,6 +105,12 @@ TEST_F(ALinuxPreferenceStore, ReadsMalformedFilesAsEmptyReportsEachVersionOnceAn
 
     writeText(store.pathForSuite("deep"), std::string(100000, '[') + std::string(100000, ']'));
     EXPECT_TRUE(store.values("deep").empty());
+    // The JSON parser stops at a NUL byte: what follows one must not go unread.
+    const fs::path nul = store.pathForSuite("nul");
+    writeText(nul, std::string("{\"k\": 1}\0{\"k\": 2}", 19));
+    EXPECT_TRUE(store.values("nul").empty());
+    EXPECT_NE(errors.back().find(nul.string() + " is not valid JSON"), std::string::npos);
+    EXPECT_FALSE(store.setValue("nul", "k", Value(3)));
     fs::create_directory(store.pathForSuite("directory"));
     EXPECT_FALSE(store.setValue("directory", "k", Value(1)));
     writeText(bad, R"({"k": 5, "ok": true})");

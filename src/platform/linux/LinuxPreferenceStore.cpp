@@ -207,6 +207,9 @@ const Dictionary& LinuxPreferenceStore::loadLocked(const std::string& path, Prob
         entry.problem = path + " is too large to be a defaults file";
     } else if (!readAll(fd.get(), text)) {
         entry.problem = "cannot read " + path + ": " + errnoText(errno);
+    } else if (text.find('\0') != std::string::npos) {
+        // JSON text holds no NUL, and the parser would take one for the end of the file.
+        entry.problem = path + " is not valid JSON";
     } else if (QVReportingJsonNestsDeeperThan(text, kMaximumNesting)) {
         entry.problem = path + " is nested too deeply";
     } else {
