@@ -124,7 +124,10 @@ QVReportingReplayOperation parse(std::string_view text, std::size_t line) {
     if (QVReportingJsonNestsDeeperThan(text, kMaxNesting)) {
         throw Bad{"nested more than " + std::to_string(kMaxNesting) + " deep"};
     }
-    const Json object = Json::parse(text.begin(), text.end(), nullptr, false);
+    // The parser stops at a NUL byte, which JSON never holds: such a line is not JSON.
+    const Json object = text.find('\0') == std::string_view::npos
+                            ? Json::parse(text.begin(), text.end(), nullptr, false)
+                            : Json(Json::value_t::discarded);
     if (object.is_discarded()) {
         throw Bad{"not valid JSON"};
     }

@@ -1,8 +1,9 @@
 // LinuxDeviceInformation reading a device file made of the input.
 //
 // Properties:
-// - a file that is a JSON object is used and leaves no load error; anything else is reported as
-//   a load error naming the file, and then describes a customer build without capabilities;
+// - a file that is a JSON object holding no NUL byte is used and leaves no load error; anything
+//   else is reported as a load error naming the file, and then describes a customer build
+//   without capabilities;
 // - "InternalBuild" answers the file's boolean, nothing when it is missing or not a boolean, and
 //   always the override when one is given; no other key has an answer;
 // - a capability is present exactly when "capabilities" is an object whose member of that name
@@ -35,7 +36,9 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
     const qv::LinuxDeviceInformation device(path, "/var/lib/qvreportd/logs", override);
 
     const auto json = nlohmann::json::parse(text, nullptr, /*allow_exceptions=*/false);
-    const bool usable = !json.is_discarded() && json.is_object();
+    // The parser stops at a NUL byte; the reader refuses text that holds one.
+    const bool usable =
+        !json.is_discarded() && json.is_object() && text.find('\0') == std::string::npos;
     check(device.loadError().empty() == usable);
     if (!usable) {
         check(device.loadError().find(path) != std::string::npos);

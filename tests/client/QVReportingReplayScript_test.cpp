@@ -22,7 +22,7 @@ QVReportingReplayOperation parsed(const char* line) {
 }
 
 // The message of a line that must be refused ("" when it was accepted).
-std::string refusal(const char* line) {
+std::string refusal(std::string_view line) {
     auto result = QVReportingParseReplayLine(line, 1);
     auto* error = std::get_if<QVReportingReplayError>(&result);
     return error ? error->message : "";
@@ -71,6 +71,9 @@ TEST(AReplayScriptParser, RefusesMalformedLinesAndArgumentsOutsideTheirRange) {
         EXPECT_NE(message, "") << line;
         EXPECT_NE(message.find(reason), std::string::npos) << line << ": " << message;
     }
+    // The JSON parser stops at a NUL byte; the line must not pass for the part before it.
+    EXPECT_NE(refusal(std::string(R"({"op":"create","id":5})") + '\0' + "}").find("not valid JSON"),
+              std::string::npos);
     for (const char* line : {R"({"op":"create","id":9223372036854775807})",
                              R"({"op":"send","category":4294967295,"type":65535})",
                              R"({"op":"sleep","seconds":3600})"}) {

@@ -52,6 +52,7 @@ TEST(AnAccessoryFile, LoadsAWellFormedFileAndRefusesEverythingElseWithAReason) {
         {R"({"TELPVersionInfo": []})", "it has no \"CaseInfo\""},
         {R"({"TELPVersionInfo": [], "CaseInfo": [1]})", "its \"CaseInfo\" is not an object"},
         {"{\"TELPVersionInfo\": [\"\xff\"], \"CaseInfo\": {}}", "it is not JSON"},
+        {std::string(R"({"TELPVersionInfo": [], "CaseInfo": {}})") + '\0' + "x", "it is not JSON"},
         {R"({"TELPVersionInfo": [)" + deep + R"(], "CaseInfo": {}})", "nested deeper than 8"},
         {R"({"TELPVersionInfo": [], "CaseInfo": {}, "pad": ")" +
              std::string(kMaxAccessoryFileBytes, 'x') + "\"}",

@@ -112,6 +112,9 @@ AccessoryFileResult QVReportingReadAccessoryFile(const std::string& directory,
     }
     text.resize(length);
 
+    if (text.find('\0') != std::string::npos) {
+        return refused("it is not JSON");  // the parser would read up to the NUL only
+    }
     std::size_t deepest = 0;
     const auto json = nlohmann::ordered_json::parse(
         text,

@@ -5,6 +5,8 @@
 #include <cerrno>
 #include <cstring>
 #include <fstream>
+#include <iterator>
+#include <string>
 
 namespace qv {
 
@@ -12,9 +14,15 @@ LinuxDeviceInformation::LinuxDeviceInformation(const std::string& path,
                                                std::filesystem::path logsDirectory,
                                                std::optional<bool> internalBuildOverride)
     : logsDirectory_(std::move(logsDirectory)) {
-    std::ifstream in(path);
+    std::ifstream in(path, std::ios::binary);
     if (in) {
-        const auto doc = nlohmann::json::parse(in, nullptr, /*allow_exceptions=*/false);
+        const std::string text{std::istreambuf_iterator<char>(in),
+                               std::istreambuf_iterator<char>()};
+        // The parser takes a NUL byte for the end of the text; JSON holds none, so such a file
+        // is not one (rather than the part before the NUL).
+        const auto doc = text.find('\0') != std::string::npos
+                             ? nlohmann::json()
+                             : nlohmann::json::parse(text, nullptr, /*allow_exceptions=*/false);
         if (!doc.is_object()) {
             loadError_ = path + ": not a JSON object";
         } else {
