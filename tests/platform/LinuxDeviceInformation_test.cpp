@@ -42,7 +42,7 @@ TEST_F(ALinuxDeviceInformation, UsesAnObjectAndRefusesEverythingElseNamingTheFil
 
     // Text after a NUL byte would go unread by the parser: the file is not JSON.
     for (const std::string& text : {std::string("[true]"), std::string("{\"InternalBuild\": tru"),
-                                    std::string("{\"InternalBuild\": true}\0{", 25)}) {
+                                    std::string(R"({"InternalBuild": true})") + '\0' + "{"}) {
         const std::string path = write(text);
         LinuxDeviceInformation refused(path, dir, std::nullopt);
         EXPECT_NE(refused.loadError().find(path), std::string::npos) << text;

@@ -107,7 +107,7 @@ TEST_F(ALinuxPreferenceStore, ReadsMalformedFilesAsEmptyReportsEachVersionOnceAn
     EXPECT_TRUE(store.values("deep").empty());
     // The JSON parser stops at a NUL byte: what follows one must not go unread.
     const fs::path nul = store.pathForSuite("nul");
-    writeText(nul, std::string("{\"k\": 1}\0{\"k\": 2}", 19));
+    writeText(nul, std::string(R"({"k": 1})") + '\0' + R"({"k": 2})");
     EXPECT_TRUE(store.values("nul").empty());
     EXPECT_NE(errors.back().find(nul.string() + " is not valid JSON"), std::string::npos);
     EXPECT_FALSE(store.setValue("nul", "k", Value(3)));
