@@ -105,54 +105,14 @@ struct BenchPlatform {
 
     LinuxTaskExecutor executor;
 
-    // Services a benchmark puts in place of the Linux ones; those left null stay.
-    struct Replacements {
-        DeviceInformation* device = nullptr;
-        ProcessInfo* process = nullptr;
-        PreferenceStore* preferences = nullptr;
-        NotificationCenter* notifications = nullptr;
-        AnalyticsService* analytics = nullptr;
-        SystemCondition* condition = nullptr;
-        ConvoService* convo = nullptr;
-        BluetoothFacility* bluetooth = nullptr;
-        IssueCaptureService* issueCapture = nullptr;
-        IssueFilerService* issueFiler = nullptr;
-        DiagnosticRequestService* diagnostics = nullptr;
-        SpanTraceRecorder* spanTrace = nullptr;
-        ThreadlineModelReader* threadline = nullptr;
-        GaugeDataWriter* gaugeData = nullptr;
-        StatFeed* statFeed = nullptr;
-        ProcessLauncher* processLauncher = nullptr;
-        MTXMetricsService* mtx = nullptr;
-        EnergyLogService* energyLog = nullptr;
-        TaskExecutor* executor = nullptr;
-    };
+    Platform platform{
+        clock,     device,     process,   preferences,  notifications,   *analytics.service,
+        condition, convo,      bluetooth, issueCapture, issueFiler,      diagnostics,
+        spanTrace, threadline, gaugeData, statFeed,     processLauncher, mtx,
+        energyLog, executor};
 
-    // The platform with some services replaced, for a benchmark that brings its own.
-    Platform with(const Replacements& r) {
-        return Platform{clock,
-                        r.device ? *r.device : device,
-                        r.process ? *r.process : process,
-                        r.preferences ? *r.preferences : preferences,
-                        r.notifications ? *r.notifications : notifications,
-                        r.analytics ? *r.analytics : *analytics.service,
-                        r.condition ? *r.condition : condition,
-                        r.convo ? *r.convo : convo,
-                        r.bluetooth ? *r.bluetooth : bluetooth,
-                        r.issueCapture ? *r.issueCapture : issueCapture,
-                        r.issueFiler ? *r.issueFiler : issueFiler,
-                        r.diagnostics ? *r.diagnostics : diagnostics,
-                        r.spanTrace ? *r.spanTrace : spanTrace,
-                        r.threadline ? *r.threadline : threadline,
-                        r.gaugeData ? *r.gaugeData : gaugeData,
-                        r.statFeed ? *r.statFeed : statFeed,
-                        r.processLauncher ? *r.processLauncher : processLauncher,
-                        r.mtx ? *r.mtx : mtx,
-                        r.energyLog ? *r.energyLog : energyLog,
-                        r.executor ? *r.executor : executor};
-    }
-
-    Platform platform = with({});
+    // The platform with some services replaced, for a caller that brings its own.
+    Platform with(const PlatformReplacements& r) const { return withReplacements(platform, r); }
 };
 
 }  // namespace qv::bench

@@ -24,6 +24,7 @@
 #include <memory>
 #include <string>
 
+#include "BenchPayload.h"
 #include "BenchPlatform.h"
 #include "session/QVReportingSession.h"
 #include "session/QVReportingStats.h"
@@ -61,18 +62,7 @@ Env& env() {
 
 // Ten keys of the usual kinds, as a client reports a playback state; a new time on each.
 Dictionary payload(std::int64_t seq, double now) {
-    return Dictionary{
-        {"qvreporting_timestamp", now + static_cast<double>(seq) * 0.0137},
-        {"session_selected_format", "lpcm-48000-2ch-f32"},
-        {"active_devices", "Speaker"},
-        {"KXSessionVolume", 0.5 + static_cast<double>(seq % 7) / 100.0},
-        {"session_output_running", true},
-        {"mChannelsPerFrame", 2},
-        {"sequence", seq},
-        {"route", "BuiltInSpeaker"},
-        {"latency_ms", 11.6},
-        {"format", Dictionary{{"rate", 48000}, {"bits", 32}}},
-    };
+    return bench::playbackPayload(seq, now + static_cast<double>(seq) * 0.0137);
 }
 
 // A started generic session whose Convo session (if it has the worker) is live.

@@ -18,6 +18,7 @@
 #include <string>
 #include <vector>
 
+#include "BenchPayload.h"
 #include "BenchPlatform.h"
 #include "session/QVReportingSession.h"
 #include "session/QVReportingWorkerRegistry.h"
@@ -42,18 +43,7 @@ Env& env() {
 }
 
 Dictionary payload(std::int64_t seq, double now) {
-    return Dictionary{
-        {"qvreporting_timestamp", now},
-        {"session_selected_format", "lpcm-48000-2ch-f32"},
-        {"active_devices", "Speaker"},
-        {"KXSessionVolume", 0.5 + static_cast<double>(seq % 7) / 100.0},
-        {"session_output_running", true},
-        {"mChannelsPerFrame", 2},
-        {"sequence", seq},
-        {"route", "BuiltInSpeaker"},
-        {"latency_ms", 11.6},
-        {"format", Dictionary{{"rate", 48000}, {"bits", 32}}},
-    };
+    return bench::playbackPayload(seq, now);
 }
 
 std::shared_ptr<QVReportingSession> filledSession(std::int64_t stored) {

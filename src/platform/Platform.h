@@ -49,4 +49,52 @@ struct Platform {
     TaskExecutor& executor;
 };
 
+// Services to put in place of a platform's own; those left null stay. Tests and benchmarks use it
+// to bring one service of their own while keeping the rest.
+struct PlatformReplacements {
+    DeviceInformation* device = nullptr;
+    ProcessInfo* process = nullptr;
+    PreferenceStore* preferences = nullptr;
+    NotificationCenter* notifications = nullptr;
+    AnalyticsService* analytics = nullptr;
+    SystemCondition* condition = nullptr;
+    ConvoService* convo = nullptr;
+    BluetoothFacility* bluetooth = nullptr;
+    IssueCaptureService* issueCapture = nullptr;
+    IssueFilerService* issueFiler = nullptr;
+    DiagnosticRequestService* diagnostics = nullptr;
+    SpanTraceRecorder* spanTrace = nullptr;
+    ThreadlineModelReader* threadline = nullptr;
+    GaugeDataWriter* gaugeData = nullptr;
+    StatFeed* statFeed = nullptr;
+    ProcessLauncher* processLauncher = nullptr;
+    MTXMetricsService* mtx = nullptr;
+    EnergyLogService* energyLog = nullptr;
+    TaskExecutor* executor = nullptr;
+};
+
+// base with r's services in place of its own.
+inline Platform withReplacements(const Platform& base, const PlatformReplacements& r) {
+    return Platform{base.clock,
+                    r.device ? *r.device : base.device,
+                    r.process ? *r.process : base.process,
+                    r.preferences ? *r.preferences : base.preferences,
+                    r.notifications ? *r.notifications : base.notifications,
+                    r.analytics ? *r.analytics : base.analytics,
+                    r.condition ? *r.condition : base.condition,
+                    r.convo ? *r.convo : base.convo,
+                    r.bluetooth ? *r.bluetooth : base.bluetooth,
+                    r.issueCapture ? *r.issueCapture : base.issueCapture,
+                    r.issueFiler ? *r.issueFiler : base.issueFiler,
+                    r.diagnostics ? *r.diagnostics : base.diagnostics,
+                    r.spanTrace ? *r.spanTrace : base.spanTrace,
+                    r.threadline ? *r.threadline : base.threadline,
+                    r.gaugeData ? *r.gaugeData : base.gaugeData,
+                    r.statFeed ? *r.statFeed : base.statFeed,
+                    r.processLauncher ? *r.processLauncher : base.processLauncher,
+                    r.mtx ? *r.mtx : base.mtx,
+                    r.energyLog ? *r.energyLog : base.energyLog,
+                    r.executor ? *r.executor : base.executor};
+}
+
 }  // namespace qv
