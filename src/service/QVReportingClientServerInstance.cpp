@@ -57,6 +57,7 @@ QVReportingClientServerInstance::QVReportingClientServerInstance(
       delegate_(delegate),
       platform_(platform),
       queue_(queue),
+      lane_(queue.makeLane()),
       maxSessions_(maxSessions) {
     QVLOG_DEFAULT(QVReportingClientCategory(), "new client with pid {}", pid);
 }
@@ -71,37 +72,78 @@ void QVReportingClientServerInstance::setExitHook(std::function<void(int)> hook)
     gExitHook = std::move(hook);
 }
 
-std::vector<std::shared_ptr<QVReportingSession>> QVReportingClientServerInstance::sessions() const {
+template <typename Keys>
+std::vector<std::shared_ptr<QVReportingSession>> QVReportingClientServerInstance::sessionsOf(
+    const Keys& keys, std::size_t limit) const {
     std::vector<std::shared_ptr<QVReportingSession>> out;
-    out.reserve(order_.size());
-    for (ReporterID id : order_) {
-        out.push_back(sessionMap_.at(id));
+    out.reserve(std::min(limit, keys.size()));
+    for (const auto& [order, id] : keys) {
+        if (out.size() == limit) {
+            break;
+        }
+        out.push_back(sessionMap_.at(id).session);
     }
     return out;
+}
+
+std::vector<std::shared_ptr<QVReportingSession>> QVReportingClientServerInstance::sessions(
+    std::size_t limit) const {
+    return sessionsOf(order_, limit);
+}
+
+std::vector<std::shared_ptr<QVReportingSession>> QVReportingClientServerInstance::activeSessions(
+    std::size_t limit) const {
+    return sessionsOf(started_, limit);
+}
+
+std::vector<ReporterID> QVReportingClientServerInstance::reporterIDs() const {
+    std::vector<ReporterID> ids;
+    ids.reserve(order_.size());
+    for (const auto& [order, id] : order_) {
+        ids.push_back(id);
+    }
+    return ids;
 }
 
 std::shared_ptr<QVReportingSession> QVReportingClientServerInstance::findReportingSessionForID(
     ReporterID id, bool acrossAllClients) {
     if (auto it = sessionMap_.find(id); it != sessionMap_.end()) {
-        return it->second;
+        return it->second.session;
     }
     return acrossAllClients ? delegate_.findReportingSessionForID(id) : nullptr;
+}
+
+void QVReportingClientServerInstance::noteStarted(ReporterID id, const Entry& entry) {
+    if (entry.session->started()) {
+        started_.insert_or_assign(entry.order, id);
+    } else {
+        started_.erase(entry.order);
+    }
 }
 
 void QVReportingClientServerInstance::storeSession(ReporterID id,
                                                    std::shared_ptr<QVReportingSession> session) {
     session->setClientProcessName(clientProcessName_);
-    auto [it, inserted] = sessionMap_.try_emplace(id, session);
+    auto [it, inserted] = sessionMap_.try_emplace(id, Entry{session, nextOrder_});
     if (inserted) {
-        order_.push_back(id);
-        return;
+        order_.emplace(nextOrder_++, id);
+    } else {
+        const auto replaced = std::exchange(it->second.session, std::move(session));
+        answerHeldStart(*replaced);
     }
-    const auto replaced = std::exchange(it->second, std::move(session));
-    answerHeldStart(*replaced);
+    noteStarted(id, it->second);
+}
+
+void QVReportingClientServerInstance::stopActiveSessions() {
+    for (const auto& session : activeSessions()) {
+        session->stop();
+        answerHeldStart(*session);
+    }
+    started_.clear();
 }
 
 void QVReportingClientServerInstance::createReportingSession(ReporterID id, BoolReply reply) {
-    queue_.async([self = shared_from_this(), id, reply = std::move(reply)] {
+    queue_.async(lane_, [self = shared_from_this(), id, reply = std::move(reply)] {
         const auto& log = QVReportingClientCategory();
         QVLOG_DEBUG(log, "creating session for reporter {}", id);
         if (!self->sessionMap_.contains(id) && self->sessionMap_.size() >= self->maxSessions_) {
@@ -117,13 +159,14 @@ void QVReportingClientServerInstance::createReportingSession(ReporterID id, Bool
         self->storeSession(
             id, QVReportingSession::initWithID(self->platform_, id, {self->processIdentifier_}));
         QVLOG_DEFAULT(log, "session created for reporter {}", id);
+        self->delegate_.noteSessionCount();
         reply(std::nullopt, true);
     });
 }
 
 void QVReportingClientServerInstance::setServiceType(AudioServiceType serviceType, ReporterID id,
                                                      BoolReply reply) {
-    queue_.async([self = shared_from_this(), serviceType, id, reply = std::move(reply)] {
+    queue_.async(lane_, [self = shared_from_this(), serviceType, id, reply = std::move(reply)] {
         const auto& log = QVReportingClientCategory();
         QVLOG_DEBUG(log, "setting service type {} for reporter {}", serviceType, id);
         auto session = id != 0 ? self->findReportingSessionForID(id, false) : nullptr;
@@ -148,7 +191,7 @@ void QVReportingClientServerInstance::setServiceType(AudioServiceType serviceTyp
 
 void QVReportingClientServerInstance::getServiceNameForReporterID(ReporterID id,
                                                                   ServiceTypeReply reply) {
-    queue_.async([self = shared_from_this(), id, reply = std::move(reply)] {
+    queue_.async(lane_, [self = shared_from_this(), id, reply = std::move(reply)] {
         const auto& log = QVReportingClientCategory();
         QVLOG_DEBUG(log, "fetching seviceType");
         if (id == 0) {
@@ -164,8 +207,8 @@ void QVReportingClientServerInstance::getServiceNameForReporterID(ReporterID id,
 
 void QVReportingClientServerInstance::setConfiguration(Dictionary configuration, ReporterID id,
                                                        BoolReply reply) {
-    queue_.async([self = shared_from_this(), configuration = std::move(configuration), id,
-                  reply = std::move(reply)] {
+    queue_.async(lane_, [self = shared_from_this(), configuration = std::move(configuration), id,
+                         reply = std::move(reply)] {
         QVLOG_DEBUG(QVReportingClientCategory(), "setting configuration");
         if (auto session = self->findReportingSessionForID(id, false)) {
             session->updateConfigurationWithContentsOfConfiguration(&configuration);
@@ -175,7 +218,7 @@ void QVReportingClientServerInstance::setConfiguration(Dictionary configuration,
 }
 
 void QVReportingClientServerInstance::startReportingSessionForID(ReporterID id, BoolReply reply) {
-    queue_.async([self = shared_from_this(), id, reply = once(std::move(reply))] {
+    queue_.async(lane_, [self = shared_from_this(), id, reply = once(std::move(reply))] {
         QVLOG_DEBUG(QVReportingClientCategory(), "starting session for reporter {}", id);
         auto session = id != 0 ? self->findReportingSessionForID(id, false) : nullptr;
         if (!session) {
@@ -186,6 +229,7 @@ void QVReportingClientServerInstance::startReportingSessionForID(ReporterID id, 
             return;  // this call is never answered; the first start's reply is still held
         }
         session->start();
+        self->noteStarted(id, self->sessionMap_.at(id));
         answerHeldStart(*session);
         session->setTransactionCompleteBlock([reply](bool result) { reply(std::nullopt, result); });
         if (session->serviceType() == service::kTest &&
@@ -203,8 +247,8 @@ void QVReportingClientServerInstance::sendMessage(Dictionary payload, AudioEvent
         delegate_.isReportingEnabled()) {
         payload.set("sendSingleMessage", 1);
     }
-    queue_.async([self = shared_from_this(), payload = std::move(payload), category, type,
-                  ids = std::move(ids), reply = std::move(reply)]() mutable {
+    queue_.async(lane_, [self = shared_from_this(), payload = std::move(payload), category, type,
+                         ids = std::move(ids), reply = std::move(reply)]() mutable {
         QVLOG_DEBUG(QVReportingClientCategory(), "sending message for reporter {}",
                     describeIDs(ids));
         if (!self->delegate_.isReportingEnabled()) {
@@ -225,7 +269,7 @@ void QVReportingClientServerInstance::sendMessage(Dictionary payload, AudioEvent
 }
 
 void QVReportingClientServerInstance::stopReportingSessionForID(ReporterID id, BoolReply reply) {
-    queue_.async([self = shared_from_this(), id, reply = std::move(reply)] {
+    queue_.async(lane_, [self = shared_from_this(), id, reply = std::move(reply)] {
         const auto& log = QVReportingClientCategory();
         QVLOG_DEBUG(log, "stopping session for reporter {}", id);
         if (id == 0) {
@@ -235,6 +279,7 @@ void QVReportingClientServerInstance::stopReportingSessionForID(ReporterID id, B
         auto session = self->findReportingSessionForID(id, false);
         if (session && session->started()) {
             session->stop();
+            self->noteStarted(id, self->sessionMap_.at(id));
             answerHeldStart(*session);
             self->delegate_.logReportingSessions();
         } else {
@@ -250,7 +295,7 @@ void QVReportingClientServerInstance::stopReportingSessionForID(ReporterID id, B
 }
 
 void QVReportingClientServerInstance::destroyReportingSession(ReporterID id, BoolReply reply) {
-    queue_.async([self = shared_from_this(), id, reply = std::move(reply)] {
+    queue_.async(lane_, [self = shared_from_this(), id, reply = std::move(reply)] {
         const auto& log = QVReportingClientCategory();
         QVLOG_DEBUG(log, "destroying session for reporter {}", id);
         if (id == 0) {
@@ -258,13 +303,14 @@ void QVReportingClientServerInstance::destroyReportingSession(ReporterID id, Boo
             return;
         }
         if (auto it = self->sessionMap_.find(id); it != self->sessionMap_.end()) {
-            auto session = it->second;
+            auto session = it->second.session;
             if (session->started()) {
                 session->stop();
             }
             answerHeldStart(*session);
+            self->order_.erase(it->second.order);
+            self->started_.erase(it->second.order);
             self->sessionMap_.erase(it);
-            std::erase(self->order_, id);
         }
         QVLOG_DEFAULT(log, "destroying {}", id);
         self->delegate_.logReportingSessions();
@@ -273,7 +319,7 @@ void QVReportingClientServerInstance::destroyReportingSession(ReporterID id, Boo
 }
 
 void QVReportingClientServerInstance::reporterIDValid(ReporterID id, DictionaryReply reply) {
-    queue_.async([self = shared_from_this(), id, reply = std::move(reply)] {
+    queue_.async(lane_, [self = shared_from_this(), id, reply = std::move(reply)] {
         QVLOG_DEBUG(QVReportingClientCategory(), "validating reporter {}", id);
         Dictionary result{{dbus::kReporterProxyKeyReporterID, std::int64_t{0}},
                           {dbus::kReporterProxyKeyServiceType, std::uint64_t{service::kUnknown}}};
@@ -286,7 +332,7 @@ void QVReportingClientServerInstance::reporterIDValid(ReporterID id, DictionaryR
 }
 
 void QVReportingClientServerInstance::getAllReporters(ReportersReply reply) {
-    queue_.async([self = shared_from_this(), reply = std::move(reply)] {
+    queue_.async(lane_, [self = shared_from_this(), reply = std::move(reply)] {
         std::vector<ReporterID> all;
         for (const auto& client : self->delegate_.getAllClients()) {
             const auto ids = client->reporterIDs();
@@ -322,18 +368,17 @@ void QVReportingClientServerInstance::killService() {
 }
 
 void QVReportingClientServerInstance::handleConnectionError() {
-    queue_.async([self = shared_from_this()] {
+    queue_.async(lane_, [self = shared_from_this()] {
         const auto clients = self->delegate_.getAllClients();
         if (std::find(clients.begin(), clients.end(), self) == clients.end()) {
             return;
         }
-        for (const auto& session : self->sessions()) {
-            if (session->started()) {
-                session->stop();
-            }
+        for (const auto& session : self->activeSessions()) {
+            session->stop();
         }
         self->sessionMap_.clear();
         self->order_.clear();
+        self->started_.clear();
         self->delegate_.removeClient(self);
         QVLOG_DEFAULT(QVReportingClientCategory(), "removing {} from the server client list",
                       self->processIdentifier_);

@@ -8,6 +8,7 @@
 
 #include <cstdint>
 #include <functional>
+#include <map>
 #include <memory>
 #include <optional>
 #include <string>
@@ -35,6 +36,8 @@ class QVReportingServiceDelegateProtocol {
         const std::vector<ReporterID>& ids) = 0;
     virtual void removeClient(const std::shared_ptr<QVReportingClientServerInstance>& client) = 0;
     virtual void logReportingSessions() = 0;
+    // Sessions were created or dropped: the guardrail counters follow.
+    virtual void noteSessionCount() = 0;
 };
 
 class QVReportingClientServerInstance
@@ -84,9 +87,19 @@ class QVReportingClientServerInstance
     void setClientStartDate(double secondsSince1970) { clientStartDate_ = secondsSince1970; }
     const std::string& clientProcessName() const { return clientProcessName_; }
     void setClientProcessName(std::string name) { clientProcessName_ = std::move(name); }
-    // The client's sessions, in the order their IDs were first created.
-    std::vector<std::shared_ptr<QVReportingSession>> sessions() const;
-    std::vector<ReporterID> reporterIDs() const { return order_; }
+    // The client's sessions, in the order their IDs were first created; at most limit of them.
+    std::vector<std::shared_ptr<QVReportingSession>> sessions(std::size_t limit = SIZE_MAX) const;
+    // The started ones among them, in the same order.
+    std::vector<std::shared_ptr<QVReportingSession>> activeSessions(
+        std::size_t limit = SIZE_MAX) const;
+    std::vector<ReporterID> reporterIDs() const;
+    std::size_t sessionCount() const { return sessionMap_.size(); }
+    std::size_t activeSessionCount() const { return started_.size(); }
+    // Stops every started session and answers its held start call (a normal shutdown).
+    void stopActiveSessions();
+    // The lane of the server queue this client's work runs on: the client's calls keep their
+    // order, and take turns with other clients' calls.
+    const SerialQueue::Lane& lane() const { return lane_; }
     // With acrossAllClients, a miss here is looked up in every client.
     std::shared_ptr<QVReportingSession> findReportingSessionForID(ReporterID id,
                                                                   bool acrossAllClients);
@@ -95,17 +108,33 @@ class QVReportingClientServerInstance
     static void setExitHook(std::function<void(int)> hook);
 
   private:
+    struct Entry {
+        std::shared_ptr<QVReportingSession> session;
+        std::uint64_t order;  // when its ID was first created: the key of order_ and started_
+    };
+
     void storeSession(ReporterID id, std::shared_ptr<QVReportingSession> session);
+    // Lists the session among the started ones, or not, as it now is.
+    void noteStarted(ReporterID id, const Entry& entry);
+    template <typename Keys>
+    std::vector<std::shared_ptr<QVReportingSession>> sessionsOf(const Keys& keys,
+                                                                std::size_t limit) const;
 
     const std::int64_t processIdentifier_;
     QVReportingServiceDelegateProtocol& delegate_;
     const Platform& platform_;
     SerialQueue& queue_;
+    const SerialQueue::Lane lane_;
     const std::size_t maxSessions_;
     std::optional<double> clientStartDate_;
     std::string clientProcessName_;
-    std::unordered_map<ReporterID, std::shared_ptr<QVReportingSession>> sessionMap_;
-    std::vector<ReporterID> order_;  // the map's keys in creation order
+    // Every lookup, create, start, stop and destroy costs the same however many sessions are held:
+    // the map finds a session, and two ordered indexes keep the creation order of all sessions
+    // and of the started ones.
+    std::unordered_map<ReporterID, Entry> sessionMap_;
+    std::map<std::uint64_t, ReporterID> order_;
+    std::map<std::uint64_t, ReporterID> started_;
+    std::uint64_t nextOrder_ = 0;
 };
 
 }  // namespace qv

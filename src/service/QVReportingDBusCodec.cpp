@@ -22,6 +22,7 @@ class Reader {
     std::optional<QVReportingStats::Limit> limit;
     Dictionary topLevel;
     std::string key;  // the top-level key being read, for error messages
+    std::size_t bytes() const { return bytes_; }
 
   private:
     bool atEnd(std::string& type, std::string& contents) {
@@ -51,6 +52,10 @@ class Reader {
     }
     bool refuse(QVReportingStats::Limit which, std::string why) {
         limit = which;
+        // The key tells the client which part of its payload to look at.
+        if (!key.empty()) {
+            why += fmt::format(" (passed at the value under \"{}\")", key);
+        }
         error = QVReportingError::limitsExceeded(std::move(why));
         return false;
     }
@@ -227,11 +232,11 @@ bool Reader::readDictionary(const std::string& entrySignature, std::size_t depth
         std::string name;
         if (stringKeys) {
             m_ >> name;
-            if (!charge(name.size() + 5)) {
-                return false;
-            }
             if (isTopLevel) {
                 key.assign(name);  // named in errors; its buffer is reused entry after entry
+            }
+            if (!charge(name.size() + 5)) {
+                return false;
             }
         } else if (!countValue() || !read(entryDepth, k)) {
             return false;
@@ -293,10 +298,14 @@ QVReportingDecodeResult QVReportingReadDictionary(sdbus::Message& message,
             reader.error = QVReportingError::invalidArgs("the payload ended early");
         }
     } catch (const sdbus::Error& e) {
-        reader.error = QVReportingError::invalidArgs(e.getMessage());
+        reader.error = QVReportingError::invalidArgs(
+            reader.key.empty() ? e.getMessage()
+                               : fmt::format("the value under \"{}\" cannot be read: {}",
+                                             reader.key, e.getMessage()));
     }
     result.error = std::move(reader.error);
     result.limit = reader.limit;
+    result.bytes = reader.bytes();
     if (!result.error) {
         result.dictionary = std::move(reader.topLevel);
     }

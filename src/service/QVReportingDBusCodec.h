@@ -34,6 +34,8 @@ struct QVReportingDecodeResult {
     // Set when the input was refused; the limit (when it was one) is in limit.
     std::optional<QVReportingError> error;
     std::optional<QVReportingStats::Limit> limit;
+    // What the input cost against the budget's bytes (about its size on the wire).
+    std::size_t bytes = 0;
 };
 
 // Reads an a{sv} at the message's current position.

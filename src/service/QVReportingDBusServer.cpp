@@ -40,7 +40,12 @@ sdbus::Error toBusError(const QVReportingError& e) {
 QVReportingDBusServer::QVReportingDBusServer(std::unique_ptr<sdbus::IConnection> connection,
                                              QVReportingService& service,
                                              LinuxNotificationCenter* notifications)
-    : connection_(std::move(connection)), service_(service), notifications_(notifications) {
+    : connection_(std::move(connection)),
+      service_(service),
+      notifications_(notifications),
+      limits_(service.limits()),
+      lifeline_(std::make_shared<Lifeline>()) {
+    lifeline_->server = this;
     wakeFd_ = eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK);
     if (wakeFd_ < 0) {
         throw sdbus::Error("org.freedesktop.DBus.Error.Failed", "eventfd failed");
@@ -48,6 +53,10 @@ QVReportingDBusServer::QVReportingDBusServer(std::unique_ptr<sdbus::IConnection>
 }
 
 QVReportingDBusServer::~QVReportingDBusServer() {
+    {
+        std::lock_guard lock(lifeline_->mutex);
+        lifeline_->server = nullptr;
+    }
     stop();
     ::close(wakeFd_);
 }
@@ -146,10 +155,35 @@ void QVReportingDBusServer::loop() {
     pthread_setname_np(pthread_self(), "qvreportd-bus");
     while (!stopping_) {
         try {
-            while (connection_->processPendingRequest()) {
+            if (callBytes_ >= limits_.maxCallBytes) {
+                // Past the budget of all clients: leave what the bus sends where it is until the
+                // work taken in drains; answers reach this thread through post().
+                if (!readsPaused_) {
+                    readsPaused_ = true;
+                    QVReportingStats::shared().noteBusReadsPaused();
+                    QVLOG_ERROR(logCategory(),
+                                "calls not yet answered take {} bytes (at most {}): reading the "
+                                "bus again when they drain",
+                                callBytes_, limits_.maxCallBytes);
+                }
+                pollfd wake{wakeFd_, POLLIN, 0};
+                if (::poll(&wake, 1, -1) < 0 && errno != EINTR) {
+                    QVLOG_ERROR(logCategory(), "poll failed: {}", errno);
+                }
+                drainPosted();
+                continue;
+            }
+            if (readsPaused_) {
+                readsPaused_ = false;
+                QVLOG_DEFAULT(logCategory(), "reading the bus again");
+            }
+            while (callBytes_ < limits_.maxCallBytes && connection_->processPendingRequest()) {
                 if (stopping_) {
                     return;
                 }
+            }
+            if (callBytes_ >= limits_.maxCallBytes) {
+                continue;
             }
             const auto data = connection_->getEventLoopPollData();
             int timeoutMs = -1;
@@ -177,25 +211,48 @@ void QVReportingDBusServer::loop() {
     }
 }
 
-std::shared_ptr<QVReportingClientServerInstance> QVReportingDBusServer::clientFor(
-    sdbus::MethodCall& call) {
-    const std::string sender = call.getSender();
-    if (auto it = clients_.find(sender); it != clients_.end()) {
-        return it->second;
-    }
-    // Asking the bus for the peer's PID is a round trip: done once per connection.
-    std::int64_t pid = 0;
-    try {
-        pid = call.getCredsPid();
-    } catch (const sdbus::Error& e) {
-        QVLOG_ERROR(logCategory(), "no process ID for {}: {}", sender, e.getMessage());
-    }
-    auto client = service_.acceptConnection(pid);
-    if (client) {
-        clients_.emplace(sender, client);
+QVReportingDBusServer::Client* QVReportingDBusServer::admit(sdbus::MethodCall& call, bool held) {
+    std::string sender = call.getSender();
+    auto it = clients_.find(sender);
+    if (it == clients_.end()) {
+        // Asking the bus for the peer's PID is a round trip: done once per connection.
+        std::int64_t pid = 0;
+        try {
+            pid = call.getCredsPid();
+        } catch (const sdbus::Error& e) {
+            QVLOG_ERROR(logCategory(), "no process ID for {}: {}", sender, e.getMessage());
+        }
+        auto instance = service_.acceptConnection(pid);
+        if (!instance) {
+            refuse(call, QVReportingError::limitsExceeded("too many clients"));
+            return nullptr;
+        }
+        it = clients_.emplace(std::move(sender), Client{std::move(instance)}).first;
         clientCount_ = clients_.size();
     }
-    return client;
+    Client& client = it->second;
+    // Checked before the arguments are read, so a refusal costs next to nothing.
+    std::optional<QVReportingStats::Limit> over;
+    std::string why;
+    if (held && client.heldCalls >= limits_.maxHeldCallsPerClient) {
+        over = QVReportingStats::Limit::HeldCallsPerClient;
+        why = fmt::format("a client may have at most {} start calls waiting for their sessions",
+                          limits_.maxHeldCallsPerClient);
+    } else if (held && heldCalls_ >= limits_.maxHeldCalls) {
+        over = QVReportingStats::Limit::HeldCalls;
+        why =
+            fmt::format("at most {} start calls may wait for their sessions", limits_.maxHeldCalls);
+    } else if (client.callBytes >= limits_.maxCallBytesPerClient) {
+        over = QVReportingStats::Limit::CallBytesPerClient;
+        why = fmt::format("a client's calls not yet answered may take at most {} bytes",
+                          limits_.maxCallBytesPerClient);
+    }
+    if (over) {
+        QVReportingStats::shared().noteLimitExceeded(*over);
+        refuse(call, QVReportingError::limitsExceeded(std::move(why)));
+        return nullptr;
+    }
+    return &client;
 }
 
 void QVReportingDBusServer::onNameOwnerChanged(sdbus::Message& signal) {
@@ -204,35 +261,84 @@ void QVReportingDBusServer::onNameOwnerChanged(sdbus::Message& signal) {
     if (!newOwner.empty()) {
         return;
     }
-    // Calls still held for the departed name can never be answered.
-    std::erase_if(pending_, [&](const auto& entry) { return entry.second.sender == name; });
+    // Calls still kept for the departed name can never be answered.
+    std::erase_if(pending_, [&](const auto& entry) {
+        if (entry.second.sender != name) {
+            return false;
+        }
+        callBytes_ -= entry.second.bytes;
+        heldCalls_ -= entry.second.held ? 1 : 0;
+        return true;
+    });
+    noteBudgets();
     auto it = clients_.find(name);
     if (it == clients_.end()) {
         return;
     }
-    auto client = std::move(it->second);
+    auto client = std::move(it->second.instance);
     clients_.erase(it);
     clientCount_ = clients_.size();
     QVLOG_DEFAULT(logCategory(), "interruptionHandler: connection exited");
     service_.connectionInvalidated(client);
 }
 
-QVReportingDBusServer::CallID QVReportingDBusServer::hold(sdbus::MethodCall call) {
-    const CallID id = nextCallID_++;
-    std::string sender = call.getSender();
-    pending_.emplace(id, Pending{std::move(call), std::move(sender)});
-    return id;
+QVReportingDBusServer::Ticket::~Ticket() {
+    if (answered) {
+        return;
+    }
+    // No answer will come (the rules give this call none): let it go.
+    std::lock_guard lock(lifeline->mutex);
+    if (auto* server = lifeline->server) {
+        server->post([server, id = id] { server->release(id); });
+    }
 }
 
-void QVReportingDBusServer::answer(CallID id, const std::optional<QVReportingError>& error,
+QVReportingDBusServer::TicketPtr QVReportingDBusServer::hold(sdbus::MethodCall call, Client& client,
+                                                             std::size_t argumentBytes, bool held) {
+    const CallID id = nextCallID_++;
+    // A held call waits on its session, not on the queue: it is kept within the count of held
+    // calls instead of the bytes of calls in flight.
+    const std::size_t bytes = held ? 0 : QVReportingStats::kCallOverheadBytes + argumentBytes;
+    client.callBytes += bytes;
+    client.heldCalls += held ? 1 : 0;
+    callBytes_ += bytes;
+    heldCalls_ += held ? 1 : 0;
+    std::string sender = call.getSender();
+    pending_.emplace(id, Pending{std::move(call), std::move(sender), bytes, held});
+    noteBudgets();
+    return std::make_shared<Ticket>(lifeline_, id);
+}
+
+sdbus::MethodCall QVReportingDBusServer::release(CallID id) {
+    auto it = pending_.find(id);
+    if (it == pending_.end()) {
+        return {};  // the caller left the bus
+    }
+    Pending pending = std::move(it->second);
+    pending_.erase(it);
+    callBytes_ -= pending.bytes;
+    heldCalls_ -= pending.held ? 1 : 0;
+    if (auto c = clients_.find(pending.sender); c != clients_.end()) {
+        c->second.callBytes -= pending.bytes;
+        c->second.heldCalls -= pending.held ? 1 : 0;
+    }
+    noteBudgets();
+    return std::move(pending.call);
+}
+
+void QVReportingDBusServer::noteBudgets() const {
+    QVReportingStats::shared().noteCallBudget(callBytes_, heldCalls_);
+}
+
+void QVReportingDBusServer::answer(const TicketPtr& ticket,
+                                   const std::optional<QVReportingError>& error,
                                    std::function<void(sdbus::MethodReply&)> fill) {
-    post([this, id, error, fill = std::move(fill)] {
-        auto it = pending_.find(id);
-        if (it == pending_.end()) {
-            return;  // the caller left the bus
+    ticket->answered = true;
+    post([this, id = ticket->id, error, fill = std::move(fill)] {
+        sdbus::MethodCall call = release(id);
+        if (!call.isValid() || call.doesntExpectReply()) {
+            return;
         }
-        sdbus::MethodCall call = std::move(it->second.call);
-        pending_.erase(it);
         if (error) {
             call.createErrorReply(toBusError(*error)).send();
             return;
@@ -245,146 +351,160 @@ void QVReportingDBusServer::answer(CallID id, const std::optional<QVReportingErr
     });
 }
 
-void QVReportingDBusServer::answerNow(sdbus::MethodCall& call, const QVReportingError& error) {
-    call.createErrorReply(toBusError(error)).send();
+void QVReportingDBusServer::refuse(sdbus::MethodCall& call, const QVReportingError& error) {
+    if (!call.doesntExpectReply()) {
+        call.createErrorReply(toBusError(error)).send();
+    }
 }
 
 void QVReportingDBusServer::registerReportingInterface() {
     reporting_ = sdbus::createObject(*connection_, dbus::kObjectPath);
     const std::string iface = dbus::kInterface;
-    const QVReportingLimits& limits = service_.limits();
-    const QVReportingInputBudget budget{limits.maxPayloadBytes, limits.maxPayloadValues,
-                                        limits.maxPayloadDepth};
+    const QVReportingInputBudget budget{limits_.maxPayloadBytes, limits_.maxPayloadValues,
+                                        limits_.maxPayloadDepth};
 
-    auto boolReply = [this](CallID id) {
-        return [this, id](const std::optional<QVReportingError>& error, bool result) {
-            answer(id, error, [result](sdbus::MethodReply& r) { r << result; });
+    auto boolReply = [this](TicketPtr ticket) {
+        return [this, ticket](const std::optional<QVReportingError>& error, bool result) {
+            answer(ticket, error, [result](sdbus::MethodReply& r) { r << result; });
         };
+    };
+    // Reads a payload or configuration; false (the call refused and counted) when it is not one.
+    auto readPayload = [this, budget](sdbus::MethodCall& call, QVReportingDecodeResult& decoded) {
+        decoded = QVReportingReadDictionary(call, budget);
+        if (!decoded.error) {
+            return true;
+        }
+        decoded.limit ? QVReportingStats::shared().noteLimitExceeded(*decoded.limit)
+                      : QVReportingStats::shared().noteInputRefused();
+        refuse(call, *decoded.error);
+        return false;
+    };
+    // What a decoded payload costs while its call waits: as received, and as decoded.
+    auto payloadBytes = [](const QVReportingDecodeResult& decoded) {
+        return decoded.bytes + decoded.dictionary.approximateHeapBytes();
     };
     // Handlers for the methods that take one reporter ID and answer a bool.
     using IDCall = void (QVReportingClientServerInstance::*)(
         ReporterID, QVReportingClientServerInstance::BoolReply);
-    auto registerIDCall = [&](const char* member, IDCall op) {
-        reporting_->registerMethod(
-            iface, member, "x", {"reporterID"}, "b", {"result"},
-            [this, op, boolReply](sdbus::MethodCall call) {
-                auto client = clientFor(call);
-                if (!client) {
-                    return answerNow(call, QVReportingError::limitsExceeded("too many clients"));
-                }
-                ReporterID id = 0;
-                call >> id;
-                ((*client).*op)(id, boolReply(hold(std::move(call))));
-            });
+    auto registerIDCall = [&](const char* member, IDCall op, bool held) {
+        reporting_->registerMethod(iface, member, "x", {"reporterID"}, "b", {"result"},
+                                   [this, op, held, boolReply](sdbus::MethodCall call) {
+                                       Client* client = admit(call, held);
+                                       if (!client) {
+                                           return;
+                                       }
+                                       ReporterID id = 0;
+                                       call >> id;
+                                       auto instance = client->instance;
+                                       auto ticket = hold(std::move(call), *client, 0, held);
+                                       ((*instance).*op)(id, boolReply(std::move(ticket)));
+                                   });
     };
 
     registerIDCall(dbus::kCreateReportingSession,
-                   &QVReportingClientServerInstance::createReportingSession);
+                   &QVReportingClientServerInstance::createReportingSession, false);
 
-    reporting_->registerMethod(
-        iface, dbus::kSetServiceType, "qx", {"serviceType", "reporterID"}, "b", {"result"},
-        [this, boolReply](sdbus::MethodCall call) {
-            auto client = clientFor(call);
-            if (!client) {
-                return answerNow(call, QVReportingError::limitsExceeded("too many clients"));
-            }
-            std::uint16_t type = 0;
-            ReporterID id = 0;
-            call >> type >> id;
-            client->setServiceType(type, id, boolReply(hold(std::move(call))));
-        });
+    reporting_->registerMethod(iface, dbus::kSetServiceType, "qx", {"serviceType", "reporterID"},
+                               "b", {"result"}, [this, boolReply](sdbus::MethodCall call) {
+                                   Client* client = admit(call);
+                                   if (!client) {
+                                       return;
+                                   }
+                                   std::uint16_t type = 0;
+                                   ReporterID id = 0;
+                                   call >> type >> id;
+                                   auto instance = client->instance;
+                                   instance->setServiceType(
+                                       type, id, boolReply(hold(std::move(call), *client, 0)));
+                               });
 
     reporting_->registerMethod(
         iface, dbus::kGetServiceNameForReporterID, "x", {"reporterID"}, "q", {"serviceType"},
         [this](sdbus::MethodCall call) {
-            auto client = clientFor(call);
+            Client* client = admit(call);
             if (!client) {
-                return answerNow(call, QVReportingError::limitsExceeded("too many clients"));
+                return;
             }
             ReporterID id = 0;
             call >> id;
-            const CallID held = hold(std::move(call));
-            client->getServiceNameForReporterID(
-                id, [this, held](const std::optional<QVReportingError>& e, AudioServiceType t) {
-                    answer(held, e, [t](sdbus::MethodReply& r) { r << t; });
+            auto instance = client->instance;
+            auto ticket = hold(std::move(call), *client, 0);
+            instance->getServiceNameForReporterID(
+                id, [this, ticket](const std::optional<QVReportingError>& e, AudioServiceType t) {
+                    answer(ticket, e, [t](sdbus::MethodReply& r) { r << t; });
                 });
         });
 
     reporting_->registerMethod(
         iface, dbus::kSetConfiguration, "a{sv}x", {"configuration", "reporterID"}, "b", {"result"},
-        [this, budget, boolReply](sdbus::MethodCall call) {
-            auto client = clientFor(call);
-            if (!client) {
-                return answerNow(call, QVReportingError::limitsExceeded("too many clients"));
-            }
-            auto decoded = QVReportingReadDictionary(call, budget);
-            if (decoded.error) {
-                decoded.limit ? QVReportingStats::shared().noteLimitExceeded(*decoded.limit)
-                              : QVReportingStats::shared().noteInputRefused();
-                return answerNow(call, *decoded.error);
+        [this, boolReply, readPayload, payloadBytes](sdbus::MethodCall call) {
+            Client* client = admit(call);
+            QVReportingDecodeResult decoded;
+            if (!client || !readPayload(call, decoded)) {
+                return;
             }
             ReporterID id = 0;
             call >> id;
-            client->setConfiguration(std::move(decoded.dictionary), id,
-                                     boolReply(hold(std::move(call))));
+            auto instance = client->instance;
+            const std::size_t bytes = payloadBytes(decoded);
+            instance->setConfiguration(std::move(decoded.dictionary), id,
+                                       boolReply(hold(std::move(call), *client, bytes)));
         });
 
     registerIDCall(dbus::kStartReportingSession,
-                   &QVReportingClientServerInstance::startReportingSessionForID);
+                   &QVReportingClientServerInstance::startReportingSessionForID, true);
 
     reporting_->registerMethod(
         iface, dbus::kSendMessage, "a{sv}uqax", {"payload", "category", "type", "reporterIDs"}, "",
-        {}, [this, budget, limits](sdbus::MethodCall call) {
-            auto client = clientFor(call);
-            if (!client) {
-                return answerNow(call, QVReportingError::limitsExceeded("too many clients"));
-            }
-            auto decoded = QVReportingReadDictionary(call, budget);
-            if (decoded.error) {
-                decoded.limit ? QVReportingStats::shared().noteLimitExceeded(*decoded.limit)
-                              : QVReportingStats::shared().noteInputRefused();
-                return answerNow(call, *decoded.error);
+        {}, [this, readPayload, payloadBytes](sdbus::MethodCall call) {
+            Client* client = admit(call);
+            QVReportingDecodeResult decoded;
+            if (!client || !readPayload(call, decoded)) {
+                return;
             }
             std::uint32_t category = 0;
             std::uint16_t type = 0;
             std::vector<std::int64_t> ids;
             call >> category >> type >> ids;
-            if (ids.size() > limits.maxReporterIDsPerMessage) {
+            if (ids.size() > limits_.maxReporterIDsPerMessage) {
                 QVReportingStats::shared().noteLimitExceeded(QVReportingStats::Limit::ReporterIDs);
-                return answerNow(call, QVReportingError::limitsExceeded(
-                                           fmt::format("a message may name at most {} reporter IDs",
-                                                       limits.maxReporterIDsPerMessage)));
+                return refuse(call, QVReportingError::limitsExceeded(
+                                        fmt::format("a message may name at most {} reporter IDs",
+                                                    limits_.maxReporterIDsPerMessage)));
             }
-            const CallID held = hold(std::move(call));
-            client->sendMessage(std::move(decoded.dictionary), category, type, std::move(ids),
-                                [this, held](const std::optional<QVReportingError>& e) {
-                                    answer(held, e, nullptr);
-                                });
+            auto instance = client->instance;
+            const std::size_t bytes = payloadBytes(decoded) + ids.size() * sizeof(ReporterID);
+            auto ticket = hold(std::move(call), *client, bytes);
+            instance->sendMessage(std::move(decoded.dictionary), category, type, std::move(ids),
+                                  [this, ticket](const std::optional<QVReportingError>& e) {
+                                      answer(ticket, e, nullptr);
+                                  });
         });
 
     registerIDCall(dbus::kStopReportingSession,
-                   &QVReportingClientServerInstance::stopReportingSessionForID);
+                   &QVReportingClientServerInstance::stopReportingSessionForID, false);
     registerIDCall(dbus::kDestroyReportingSession,
-                   &QVReportingClientServerInstance::destroyReportingSession);
+                   &QVReportingClientServerInstance::destroyReportingSession, false);
 
     reporting_->registerMethod(
         iface, dbus::kReporterIDValid, "x", {"reporterID"}, "a{sv}", {"reporter"},
         [this](sdbus::MethodCall call) {
-            auto client = clientFor(call);
+            Client* client = admit(call);
             if (!client) {
-                return answerNow(call, QVReportingError::limitsExceeded("too many clients"));
+                return;
             }
             ReporterID id = 0;
             call >> id;
-            const CallID held = hold(std::move(call));
-            client->reporterIDValid(
-                id, [this, held](const std::optional<QVReportingError>& e, const Dictionary& d) {
+            auto instance = client->instance;
+            auto ticket = hold(std::move(call), *client, 0);
+            instance->reporterIDValid(
+                id, [this, ticket](const std::optional<QVReportingError>& e, const Dictionary& d) {
                     // The reply's two members have fixed types: x and q.
                     const ReporterID rid =
                         d.find(dbus::kReporterProxyKeyReporterID)->asInt64().value_or(0);
                     const auto type = static_cast<std::uint16_t>(
                         d.find(dbus::kReporterProxyKeyServiceType)->asInt64().value_or(0xFFFF));
-                    answer(held, e, [rid, type](sdbus::MethodReply& r) {
+                    answer(ticket, e, [rid, type](sdbus::MethodReply& r) {
                         std::map<std::string, sdbus::Variant> out{
                             {dbus::kReporterProxyKeyReporterID, sdbus::Variant(rid)},
                             {dbus::kReporterProxyKeyServiceType, sdbus::Variant(type)}};
@@ -396,25 +516,24 @@ void QVReportingDBusServer::registerReportingInterface() {
     reporting_->registerMethod(
         iface, dbus::kGetAllReporters, "", {}, "ax", {"reporterIDs"},
         [this](sdbus::MethodCall call) {
-            auto client = clientFor(call);
+            Client* client = admit(call);
             if (!client) {
-                return answerNow(call, QVReportingError::limitsExceeded("too many clients"));
+                return;
             }
-            const CallID held = hold(std::move(call));
-            client->getAllReporters([this, held](const std::optional<QVReportingError>& e,
-                                                 const std::vector<ReporterID>& ids) {
-                answer(held, e, [ids](sdbus::MethodReply& r) { r << ids; });
+            auto instance = client->instance;
+            auto ticket = hold(std::move(call), *client, 0);
+            instance->getAllReporters([this, ticket](const std::optional<QVReportingError>& e,
+                                                     const std::vector<ReporterID>& ids) {
+                answer(ticket, e, [ids](sdbus::MethodReply& r) { r << ids; });
             });
         });
 
-    reporting_->registerMethod(
-        iface, dbus::kKillService, "", {}, "b", {"result"}, [this](sdbus::MethodCall call) {
-            auto client = clientFor(call);
-            if (!client) {
-                return answerNow(call, QVReportingError::limitsExceeded("too many clients"));
-            }
-            client->killService();
-        });
+    reporting_->registerMethod(iface, dbus::kKillService, "", {}, "b", {"result"},
+                               [this](sdbus::MethodCall call) {
+                                   if (Client* client = admit(call)) {
+                                       client->instance->killService();
+                                   }
+                               });
 }
 
 void QVReportingDBusServer::registerStatsInterface() {
@@ -424,6 +543,7 @@ void QVReportingDBusServer::registerStatsInterface() {
                                    stats.set("bus_clients", std::uint64_t{clientCount_.load()});
                                    stats.set("calls_awaiting_reply",
                                              std::uint64_t{pending_.size()});
+                                   stats.set("bus_reads_paused_now", readsPaused_);
                                    auto reply = call.createReply();
                                    QVReportingAppendDictionary(reply, stats);
                                    reply.send();

@@ -91,6 +91,24 @@ std::optional<QVReportingDaemonOptions> QVReportingParseDaemonOptions(int argc, 
                    "Memory the stored messages of all sessions may take together")
         ->capture_default_str()
         ->check(CLI::PositiveNumber);
+    app.add_option("--max-call-bytes-per-client", l.maxCallBytesPerClient,
+                   "Memory one client's calls may take while not yet answered; past it, its "
+                   "further calls are refused with LimitsExceeded")
+        ->capture_default_str()
+        ->check(CLI::PositiveNumber);
+    app.add_option("--max-call-bytes", l.maxCallBytes,
+                   "Memory all clients' calls may take while not yet answered; past it, the "
+                   "daemon stops reading the bus until they drain")
+        ->capture_default_str()
+        ->check(CLI::PositiveNumber);
+    app.add_option("--max-held-calls-per-client", l.maxHeldCallsPerClient,
+                   "Start calls one client may have waiting for their sessions to stop")
+        ->capture_default_str()
+        ->check(CLI::PositiveNumber);
+    app.add_option("--max-held-calls", l.maxHeldCalls,
+                   "Start calls all clients may have waiting for their sessions to stop")
+        ->capture_default_str()
+        ->check(CLI::PositiveNumber);
     app.add_option("--bluez-bus", o.bluezBus,
                    "Bus to read BlueZ (org.bluez) from: system, or a bus address (unix:path=...)")
         ->capture_default_str();

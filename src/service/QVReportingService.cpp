@@ -12,10 +12,15 @@ namespace qv {
 
 namespace {
 
-std::string describeSessions(const std::vector<std::shared_ptr<QVReportingSession>>& sessions) {
+// "(a, b, and N more)": at most kMaxSessionsLogged descriptions of total sessions.
+std::string describeSessions(const std::vector<std::shared_ptr<QVReportingSession>>& sessions,
+                             std::size_t total) {
     std::string out = "(";
     for (std::size_t i = 0; i < sessions.size(); ++i) {
         out += (i ? ", " : "") + sessions[i]->description();
+    }
+    if (total > sessions.size()) {
+        out += fmt::format("{}and {} more", sessions.empty() ? "" : ", ", total - sessions.size());
     }
     return out + ")";
 }
@@ -62,7 +67,8 @@ std::shared_ptr<QVReportingClientServerInstance> QVReportingService::acceptConne
         clients_.push_back(client);
         QVReportingStats::shared().noteClientCount(clients_.size());
     }
-    queue_.async([this, client] {
+    // On the client's lane, so it comes before the client's first call.
+    queue_.async(client->lane(), [this, client] {
         client->setClientStartDate(platform_.clock.now());
         client->setClientProcessName(
             platform_.process.processName(client->processIdentifier()).value_or(""));
@@ -73,7 +79,8 @@ std::shared_ptr<QVReportingClientServerInstance> QVReportingService::acceptConne
 void QVReportingService::connectionInvalidated(
     const std::shared_ptr<QVReportingClientServerInstance>& client) {
     client->handleConnectionError();
-    queue_.async([this, client] {
+    // On the client's lane: after the calls it made before it left.
+    queue_.async(client->lane(), [this, client] {
         const auto& log = QVReportingServiceDelegateCategory();
         const std::int64_t pid = client->processIdentifier();
         const std::string name =
@@ -113,12 +120,8 @@ void QVReportingService::stopAllSessions() {
             std::lock_guard lock(lock_);
             single = std::move(singleMessageSession_);
         }
-        for (const auto& session : getAllActiveReportingSessions()) {
-            session->stop();
-            if (auto held = std::move(session->transactionCompleteBlock())) {
-                session->setTransactionCompleteBlock(nullptr);
-                held(true);
-            }
+        for (const auto& client : getAllClients()) {
+            client->stopActiveSessions();
         }
         if (single) {
             single->stop();
@@ -135,14 +138,12 @@ std::vector<std::shared_ptr<QVReportingSession>>
 QVReportingService::getAllActiveReportingSessions() {
     std::vector<std::shared_ptr<QVReportingSession>> active;
     for (const auto& client : getAllClients()) {
-        const auto sessions = client->sessions();
-        QVLOG_DEFAULT(QVReportingServiceDelegateCategory(), "sessions for client {} : {}",
-                      client->processIdentifier(), describeSessions(sessions));
-        for (const auto& s : sessions) {
-            if (s->started()) {
-                active.push_back(s);
-            }
-        }
+        QVLOG_DEFAULT(
+            QVReportingServiceDelegateCategory(), "sessions for client {} : {}",
+            client->processIdentifier(),
+            describeSessions(client->sessions(kMaxSessionsLogged), client->sessionCount()));
+        const auto sessions = client->activeSessions();
+        active.insert(active.end(), sessions.begin(), sessions.end());
     }
     return active;
 }
@@ -179,8 +180,7 @@ std::vector<std::shared_ptr<QVReportingSession>> QVReportingService::findReporti
         return found;
     }
     auto active = getAllActiveReportingSessions();
-    QVLOG_DEFAULT(QVReportingServiceDelegateCategory(), "{} active reporting session(s) {}",
-                  active.size(), describeSessions(active));
+    logReportingSessions();
     if (!active.empty()) {
         return active;
     }
@@ -257,9 +257,19 @@ void QVReportingService::removeClient(
 }
 
 void QVReportingService::logReportingSessions() {
-    const auto active = getAllActiveReportingSessions();
-    QVLOG_DEFAULT(QVReportingServiceDelegateCategory(), "{} active reporting session(s) {}",
-                  active.size(), describeSessions(active));
+    if (logEnabled(LogLevel::Default)) {
+        std::size_t count = 0;
+        std::vector<std::shared_ptr<QVReportingSession>> named;
+        for (const auto& client : getAllClients()) {
+            count += client->activeSessionCount();
+            if (named.size() < kMaxSessionsLogged) {
+                const auto more = client->activeSessions(kMaxSessionsLogged - named.size());
+                named.insert(named.end(), more.begin(), more.end());
+            }
+        }
+        QVLOG_DEFAULT(QVReportingServiceDelegateCategory(), "{} active reporting session(s) {}",
+                      count, describeSessions(named, count));
+    }
     noteSessionCount();
 }
 
@@ -267,7 +277,7 @@ void QVReportingService::noteSessionCount() {
     std::lock_guard lock(lock_);
     std::size_t sessions = singleMessageSession_ ? 1 : 0;
     for (const auto& client : clients_) {
-        sessions += client->reporterIDs().size();
+        sessions += client->sessionCount();
     }
     QVReportingStats::shared().noteSessionCount(sessions);
 }

@@ -53,6 +53,7 @@ class QVReportingService final : public QVReportingServiceDelegateProtocol {
         const std::vector<ReporterID>& ids) override;
     void removeClient(const std::shared_ptr<QVReportingClientServerInstance>& client) override;
     void logReportingSessions() override;
+    void noteSessionCount() override;
 
     void setReportingEnabled(bool enabled) { reportingEnabled_ = enabled; }
     std::shared_ptr<QVReportingSession> singleMessageSession();
@@ -64,10 +65,12 @@ class QVReportingService final : public QVReportingServiceDelegateProtocol {
     static constexpr double kReaperInterval = 0.5;
     static constexpr ReporterID kSingleMessageReporterID = 1;
     static constexpr const char* kClientUptimeEvent = "com.korvane.qvsound.qvreportingclientuptime";
+    // Sessions named in one log line of session lists; the rest are counted ("and N more"), so
+    // that a line costs the same with 10 sessions or 10^5.
+    static constexpr std::size_t kMaxSessionsLogged = 16;
 
   private:
     std::shared_ptr<QVReportingSession> retrieveSingleMessageSession();
-    void noteSessionCount();
 
     const Platform& platform_;
     SerialQueue& queue_;

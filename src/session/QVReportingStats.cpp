@@ -6,8 +6,10 @@ namespace qv {
 
 namespace {
 
-constexpr std::string_view kLimitNames[] = {"payload_bytes", "payload_values",      "payload_depth",
-                                            "reporter_ids",  "sessions_per_client", "clients"};
+constexpr std::string_view kLimitNames[] = {
+    "payload_bytes",         "payload_values",        "payload_depth",
+    "reporter_ids",          "sessions_per_client",   "clients",
+    "call_bytes_per_client", "held_calls_per_client", "held_calls"};
 
 void raiseMax(std::atomic<std::uint64_t>& max, std::uint64_t value) {
     std::uint64_t seen = max.load();
@@ -125,6 +127,17 @@ std::uint64_t QVReportingStats::issueCaptureRefused(std::string_view reason) con
     return it == issueCaptureRefused_.end() ? 0 : it->second;
 }
 
+void QVReportingStats::noteCallBudget(std::size_t callBytes, std::size_t heldCalls) {
+    callBytes_.store(callBytes);
+    raiseMax(callBytesMax_, callBytes);
+    heldCalls_.store(heldCalls);
+    raiseMax(heldCallsMax_, heldCalls);
+}
+
+void QVReportingStats::noteBusReadsPaused() {
+    busReadsPaused_.fetch_add(1, std::memory_order_relaxed);
+}
+
 Dictionary QVReportingStats::dump() const {
     Dictionary out;
     std::uint64_t limitsTotal = 0;
@@ -165,6 +178,11 @@ Dictionary QVReportingStats::dump() const {
     out.set("session_store_budget_bytes", sessionStoreBudget_.load());
     out.set("messages_not_stored", messagesNotStored_.load());
     out.set("previous_values_dropped", previousValuesDropped_.load());
+    out.set("call_bytes", callBytes_.load());
+    out.set("call_bytes_max", callBytesMax_.load());
+    out.set("held_calls", heldCalls_.load());
+    out.set("held_calls_max", heldCallsMax_.load());
+    out.set("bus_reads_paused", busReadsPaused_.load());
     return out;
 }
 
@@ -183,6 +201,11 @@ void QVReportingStats::TEST_reset() {
     messagesNotStored_.store(0);
     previousValuesDropped_.store(0);
     sinkTornLinesRemoved_.store(0);
+    callBytes_.store(0);
+    callBytesMax_.store(0);
+    heldCalls_.store(0);
+    heldCallsMax_.store(0);
+    busReadsPaused_.store(0);
     std::lock_guard lock(mutex_);
     sinkLinesLost_.clear();
     issueCaptureRefused_.clear();

@@ -38,6 +38,20 @@ struct QVReportingLimits {
     std::size_t maxSessionStoreBytes = std::size_t{64} << 20;
     // Memory the stored messages of all sessions together may take.
     std::size_t maxStoreBytes = std::size_t{512} << 20;
+    // Memory of one client's calls taken in from the bus and not yet answered (the call as
+    // received, its decoded arguments and the queued work; kCallOverheadBytes at least a call).
+    // Past it the client's further calls are refused at once, without decoding them, while the
+    // daemon reads on, so that one flooding client neither grows the daemon nor delays others.
+    std::size_t maxCallBytesPerClient = std::size_t{16} << 20;
+    // The same for all clients together. Past it the daemon stops reading the bus until its work
+    // drains below it: nothing is refused, and the bus holds (and limits) what senders send.
+    std::size_t maxCallBytes = std::size_t{128} << 20;
+    // Calls whose answer waits on a later event (a start call, answered when its session stops)
+    // that one client may hold; a client holds one a started session. Further such calls are
+    // refused.
+    std::size_t maxHeldCallsPerClient = 4096;
+    // The same for all clients together.
+    std::size_t maxHeldCalls = 32768;
 };
 
 class QVReportingStats {
@@ -48,7 +62,10 @@ class QVReportingStats {
         PayloadDepth,
         ReporterIDs,
         SessionsPerClient,
-        Clients
+        Clients,
+        CallBytesPerClient,
+        HeldCallsPerClient,
+        HeldCalls
     };
 
     static QVReportingStats& shared();
@@ -57,6 +74,9 @@ class QVReportingStats {
     // was sent). Real clients use a few dozen; beyond this, new keys are not remembered (known
     // keys still update), so a client inventing keys cannot grow the daemon without bound.
     static constexpr std::size_t kMaxPreviousValuesKeys = 16384;
+    // What a call costs the daemon while it is taken in and not answered, beyond its arguments:
+    // the message as received, the pending entry and the queued task (measured: about 1.5 KiB).
+    static constexpr std::size_t kCallOverheadBytes = 2048;
 
     void noteLimitExceeded(Limit limit);
     // A call refused for its content (a value of a type payloads cannot hold, say).
@@ -72,6 +92,11 @@ class QVReportingStats {
     void noteIssueCaptureRefused(std::string_view reason);
     void noteClientCount(std::size_t clients);
     void noteSessionCount(std::size_t sessions);
+    // Calls taken in and not yet answered: their bytes (QVReportingLimits' call budgets) and the
+    // held ones among them.
+    void noteCallBudget(std::size_t callBytes, std::size_t heldCalls);
+    // The daemon stopped reading the bus for want of call budget.
+    void noteBusReadsPaused();
 
     // The store budgets sessions keep to (QVReportingLimits' two store limits).
     void setStoreBudgets(std::size_t perSession, std::size_t total);
@@ -102,7 +127,7 @@ class QVReportingStats {
     void TEST_reset();
 
   private:
-    static constexpr std::size_t kLimitKinds = 6;
+    static constexpr std::size_t kLimitKinds = 9;
     // At most this many distinct sink names are tracked; sinks are few and named by the daemon.
     static constexpr std::size_t kMaxTrackedSinks = 32;
 
@@ -120,6 +145,11 @@ class QVReportingStats {
     std::atomic<std::uint64_t> messagesNotStored_{0};
     std::atomic<std::uint64_t> previousValuesDropped_{0};
     std::atomic<std::uint64_t> sinkTornLinesRemoved_{0};
+    std::atomic<std::uint64_t> callBytes_{0};
+    std::atomic<std::uint64_t> callBytesMax_{0};
+    std::atomic<std::uint64_t> heldCalls_{0};
+    std::atomic<std::uint64_t> heldCallsMax_{0};
+    std::atomic<std::uint64_t> busReadsPaused_{0};
     mutable std::mutex mutex_;
     std::map<std::string, std::uint64_t, std::less<>> sinkLinesLost_;        // guarded by mutex_
     std::map<std::string, std::uint64_t, std::less<>> issueCaptureRefused_;  // guarded by mutex_

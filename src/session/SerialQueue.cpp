@@ -2,11 +2,13 @@
 
 #include <pthread.h>
 
+#include <algorithm>
 #include <future>
 
 namespace qv {
 
-SerialQueue::SerialQueue(std::string label) : label_(std::move(label)) {
+SerialQueue::SerialQueue(std::string label)
+    : label_(std::move(label)), ownLane_(std::make_shared<LaneState>()) {
     std::promise<std::thread::id> started;
     auto id = started.get_future();
     thread_ = std::thread([this, &started] {
@@ -30,10 +32,22 @@ SerialQueue::~SerialQueue() {
     }
 }
 
+SerialQueue::Lane SerialQueue::makeLane() {
+    return Lane(std::make_shared<LaneState>());
+}
+
 void SerialQueue::async(std::function<void()> task) {
+    async(ownLane_, std::move(task));
+}
+
+void SerialQueue::async(const Lane& lane, std::function<void()> task) {
     {
         std::lock_guard lock(mutex_);
-        tasks_.push_back(std::move(task));
+        lane.state_->tasks.push_back({nextSeq_++, std::move(task)});
+        if (!lane.state_->ready) {
+            lane.state_->ready = true;
+            ready_.push_back(lane.state_);
+        }
     }
     wake_.notify_one();
 }
@@ -44,22 +58,50 @@ void SerialQueue::sync(const std::function<void()>& task) {
         return;
     }
     std::promise<void> done;
-    async([&] {
-        task();
-        done.set_value();
-    });
+    {
+        std::lock_guard lock(mutex_);
+        barriers_.push_back({nextSeq_++, [&] {
+                                 task();
+                                 done.set_value();
+                             }});
+    }
+    wake_.notify_one();
     done.get_future().wait();
+}
+
+bool SerialQueue::barrierDue() const {
+    if (barriers_.empty()) {
+        return false;
+    }
+    const std::uint64_t barrier = barriers_.front().seq;
+    // Each lane runs in order, so its first task is its oldest.
+    return std::none_of(ready_.begin(), ready_.end(),
+                        [&](const auto& lane) { return lane->tasks.front().seq < barrier; });
 }
 
 void SerialQueue::run() {
     std::unique_lock lock(mutex_);
     for (;;) {
-        wake_.wait(lock, [&] { return stopping_ || !tasks_.empty(); });
-        if (tasks_.empty()) {
-            return;
+        wake_.wait(lock, [&] { return stopping_ || !ready_.empty() || !barriers_.empty(); });
+        std::function<void()> task;
+        if (barrierDue()) {
+            task = std::move(barriers_.front().run);
+            barriers_.pop_front();
+        } else if (!ready_.empty()) {
+            // One task of the lane whose turn it is; the lane goes to the back of the line while
+            // it has more.
+            auto lane = std::move(ready_.front());
+            ready_.pop_front();
+            task = std::move(lane->tasks.front().run);
+            lane->tasks.pop_front();
+            if (lane->tasks.empty()) {
+                lane->ready = false;
+            } else {
+                ready_.push_back(std::move(lane));
+            }
+        } else {
+            return;  // stopping, and nothing is left
         }
-        auto task = std::move(tasks_.front());
-        tasks_.pop_front();
         lock.unlock();
         task();
         task = nullptr;  // drop what the task captured before taking the lock again
