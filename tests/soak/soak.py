@@ -41,6 +41,8 @@ import time
 
 import dbus
 
+import floods
+
 from soaklib import (BUS_NAME, CLIENT_COMM, INTERFACE, OBJECT_PATH, SOURCE_DIR, AnalyticsIndex, Bus,
                      Checks, Failure, LoadClient, SoakDaemon, check_clean_exit, log, torn_sinks,
                      unparsable_lines, wait_until, whole_lines)
@@ -600,6 +602,11 @@ class Soak:
         if daemon:
             check_clean_exit(c, daemon, status, "read-only")
 
+    # ---- floods ----
+
+    def floods(self):
+        floods.run(self)
+
     # ---- all ----
 
     def run(self, scenarios):
@@ -626,12 +633,14 @@ def main():
     parser = argparse.ArgumentParser(description=__doc__.split("\n\n")[0])
     parser.add_argument("--full", action="store_true", help="the long form")
     parser.add_argument("--seed", type=int, default=None, help="seed of the random choices")
-    parser.add_argument("--only", default="churn,sigterm,sigkill,faults",
+    parser.add_argument("--only", default="churn,sigterm,sigkill,faults,floods",
                         help="scenarios to run, comma-separated")
     parser.add_argument("--daemon", default=os.path.join(SOURCE_DIR, "build", "asan-ubsan",
                                                          "qvreportd"))
     parser.add_argument("--client", default=os.path.join(SOURCE_DIR, "build", "asan-ubsan",
                                                          "tests", "qv_soak_client"))
+    parser.add_argument("--flood-client", default=os.path.join(SOURCE_DIR, "build", "asan-ubsan",
+                                                               "tests", "qv_flood_client"))
     parser.add_argument("--workdir", default=None, help="where the work directory is made")
     parser.add_argument("--keep", action="store_true", help="keep logs and state directories")
     parser.add_argument("--skip-mounts", action="store_true",
@@ -640,7 +649,7 @@ def main():
     if args.seed is None:
         args.seed = random.SystemRandom().randrange(1 << 32)
     scenarios = [s for s in args.only.split(",") if s]
-    unknown = set(scenarios) - {"churn", "sigterm", "sigkill", "faults"}
+    unknown = set(scenarios) - {"churn", "sigterm", "sigkill", "faults", "floods"}
     if unknown:
         parser.error(f"unknown scenarios: {sorted(unknown)}")
     if "faults" in scenarios and not args.skip_mounts:
@@ -652,7 +661,7 @@ def main():
             env = dict(os.environ, QV_SOAK_MOUNT_NAMESPACE="1")
             os.execvpe("unshare", ["unshare", "--mount", "--propagation", "private",
                                    sys.executable, *sys.argv, "--seed", str(args.seed)], env)
-    for path in (args.daemon, args.client):
+    for path in (args.daemon, args.client, args.flood_client):
         if not os.access(path, os.X_OK):
             parser.error(f"{path} is not built (scripts/soak builds it)")
     soak = Soak(args, FULL if args.full else SHORT)
