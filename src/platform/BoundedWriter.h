@@ -4,7 +4,10 @@
 //
 // The writer takes either one item at a time or, with kBatches, everything queued at once (a
 // sink then writes many lines with one system call when it falls behind). While a batch is being
-// written, up to `capacity` further items may queue, so at most twice that is held.
+// written, up to `capacity` further items may queue, so at most twice that is held. Items may
+// also be given a size: then the queue holds at most maxBytes of them besides the batch being
+// written (one item always fits an empty queue, whatever its size), so a few huge items cannot
+// take the memory that many small ones were allowed.
 //
 // Thread safety: push(), flush() and flushUntil() may be called from any thread; the writer
 // function runs only on the writer's own thread, in push order.
@@ -13,6 +16,7 @@
 #include <chrono>
 #include <condition_variable>
 #include <cstddef>
+#include <cstdint>
 #include <deque>
 #include <functional>
 #include <mutex>
@@ -51,14 +55,23 @@ class BoundedWriter {
         thread_.join();
     }
 
-    // Queues the item; false when the buffer is full (the item is dropped).
-    bool push(T item) {
+    // Bounds the bytes queued (see push(item, bytes)); without it, only the count is bounded.
+    void setMaxBytes(std::size_t maxBytes) {
+        std::lock_guard lock(mutex_);
+        maxBytes_ = maxBytes;
+    }
+
+    // Queues the item; false when the buffer is full (the item is dropped). bytes is what the
+    // item holds, counted against setMaxBytes().
+    bool push(T item, std::size_t bytes = 0) {
         {
             std::lock_guard lock(mutex_);
-            if (items_.size() >= capacity_) {
+            if (items_.size() >= capacity_ ||
+                (!items_.empty() && queuedBytes_ + bytes > maxBytes_)) {
                 return false;
             }
             items_.push_back(std::move(item));
+            queuedBytes_ += bytes;
         }
         wake_.notify_one();
         return true;
@@ -91,6 +104,7 @@ class BoundedWriter {
                 return;  // stopping and drained
             }
             batch.swap(items_);
+            queuedBytes_ = 0;
             inFlight_ = batch.size();
             lock.unlock();
             write_(batch);
@@ -107,11 +121,13 @@ class BoundedWriter {
     std::mutex mutex_;
     std::condition_variable wake_;
     std::condition_variable drained_;
-    std::deque<T> items_;       // guarded by mutex_
-    std::size_t written_ = 0;   // guarded by mutex_
-    std::size_t inFlight_ = 0;  // guarded by mutex_
-    bool stopping_ = false;     // guarded by mutex_
-    std::thread thread_;        // last: starts once the members above exist
+    std::deque<T> items_;              // guarded by mutex_
+    std::size_t queuedBytes_ = 0;      // guarded by mutex_
+    std::size_t maxBytes_ = SIZE_MAX;  // guarded by mutex_
+    std::size_t written_ = 0;          // guarded by mutex_
+    std::size_t inFlight_ = 0;         // guarded by mutex_
+    bool stopping_ = false;            // guarded by mutex_
+    std::thread thread_;               // last: starts once the members above exist
 };
 
 }  // namespace qv

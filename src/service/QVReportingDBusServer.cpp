@@ -116,6 +116,7 @@ bool QVReportingDBusServer::post(std::function<void()> fn) {
             return false;
         }
         posted_.push_back(std::move(fn));
+        postedWaiting_.store(true, std::memory_order_release);
     }
     const std::uint64_t one = 1;
     [[maybe_unused]] const auto n = ::write(wakeFd_, &one, sizeof one);
@@ -140,6 +141,7 @@ void QVReportingDBusServer::drainPosted(bool last) {
     {
         std::lock_guard lock(postMutex_);
         batch.swap(posted_);
+        postedWaiting_.store(false, std::memory_order_relaxed);
         loopEnded_ = loopEnded_ || last;
     }
     for (auto& fn : batch) {
@@ -180,6 +182,11 @@ void QVReportingDBusServer::loop() {
             while (callBytes_ < limits_.maxCallBytes && connection_->processPendingRequest()) {
                 if (stopping_) {
                     return;
+                }
+                // Answers go out between calls: under a steady stream of calls the loop would
+                // otherwise not reach its poll, and every answer would wait for a lull.
+                if (postedWaiting_.load(std::memory_order_acquire)) {
+                    drainPosted();
                 }
             }
             if (callBytes_ >= limits_.maxCallBytes) {
@@ -227,10 +234,21 @@ QVReportingDBusServer::Client* QVReportingDBusServer::admit(sdbus::MethodCall& c
             refuse(call, QVReportingError::limitsExceeded("too many clients"));
             return nullptr;
         }
-        it = clients_.emplace(std::move(sender), Client{std::move(instance)}).first;
+        it = clients_
+                 .emplace(
+                     std::move(sender),
+                     Client{std::move(instance), 0, 0,
+                            static_cast<double>(limits_.maxCallBytesPerClient), monotonicMicros()})
+                 .first;
         clientCount_ = clients_.size();
     }
     Client& client = it->second;
+    const std::uint64_t now = monotonicMicros();
+    client.payloadAllowance = std::min(
+        static_cast<double>(limits_.maxCallBytesPerClient),
+        client.payloadAllowance + static_cast<double>(limits_.maxPayloadBytesPerSecondPerClient) *
+                                      static_cast<double>(now - client.allowanceMicros) / 1e6);
+    client.allowanceMicros = now;
     // Checked before the arguments are read, so a refusal costs next to nothing.
     std::optional<QVReportingStats::Limit> over;
     std::string why;
@@ -246,6 +264,10 @@ QVReportingDBusServer::Client* QVReportingDBusServer::admit(sdbus::MethodCall& c
         over = QVReportingStats::Limit::CallBytesPerClient;
         why = fmt::format("a client's calls not yet answered may take at most {} bytes",
                           limits_.maxCallBytesPerClient);
+    } else if (client.payloadAllowance <= 0) {
+        over = QVReportingStats::Limit::PayloadRatePerClient;
+        why = fmt::format("a client may send at most {} payload bytes a second",
+                          limits_.maxPayloadBytesPerSecondPerClient);
     }
     if (over) {
         QVReportingStats::shared().noteLimitExceeded(*over);
@@ -326,6 +348,10 @@ sdbus::MethodCall QVReportingDBusServer::release(CallID id) {
     return std::move(pending.call);
 }
 
+void QVReportingDBusServer::chargePayload(Client& client, std::size_t bytes) {
+    client.payloadAllowance -= static_cast<double>(bytes);
+}
+
 void QVReportingDBusServer::noteBudgets() const {
     QVReportingStats::shared().noteCallBudget(callBytes_, heldCalls_);
 }
@@ -369,8 +395,10 @@ void QVReportingDBusServer::registerReportingInterface() {
         };
     };
     // Reads a payload or configuration; false (the call refused and counted) when it is not one.
-    auto readPayload = [this, budget](sdbus::MethodCall& call, QVReportingDecodeResult& decoded) {
+    auto readPayload = [this, budget](sdbus::MethodCall& call, Client& client,
+                                      QVReportingDecodeResult& decoded) {
         decoded = QVReportingReadDictionary(call, budget);
+        chargePayload(client, decoded.bytes);
         if (!decoded.error) {
             return true;
         }
@@ -440,7 +468,7 @@ void QVReportingDBusServer::registerReportingInterface() {
         [this, boolReply, readPayload, payloadBytes](sdbus::MethodCall call) {
             Client* client = admit(call);
             QVReportingDecodeResult decoded;
-            if (!client || !readPayload(call, decoded)) {
+            if (!client || !readPayload(call, *client, decoded)) {
                 return;
             }
             ReporterID id = 0;
@@ -459,7 +487,7 @@ void QVReportingDBusServer::registerReportingInterface() {
         {}, [this, readPayload, payloadBytes](sdbus::MethodCall call) {
             Client* client = admit(call);
             QVReportingDecodeResult decoded;
-            if (!client || !readPayload(call, decoded)) {
+            if (!client || !readPayload(call, *client, decoded)) {
                 return;
             }
             std::uint32_t category = 0;

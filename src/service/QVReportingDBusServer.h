@@ -69,6 +69,9 @@ class QVReportingDBusServer {
         std::shared_ptr<QVReportingClientServerInstance> instance;
         std::size_t callBytes = 0;  // of its calls not yet answered
         std::size_t heldCalls = 0;  // of them, the held ones
+        // Payload bytes it may still send now (a token bucket, refilled at the payload rate).
+        double payloadAllowance;
+        std::uint64_t allowanceMicros;  // when the allowance was last refilled
     };
     struct Pending {
         sdbus::MethodCall call;
@@ -117,6 +120,8 @@ class QVReportingDBusServer {
     // Refuses a call on the loop thread: an error reply, unless the caller expects none.
     void refuse(sdbus::MethodCall& call, const QVReportingError& error);
     void noteBudgets() const;
+    // Takes a payload's bytes out of its client's allowance.
+    void chargePayload(Client& client, std::size_t bytes);
 
     std::unique_ptr<sdbus::IConnection> connection_;
     QVReportingService& service_;
@@ -133,6 +138,7 @@ class QVReportingDBusServer {
     std::mutex postMutex_;
     std::deque<std::function<void()>> posted_;  // guarded by postMutex_
     bool loopEnded_ = false;                    // guarded by postMutex_
+    std::atomic<bool> postedWaiting_{false};    // posted_ is not empty
 
     // Touched on the loop thread only.
     std::unordered_map<std::string, Client> clients_;

@@ -101,6 +101,12 @@ std::optional<QVReportingDaemonOptions> QVReportingParseDaemonOptions(int argc, 
                    "daemon stops reading the bus until they drain")
         ->capture_default_str()
         ->check(CLI::PositiveNumber);
+    app.add_option("--max-payload-bytes-per-second", l.maxPayloadBytesPerSecondPerClient,
+                   "Payload bytes one client may send a second on average (bursts up to "
+                   "--max-call-bytes-per-client); past it, its calls are refused with "
+                   "LimitsExceeded")
+        ->capture_default_str()
+        ->check(CLI::PositiveNumber);
     app.add_option("--max-held-calls-per-client", l.maxHeldCallsPerClient,
                    "Start calls one client may have waiting for their sessions to stop")
         ->capture_default_str()

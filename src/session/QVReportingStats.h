@@ -52,6 +52,13 @@ struct QVReportingLimits {
     std::size_t maxHeldCallsPerClient = 4096;
     // The same for all clients together.
     std::size_t maxHeldCalls = 32768;
+    // Payload bytes one client may send a second, on average; bursts up to
+    // maxCallBytesPerClient pass at once. Every client's calls reach the daemon through its one
+    // connection to the bus, read in arrival order, and reading a payload costs time (its text is
+    // checked byte by byte): without this, one client sending large payloads as fast as it can
+    // would hold up every other client's calls behind its own. A real client sends a few KiB a
+    // second. Past it, calls are refused before they are read.
+    std::size_t maxPayloadBytesPerSecondPerClient = std::size_t{64} << 20;
 };
 
 class QVReportingStats {
@@ -65,7 +72,8 @@ class QVReportingStats {
         Clients,
         CallBytesPerClient,
         HeldCallsPerClient,
-        HeldCalls
+        HeldCalls,
+        PayloadRatePerClient
     };
 
     static QVReportingStats& shared();
@@ -127,7 +135,7 @@ class QVReportingStats {
     void TEST_reset();
 
   private:
-    static constexpr std::size_t kLimitKinds = 9;
+    static constexpr std::size_t kLimitKinds = 10;
     // At most this many distinct sink names are tracked; sinks are few and named by the daemon.
     static constexpr std::size_t kMaxTrackedSinks = 32;
 

@@ -133,10 +133,12 @@ class DerivedMessages(DaemonTestCase):
                [31])
         self.assertTrue(c.stop(31))
 
-        wait_until(lambda: self.daemon.events("com.korvane.test.Session_Generic.Summary"),
-                   what="the summary in the analytics sink")
-        summaries = [e for e in self.daemon.events("com.korvane.qvsound.")
-                     if e["event"].endswith(".Summary")]
+        def summaries():
+            return [e for e in self.daemon.events("com.korvane.qvsound.")
+                    if e["event"].endswith(".Summary")]
+        # The sink's thread writes them as they come: wait for the last one.
+        wait_until(lambda: len(summaries()) == 3, what="the three summaries in the analytics sink")
+        summaries = summaries()
         # Workers stop in their fixed order: volume before the summary, input after it.
         self.assertEqual([e["event"].split(".")[3] for e in summaries],
                          ["Volume", "Session_Generic", "Input"])

@@ -3,6 +3,7 @@
 #include <gtest/gtest.h>
 
 #include "fakes/FakePlatform.h"
+#include "fakes/MemoryLogSink.h"
 #include "session/QVReportingUtility.h"
 #include "session/QVReportingWorkerRegistry.h"
 
@@ -218,6 +219,43 @@ TEST_F(AService, RefusesMessagesWhileDisabledAndEnforcesItsLimits) {
     ASSERT_TRUE(lastSendError);
     EXPECT_EQ(lastSendError->name, "com.korvane.audio.reporting.ReportingDisabled");
     EXPECT_EQ(service->findReportingSessionForID(1), nullptr);
+}
+
+TEST_F(AService, KeepsItsSessionListsShortAndCountsCreatedSessions) {
+    QVReportingStats::shared().TEST_reset();
+    makeService();
+    auto a = connect(100);
+    test::ScopedMemoryLog log(LogLevel::Default);
+    for (ReporterID id = 1; id <= 40; ++id) {
+        a->createReportingSession(id, into(ignored));
+    }
+    drain();
+    // Created, not started: counted all the same.
+    EXPECT_EQ(QVReportingStats::shared().dump().find("sessions")->asInt64(), 40);
+    for (ReporterID id = 1; id <= 20; ++id) {
+        a->startReportingSessionForID(id, into(ignored));
+    }
+    a->stopReportingSessionForID(3, into(ignored));
+    a->destroyReportingSession(4, into(ignored));
+    drain();
+    // 18 run (1..20 but 3 and 4): the line counts them all and names the first 16, in order.
+    const auto lines = log->lines();
+    const auto last = std::find_if(lines.rbegin(), lines.rend(), [](const auto& l) {
+        return l.text.find("active reporting session(s)") != std::string::npos;
+    });
+    ASSERT_NE(last, lines.rend());
+    EXPECT_NE(last->text.find("18 active reporting session(s) (reporterID=1,"), std::string::npos)
+        << last->text;
+    EXPECT_NE(last->text.find("reporterID=18,"), std::string::npos);
+    EXPECT_EQ(last->text.find("reporterID=19,"), std::string::npos);
+    EXPECT_NE(last->text.find(", and 2 more)"), std::string::npos);
+    EXPECT_EQ(a->activeSessionCount(), 18u);
+    EXPECT_EQ(QVReportingStats::shared().dump().find("sessions")->asInt64(), 39);
+    // A message to every running session reaches exactly those.
+    send(*a, {{"everyone", 1}});
+    EXPECT_TRUE(holds(*a->findReportingSessionForID(20, false), "everyone"));
+    EXPECT_FALSE(holds(*a->findReportingSessionForID(21, false), "everyone"));
+    EXPECT_FALSE(holds(*a->findReportingSessionForID(3, false), "everyone"));
 }
 
 }  // namespace

@@ -5,6 +5,7 @@
 #include <atomic>
 #include <cmath>
 #include <future>
+#include <string>
 #include <thread>
 #include <vector>
 
@@ -44,6 +45,35 @@ TEST(ASerialQueue, RunsTasksOneAtATimeInPostOrderAndSyncRunsInlineOnItself) {
         EXPECT_GT(v % 1000, last[v / 1000]);
         last[v / 1000] = v % 1000;
     }
+}
+
+TEST(ASerialQueue, LetsLanesTakeTurnsAndSyncWaitsForEveryLane) {
+    SerialQueue queue("test.queue");
+    std::promise<void> release;
+    std::shared_future<void> gate = release.get_future().share();
+    std::vector<std::string> seen;         // touched only on the queue
+    queue.async([gate] { gate.wait(); });  // holds the queue while the lanes fill
+    const auto flooder = queue.makeLane();
+    const auto other = queue.makeLane();
+    for (int i = 0; i < 100; ++i) {
+        queue.async(flooder, [&seen, i] { seen.push_back("f" + std::to_string(i)); });
+    }
+    queue.async(other, [&seen] { seen.push_back("o0"); });
+    queue.async(other, [&seen] { seen.push_back("o1"); });
+    std::thread barrier([&] { queue.sync([&seen] { seen.push_back("sync"); }); });
+    queue.async(flooder, [&seen] { seen.push_back("late"); });
+    release.set_value();
+    barrier.join();
+    queue.sync([] {});
+    // A backlog of 100 holds the other lane's calls up by one task each, not by 100; the barrier
+    // comes once all 102 tasks posted before it ran. (The late task was posted after the sync
+    // began, so it may run before or after it, but after every other task of its lane.)
+    ASSERT_EQ(seen.size(), 104u);
+    EXPECT_EQ((std::vector<std::string>(seen.begin(), seen.begin() + 4)),
+              (std::vector<std::string>{"f0", "o0", "f1", "o1"}));
+    const auto at = [&](const std::string& s) { return std::find(seen.begin(), seen.end(), s); };
+    EXPECT_EQ(std::count_if(seen.begin(), at("sync"), [](auto& s) { return s != "late"; }), 102);
+    EXPECT_GT(at("late"), at("f99"));
 }
 
 TEST(ARepeatingTimer, FiresUntilItsHandlerDestroysIt) {

@@ -13,8 +13,8 @@
 //   sends     sends N messages of --bytes of text each to one started session (every payload
 //             different) and never reads the answers; prints "sent N" when all are written, then
 //             waits to be killed
-//   probe     calls ReporterIDValid every 10 ms for --seconds; prints "probe calls=N refused=N
-//             p50_ms=X p99_ms=X max_ms=X"
+//   probe     calls ReporterIDValid, then the bus's own GetId, every 10 ms for --seconds; prints
+//             "probe calls=N refused=N daemon p50_ms=X p99_ms=X max_ms=X; bus itself ..."
 #include <poll.h>
 #include <time.h>
 #include <unistd.h>
@@ -183,29 +183,51 @@ int sends(const Options& o) {
     return 0;
 }
 
-int probe(const Options& o) {
-    sd_bus* bus = connect(o.address);
-    std::vector<double> waits;
-    long refused = 0;
-    const double end = now() + o.seconds;
-    while (now() < end) {
-        sd_bus_error error = SD_BUS_ERROR_NULL;
-        sd_bus_message* reply = nullptr;
-        const double t = now();
-        const int r =
-            sd_bus_call(bus, idCall(bus, kReporterIDValid, 1), 120 * 1000000ull, &error, &reply);
-        waits.push_back((now() - t) * 1000);
-        refused += r < 0 ? 1 : 0;
-        sd_bus_message_unref(reply);
-        sd_bus_error_free(&error);
-        usleep(10000);
-    }
+// Times one call and waits until it is answered; false when it was answered with an error.
+bool timedCall(sd_bus* bus, sd_bus_message* m, std::vector<double>& waits) {
+    sd_bus_error error = SD_BUS_ERROR_NULL;
+    sd_bus_message* reply = nullptr;
+    const double t = now();
+    const int r = sd_bus_call(bus, m, 120 * 1000000ull, &error, &reply);
+    waits.push_back((now() - t) * 1000);
+    sd_bus_message_unref(m);
+    sd_bus_message_unref(reply);
+    sd_bus_error_free(&error);
+    return r >= 0;
+}
+
+std::string percentiles(std::vector<double> waits) {
     std::sort(waits.begin(), waits.end());
     auto at = [&](double q) {
         return waits.empty() ? 0.0 : waits[static_cast<std::size_t>(q * (waits.size() - 1))];
     };
-    std::printf("probe calls=%zu refused=%ld p50_ms=%.2f p99_ms=%.2f max_ms=%.2f\n", waits.size(),
-                refused, at(0.5), at(0.99), waits.empty() ? 0.0 : waits.back());
+    char text[128];
+    std::snprintf(text, sizeof text, "p50_ms=%.2f p99_ms=%.2f max_ms=%.2f", at(0.5), at(0.99),
+                  waits.empty() ? 0.0 : waits.back());
+    return text;
+}
+
+// Alternates a call to the daemon with one to the bus itself (GetId, answered by the broker): the
+// second is the baseline, what any client of this bus waits whatever the daemon does.
+int probe(const Options& o) {
+    sd_bus* bus = connect(o.address);
+    std::vector<double> daemonWaits, brokerWaits;
+    long refused = 0;
+    const double end = now() + o.seconds;
+    while (now() < end) {
+        refused += timedCall(bus, idCall(bus, kReporterIDValid, 1), daemonWaits) ? 0 : 1;
+        sd_bus_message* getId = nullptr;
+        if (const int r = sd_bus_message_new_method_call(bus, &getId, "org.freedesktop.DBus",
+                                                         "/org/freedesktop/DBus",
+                                                         "org.freedesktop.DBus", "GetId");
+            r < 0) {
+            die("new call", r);
+        }
+        timedCall(bus, getId, brokerWaits);
+        usleep(10000);
+    }
+    std::printf("probe calls=%zu refused=%ld daemon %s; bus itself %s\n", daemonWaits.size(),
+                refused, percentiles(daemonWaits).c_str(), percentiles(brokerWaits).c_str());
     return 0;
 }
 

@@ -17,6 +17,7 @@
 
 #include "platform/Clock.h"
 #include "platform/SafeFileName.h"
+#include "platform/linux/ThreadPriority.h"
 #include "values/ValueJson.h"
 
 namespace qv {
@@ -68,6 +69,7 @@ JsonlSink::JsonlSink(std::string stateDir, std::string name, const Clock& clock,
       writer_(std::make_unique<BoundedWriter<Line>>(
           BoundedWriter<Line>::kBatches, capacity_,
           [this](std::deque<Line>& lines) { writeBatch(lines); })) {
+    writer_->setMaxBytes(kMaxQueuedBytes);
     std::lock_guard lock(gSinksMutex);
     gSinks.push_back(this);
 }
@@ -96,7 +98,8 @@ bool JsonlSink::flushAll(std::chrono::steady_clock::time_point deadline) {
 }
 
 bool JsonlSink::append(Dictionary members) {
-    if (writer_->push(Line{clock_.now(), std::move(members)})) {
+    const std::size_t bytes = members.approximateHeapBytes();
+    if (writer_->push(Line{clock_.now(), std::move(members)}, bytes)) {
         dropping_.store(false, std::memory_order_relaxed);
         return true;
     }
@@ -104,8 +107,9 @@ bool JsonlSink::append(Dictionary members) {
         callbacks_.lineLost(name_);
     }
     if (!dropping_.exchange(true, std::memory_order_relaxed) && callbacks_.problem) {
-        callbacks_.problem(fmt::format("sink {}: its buffer of {} lines is full, dropping lines",
-                                       name_, capacity_));
+        callbacks_.problem(
+            fmt::format("sink {}: its buffer ({} lines, {} bytes) is full, dropping lines", name_,
+                        capacity_, kMaxQueuedBytes));
     }
     return false;
 }
@@ -144,6 +148,10 @@ void JsonlSink::formatLine(std::string& out, const Line& line) {
 }
 
 void JsonlSink::writeBatch(std::deque<Line>& lines) {
+    if (!threadPrepared_) {
+        threadPrepared_ = true;
+        QVReportingLowerOwnThreadPriority(kBackgroundNiceness);
+    }
     text_.clear();
     std::size_t pending = 0;
     for (const Line& line : lines) {

@@ -57,6 +57,9 @@ class JsonlSink {
   public:
     // Lines held for the sink's thread before further lines are dropped.
     static constexpr std::size_t kDefaultCapacity = 4096;
+    // Memory the lines held for the sink's thread may take (as their values estimate it), so
+    // that a flood of large messages cannot queue gigabytes for a disk that falls behind.
+    static constexpr std::size_t kMaxQueuedBytes = std::size_t{16} << 20;
 
     // name must be a plain file name (the daemon names its sinks); it is made safe all the same.
     // Nothing is opened yet: the first line makes the directory and opens the file.
@@ -124,6 +127,7 @@ class JsonlSink {
     bool tailChecked_ = false;     // sink's thread only: the file's end was looked at
     bool tornByUs_ = false;        // sink's thread only: our last write ended inside a line
     std::string text_;             // sink's thread only: lines being written
+    bool threadPrepared_ = false;  // sink's thread only: its priority lowered
 
     // Last, and reset first in the destructor: its thread uses every member above.
     std::unique_ptr<BoundedWriter<Line>> writer_;

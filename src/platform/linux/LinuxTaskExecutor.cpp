@@ -1,27 +1,13 @@
 #include "platform/linux/LinuxTaskExecutor.h"
 
+#include "platform/linux/ThreadPriority.h"
+
 #include <pthread.h>
-#include <sys/resource.h>
 #include <unistd.h>
 
 #include <cerrno>
 
 namespace qv {
-
-namespace {
-
-// Lowers the calling thread's priority by steps (on Linux a niceness belongs to a thread). A
-// thread may always make itself nicer, so this fails only on a system without priorities.
-void lowerOwnPriority(int steps) {
-    const pid_t tid = ::gettid();
-    errno = 0;
-    const int current = ::getpriority(PRIO_PROCESS, static_cast<id_t>(tid));
-    if (errno == 0) {
-        ::setpriority(PRIO_PROCESS, static_cast<id_t>(tid), current + steps);
-    }
-}
-
-}  // namespace
 
 LinuxTaskExecutor::LinuxTaskExecutor(std::size_t threads, std::string name) {
     if (threads == 0) {
@@ -34,7 +20,7 @@ LinuxTaskExecutor::LinuxTaskExecutor(std::size_t threads, std::string name) {
     for (std::size_t i = 0; i < threads; ++i) {
         threads_.emplace_back([this, threadName = name + "-" + std::to_string(i % 100)] {
             pthread_setname_np(pthread_self(), threadName.c_str());
-            lowerOwnPriority(kUtilityNiceness);
+            QVReportingLowerOwnThreadPriority(kBackgroundNiceness);
             run();
         });
     }

@@ -27,8 +27,6 @@ namespace qv {
 class LinuxTaskExecutor final : public TaskExecutor {
   public:
     static constexpr std::size_t kDefaultThreads = 2;
-    // How much lower than the process the pool's threads run (utility class).
-    static constexpr int kUtilityNiceness = 4;
 
     // name (at most 12 characters are kept) prefixes the threads' names: "<name>-<n>".
     explicit LinuxTaskExecutor(std::size_t threads = kDefaultThreads, std::string name = "qv-pool");
