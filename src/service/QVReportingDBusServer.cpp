@@ -324,7 +324,7 @@ void QVReportingDBusServer::registerReportingInterface() {
                 return answerNow(call, *decoded.error);
             }
             ReporterID id = 0;
-            call >> id;
+            QVReportingReadRest(call, decoded, id);
             client->setConfiguration(std::move(decoded.dictionary), id,
                                      boolReply(hold(std::move(call))));
         });
@@ -348,7 +348,7 @@ void QVReportingDBusServer::registerReportingInterface() {
             std::uint32_t category = 0;
             std::uint16_t type = 0;
             std::vector<std::int64_t> ids;
-            call >> category >> type >> ids;
+            QVReportingReadRest(call, decoded, category, type, ids);
             if (ids.size() > limits.maxReporterIDsPerMessage) {
                 QVReportingStats::shared().noteLimitExceeded(QVReportingStats::Limit::ReporterIDs);
                 return answerNow(call, QVReportingError::limitsExceeded(
