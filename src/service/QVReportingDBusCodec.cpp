@@ -295,18 +295,10 @@ std::string signatureOf(const Value& value) {
     return "av";
 }
 
-// The sd_bus_message under a message, which sdbus-c++ keeps protected: a pointer to the member,
-// taken in a class derived from Message, reads it.
-struct MessageAccess : sdbus::Message {
-    static sd_bus_message* of(const sdbus::Message& message) {
-        return static_cast<sd_bus_message*>(message.*(&MessageAccess::msg_));
-    }
-};
-
 // The whole call read again from its bytes; nothing when they cannot be had.
 std::optional<QVReportingDecodeResult> readFromBytes(const sdbus::Message& message,
                                                      const QVReportingInputBudget& budget) {
-    const auto bytes = QVReportingDBusMessageBytes::forThisThread().of(MessageAccess::of(message));
+    const auto bytes = QVReportingDBusMessageBytes::forThisThread().of(message);
     const auto wire = bytes ? QVReportingDBusWireReader::split(*bytes) : std::nullopt;
     if (!wire) {
         return std::nullopt;
