@@ -12,7 +12,8 @@
 // result, as the message can no longer be read on.
 // Writing: dates go out as doubles.
 //
-// Thread safety: the functions keep no state; a message must only be touched by one thread.
+// Thread safety: the functions keep no state (but for the private connection a thread that needed
+// one keeps for the next time); a message must only be touched by one thread.
 #pragma once
 
 #include <optional>

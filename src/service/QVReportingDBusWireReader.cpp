@@ -1,5 +1,7 @@
 #include "service/QVReportingDBusWireReader.h"
 
+#include "service/QVReportingDBusWireText.h"
+
 #include <fmt/format.h>
 
 #include <cstring>
@@ -12,123 +14,8 @@ namespace qv {
 namespace {
 
 constexpr std::size_t kMaxArrayBytes = std::size_t{1} << 26;  // D-Bus's bound on one array
-constexpr int kMaxSignatureNesting = 32;                      // arrays, and structs, in a type
 constexpr int kMaxContainerNesting = 64;                      // in a message, variants included
 constexpr std::uint8_t kSignatureField = 8;
-
-bool isBasic(char c) {
-    return std::string_view("ybnqiuxtdsogh").find(c) != std::string_view::npos;
-}
-
-// The length of the complete type that starts sig, 0 when none does.
-std::size_t completeType(std::string_view sig, int arrays = 0, int structs = 0) {
-    if (sig.empty()) {
-        return 0;
-    }
-    const char c = sig[0];
-    if (isBasic(c) || c == 'v') {
-        return 1;
-    }
-    if (c == 'a') {
-        if (arrays >= kMaxSignatureNesting) {
-            return 0;
-        }
-        if (sig.size() > 1 && sig[1] == '{') {
-            if (structs >= kMaxSignatureNesting || sig.size() < 3 || !isBasic(sig[2])) {
-                return 0;
-            }
-            const std::size_t value = completeType(sig.substr(3), arrays + 1, structs + 1);
-            return value && sig.size() > 3 + value && sig[3 + value] == '}' ? value + 4 : 0;
-        }
-        const std::size_t item = completeType(sig.substr(1), arrays + 1, structs);
-        return item ? item + 1 : 0;
-    }
-    if (c == '(') {
-        if (structs >= kMaxSignatureNesting) {
-            return 0;
-        }
-        std::size_t at = 1;
-        while (at < sig.size() && sig[at] != ')') {
-            const std::size_t item = completeType(sig.substr(at), arrays, structs + 1);
-            if (!item) {
-                return 0;
-            }
-            at += item;
-        }
-        return at < sig.size() && at > 1 ? at + 1 : 0;
-    }
-    return 0;
-}
-
-bool validSignature(std::string_view sig) {
-    if (sig.size() > 255) {
-        return false;
-    }
-    while (!sig.empty()) {
-        const std::size_t n = completeType(sig);
-        if (!n) {
-            return false;
-        }
-        sig.remove_prefix(n);
-    }
-    return true;
-}
-
-bool validObjectPath(std::string_view path) {
-    if (path.empty() || path[0] != '/') {
-        return false;
-    }
-    if (path.size() == 1) {
-        return true;
-    }
-    char previous = '\0';
-    for (char c : path) {
-        const bool word =
-            (c >= 'a' && c <= 'z') || (c >= 'A' && c <= 'Z') || (c >= '0' && c <= '9') || c == '_';
-        if (!word && !(c == '/' && previous != '/')) {
-            return false;
-        }
-        previous = c;
-    }
-    return previous != '/';
-}
-
-// UTF-8 as Unicode defines it; noncharacters are characters like any other.
-bool validUtf8(std::string_view s) {
-    for (std::size_t i = 0; i < s.size();) {
-        const auto lead = static_cast<std::uint8_t>(s[i]);
-        if (lead < 0x80) {
-            ++i;
-            continue;
-        }
-        std::size_t length = 0;
-        char32_t c = 0, least = 0;
-        if (lead >= 0xC2 && lead <= 0xDF) {
-            length = 2, c = lead & 0x1F, least = 0x80;
-        } else if (lead >= 0xE0 && lead <= 0xEF) {
-            length = 3, c = lead & 0x0F, least = 0x800;
-        } else if (lead >= 0xF0 && lead <= 0xF4) {
-            length = 4, c = lead & 0x07, least = 0x10000;
-        } else {
-            return false;
-        }
-        if (s.size() - i < length) {
-            return false;
-        }
-        for (std::size_t k = 1; k < length; ++k) {
-            const auto next = static_cast<std::uint8_t>(s[i + k]);
-            if ((next & 0xC0) != 0x80) {
-                return false;
-            }
-            c = (c << 6) | (next & 0x3F);
-        }
-        if (c < least || c > 0x10FFFF || (c >= 0xD800 && c <= 0xDFFF)) {
-            return false;
-        }
-        i += length;
-    }
-    return true;
-}
 
 // Fixed-size reads at D-Bus alignment; the body starts 8-aligned in its message, so offsets in
 // the body align as they do in the message.
@@ -296,13 +183,13 @@ bool Reader::readString(char type, std::string& out) {
     if (text.find('\0') != std::string_view::npos) {
         return malformed("holds a string with a NUL byte");
     }
-    if (type == 's' && !validUtf8(text)) {
+    if (type == 's' && !dbuswire::isValidUtf8(text)) {
         return malformed("holds a string that is not valid UTF-8");
     }
-    if (type == 'o' && !validObjectPath(text)) {
+    if (type == 'o' && !dbuswire::isValidObjectPath(text)) {
         return malformed("holds an invalid object path");
     }
-    if (type == 'g' && !validSignature(text)) {
+    if (type == 'g' && !dbuswire::isValidSignature(text)) {
         return malformed("holds an invalid signature");
     }
     out.assign(text);
@@ -370,7 +257,7 @@ bool Reader::read(std::string_view type, std::size_t depth, Value& out) {
             if (!in_.signature(contents)) {
                 return truncated();
             }
-            if (completeType(contents) != contents.size() || contents.empty()) {
+            if (dbuswire::completeTypeLength(contents) != contents.size() || contents.empty()) {
                 return malformed("holds a variant whose signature is not one type");
             }
             if (!enter() || !charge(contents.size() + 2) || !read(contents, depth, out)) {
@@ -448,7 +335,7 @@ bool Reader::readStruct(std::string_view contents, std::size_t depth, Value& out
     }
     Array items;
     while (!contents.empty()) {
-        const std::size_t n = completeType(contents);
+        const std::size_t n = dbuswire::completeTypeLength(contents);
         Value v;
         if (!read(contents.substr(0, n), depth, v)) {
             return false;
@@ -558,7 +445,7 @@ std::optional<QVReportingDBusWireReader::Message> QVReportingDBusWireReader::spl
             return std::nullopt;
         }
         if (code == kSignatureField) {
-            if (type[0] != 'g' || !validSignature(text)) {
+            if (type[0] != 'g' || !dbuswire::isValidSignature(text)) {
                 return std::nullopt;
             }
             message.signature.assign(text);
@@ -595,7 +482,7 @@ QVReportingDecodeResult QVReportingDBusWireReader::readArguments(
     Reader rest(in, unbounded);
     result.rest.emplace();
     for (signature.remove_prefix(5); !signature.empty();) {
-        const std::size_t n = completeType(signature);
+        const std::size_t n = dbuswire::completeTypeLength(signature);
         Value v;
         if (!rest.read(signature.substr(0, n), 0, v)) {
             result.error = std::move(rest.error);
