@@ -60,16 +60,39 @@ def raw_send(address, body):
         call = [(1, "o", OBJECT_PATH.encode()), (2, "s", INTERFACE.encode()),
                 (3, "s", b"SendMessage"), (6, "s", BUS_NAME.encode())]
         s.sendall(message(1, bus, b"", b"") + message(2, call, b"a{sv}uqax", body))
-        # The reply to the call (or the bus's hang-up), then a call the bus answers at once.
-        received = b""
+        # Then a Ping to the bus, which handles one connection's messages in order: its answer
+        # means the call went through; a hang-up means the bus refused the call.
         ping = [(1, "o", b"/org/freedesktop/DBus"), (2, "s", b"org.freedesktop.DBus.Peer"),
                 (3, "s", b"Ping"), (6, "s", b"org.freedesktop.DBus")]
-        try:
-            s.sendall(message(3, ping, b"", b""))
-            while b"\x03\x01" not in received and (chunk := s.recv(4096)):
+        s.sendall(message(3, ping, b"", b""))
+        received = b""
+
+        def take(n):
+            nonlocal received
+            while len(received) < n:
+                chunk = s.recv(4096)
+                if not chunk:
+                    raise ConnectionResetError
                 received += chunk
-            s.sendall(message(4, ping, b"", b""))
-            return s.recv(4096) != b""
+            out, received = received[:n], received[n:]
+            return out
+
+        try:
+            while b"\r\n" not in received:  # the bus's "OK <guid>" line comes first
+                chunk = s.recv(4096)
+                if not chunk:
+                    return False
+                received += chunk
+            received = received.split(b"\r\n", 1)[1]
+            while True:
+                head = take(16)
+                body_length, _, fields_length = struct.unpack("<III", head[4:16])
+                fields = take(fields_length + (-(16 + fields_length) % 8) + body_length)
+                # A reply (type 2) whose REPLY_SERIAL field (5, "u"; fields start 8-aligned) is 3.
+                for at in range(0, fields_length - 7, 8):
+                    if (head[1] == 2 and fields[at:at + 4] == b"\x05\x01u\x00" and
+                            struct.unpack("<I", fields[at + 4:at + 8])[0] == 3):
+                        return True
         except (BrokenPipeError, ConnectionResetError):
             return False
 
