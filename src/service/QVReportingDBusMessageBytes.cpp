@@ -57,8 +57,9 @@ QVReportingDBusMessageBytes& QVReportingDBusMessageBytes::forThisThread() {
 }
 
 void QVReportingDBusMessageBytes::disconnect() {
+    // Nothing queued is wanted any more: no flush, which could wait on a peer that reads no more.
     if (bus_) {
-        sd_bus_flush_close_unref(bus_);  // closes its end of the socketpair
+        sd_bus_close_unref(bus_);  // closes its end of the socketpair
         bus_ = nullptr;
     }
     if (peer_ >= 0) {
