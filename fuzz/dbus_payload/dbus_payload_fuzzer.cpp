@@ -13,13 +13,17 @@
 // - what it accepts keeps to the budget: no deeper than allowed, no more values;
 // - what it accepts, written back with QVReportingAppendDictionary and read again with the same
 //   depth and value limits, gives the same dictionary, kinds and key order included;
-// - after an accepted payload the message stands at what follows it (SendMessage's arguments).
+// - after an accepted payload the message stands at what follows it (SendMessage's arguments);
+// - the wire reader (the codec's fallback for strings sd-bus refuses), given the message's bytes,
+//   agrees with the sd-bus reader: the same dictionary when both accept, the same arguments after
+//   it, and under the budget it accepts what the sd-bus reader accepts.
 #include <fcntl.h>
 #include <unistd.h>
 
 #include <cstddef>
 #include <cstdint>
 #include <limits>
+#include <optional>
 #include <string>
 #include <vector>
 
@@ -30,7 +34,9 @@
 #include "common/DBusTypes.h"
 #include "common/FuzzSupport.h"
 #include "service/QVReportingDBusCodec.h"
+#include "service/QVReportingDBusMessageBytes.h"
 #include "service/QVReportingDBusNames.h"
+#include "service/QVReportingDBusWireReader.h"
 
 // Exported by libsdbus-c++ 1.2 (variants are built on it) but declared in its public headers only
 // by later versions: a message that belongs to no bus, which is all a reader needs.
@@ -204,6 +210,7 @@ struct Built {
     sdbus::PlainMessage message;
     bool startsWithPayload = false;  // the first argument is an a{sv}
     bool hadFd = false;
+    bool anyFd = false;  // anywhere in the message: it cannot be sent on a connection without fds
     bool sendMessage = false;  // a{sv}uqax: the arguments after the payload
     std::uint32_t category = 0;
     std::uint16_t type = 0;
@@ -257,6 +264,7 @@ bool build(FuzzInput& in, int fd, Built& out) {
     if (layout <= 2) {
         out.hadFd = builder.hadFd;
     }
+    out.anyFd = builder.hadFd;
     return true;
 }
 
@@ -282,6 +290,18 @@ QVReportingInputBudget budgetFrom(FuzzInput& in) {
         budget.maxBytes = in.u16() % 2048;
     }
     return budget;
+}
+
+// The message read from its bytes; nothing when it cannot be sent (it carries a unix fd).
+std::optional<QVReportingDecodeResult> readWire(const sdbus::Message& message,
+                                                const QVReportingInputBudget& budget) {
+    const auto bytes = qv::QVReportingDBusMessageBytes::forThisThread().of(message);
+    if (!bytes) {
+        return std::nullopt;
+    }
+    const auto wire = qv::QVReportingDBusWireReader::split(*bytes);
+    check(wire.has_value());
+    return qv::QVReportingDBusWireReader::readArguments(*wire, budget);
 }
 
 int openNull() {
@@ -325,6 +345,21 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
     }
     check(!free.error);
     check(qv::fuzz::sameDictionary(bounded.dictionary, free.dictionary));
+
+    if (const auto wire = readWire(built.message, budget)) {
+        check(!wire->error);
+        check(qv::fuzz::sameDictionary(wire->dictionary, bounded.dictionary));
+        check(wire->rest.has_value());
+        if (built.sendMessage) {
+            std::uint32_t category = 0;
+            std::uint16_t type = 0;
+            std::vector<std::int64_t> ids;
+            qv::QVReportingReadRest(built.message, *wire, category, type, ids);
+            check(category == built.category && type == built.type && ids == built.ids);
+        }
+    } else {
+        check(built.anyFd);
+    }
 
     // What was accepted keeps to the budget: the payload's values (the dictionary itself not
     // counted) and its nesting (the dictionary is the first level).

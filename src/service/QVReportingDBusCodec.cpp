@@ -4,6 +4,9 @@
 #include <sdbus-c++/Error.h>
 #include <sdbus-c++/Types.h>
 
+#include "service/QVReportingDBusMessageBytes.h"
+#include "service/QVReportingDBusWireReader.h"
+
 namespace qv {
 
 namespace {
@@ -21,7 +24,8 @@ class Reader {
     std::optional<QVReportingError> error;
     std::optional<QVReportingStats::Limit> limit;
     Dictionary topLevel;
-    std::string key;  // the top-level key being read, for error messages
+    std::string key;             // the top-level key being read, for error messages
+    bool stringRefused = false;  // sd-bus would not read a string (a key's or a value's)
     std::size_t bytes() const { return bytes_; }
 
   private:
@@ -66,10 +70,20 @@ class Reader {
         out = v;
         return charge(sizeof(T));
     }
+    // sd-bus refuses strings D-Bus allows (noncharacters): noted for a second reading.
+    template <typename T>
+    void readText(T& out) {
+        try {
+            m_ >> out;
+        } catch (const sdbus::Error&) {
+            stringRefused = true;
+            throw;
+        }
+    }
     template <typename T>
     bool readString(Value& out) {
         T v;
-        m_ >> v;
+        readText(v);
         const std::size_t size = v.size();
         out = std::string(std::move(v));
         return charge(size + 5);
@@ -231,7 +245,7 @@ bool Reader::readDictionary(const std::string& entrySignature, std::size_t depth
         Value k, v;
         std::string name;
         if (stringKeys) {
-            m_ >> name;
+            readText(name);
             if (isTopLevel) {
                 key.assign(name);  // named in errors; its buffer is reused entry after entry
             }
@@ -286,6 +300,22 @@ std::string signatureOf(const Value& value) {
     return "av";
 }
 
+// The whole call read again from its bytes; nothing when they cannot be had.
+std::optional<QVReportingDecodeResult> readFromBytes(const sdbus::Message& message,
+                                                     const QVReportingInputBudget& budget) {
+    const auto bytes = QVReportingDBusMessageBytes::forThisThread().of(message);
+    const auto wire = bytes ? QVReportingDBusWireReader::split(*bytes) : std::nullopt;
+    if (!wire) {
+        return std::nullopt;
+    }
+    return QVReportingDBusWireReader::readArguments(*wire, budget);
+}
+
+const Value& restAt(const QVReportingDecodeResult& decoded, std::size_t i) {
+    static const Value kMissing;
+    return i < decoded.rest->size() ? (*decoded.rest)[i] : kMissing;
+}
+
 }  // namespace
 
 QVReportingDecodeResult QVReportingReadDictionary(sdbus::Message& message,
@@ -298,6 +328,11 @@ QVReportingDecodeResult QVReportingReadDictionary(sdbus::Message& message,
             reader.error = QVReportingError::invalidArgs("the payload ended early");
         }
     } catch (const sdbus::Error& e) {
+        if (reader.stringRefused) {
+            if (auto again = readFromBytes(message, budget)) {
+                return std::move(*again);
+            }
+        }
         reader.error = QVReportingError::invalidArgs(
             reader.key.empty() ? e.getMessage()
                                : fmt::format("the value under \"{}\" cannot be read: {}",
@@ -310,6 +345,33 @@ QVReportingDecodeResult QVReportingReadDictionary(sdbus::Message& message,
         result.dictionary = std::move(reader.topLevel);
     }
     return result;
+}
+
+void QVReportingReadRest(sdbus::Message& message, const QVReportingDecodeResult& decoded,
+                         std::int64_t& reporterID) {
+    if (!decoded.rest) {
+        message >> reporterID;
+        return;
+    }
+    reporterID = restAt(decoded, 0).asInt64().value_or(0);
+}
+
+void QVReportingReadRest(sdbus::Message& message, const QVReportingDecodeResult& decoded,
+                         std::uint32_t& category, std::uint16_t& type,
+                         std::vector<std::int64_t>& reporterIDs) {
+    if (!decoded.rest) {
+        message >> category >> type >> reporterIDs;
+        return;
+    }
+    // The wire reader gives unsigned integers that fit as signed ones, as the codec does.
+    category = static_cast<std::uint32_t>(restAt(decoded, 0).asInt64().value_or(0));
+    type = static_cast<std::uint16_t>(restAt(decoded, 1).asInt64().value_or(0));
+    reporterIDs.clear();
+    if (const Array* ids = restAt(decoded, 2).asArray()) {
+        for (const Value& id : *ids) {
+            reporterIDs.push_back(id.asInt64().value_or(0));
+        }
+    }
 }
 
 void QVReportingAppendVariant(sdbus::Message& message, const Value& value) {

@@ -6,13 +6,19 @@
 // beyond the limits, is refused with a reason naming the key. The limits measure what the payload
 // will hold: each value counts (a pair too, a variant's wrapping not), and each level of nesting
 // (a pair's too), so that a payload read back from the daemon's own writing fits them as well.
+// A string sd-bus will not read (it refuses Unicode noncharacters, which D-Bus allows) makes the
+// reader take the call's bytes and read them itself (QVReportingDBusWireReader), with the same
+// result, or the same refusal with the key named; the call's other arguments then come with the
+// result, as the message can no longer be read on.
 // Writing: dates go out as doubles.
 //
-// Thread safety: the functions keep no state; a message must only be touched by one thread.
+// Thread safety: the functions keep no state (but for the private connection a thread that needed
+// one keeps for the next time); a message must only be touched by one thread.
 #pragma once
 
 #include <optional>
 #include <string>
+#include <vector>
 
 #include <sdbus-c++/Message.h>
 
@@ -31,6 +37,9 @@ struct QVReportingInputBudget {
 
 struct QVReportingDecodeResult {
     Dictionary dictionary;
+    // The arguments after the dictionary, when they were read with it from the call's bytes;
+    // otherwise they are still in the message.
+    std::optional<Array> rest;
     // Set when the input was refused; the limit (when it was one) is in limit.
     std::optional<QVReportingError> error;
     std::optional<QVReportingStats::Limit> limit;
@@ -41,6 +50,14 @@ struct QVReportingDecodeResult {
 // Reads an a{sv} at the message's current position.
 QVReportingDecodeResult QVReportingReadDictionary(sdbus::Message& message,
                                                   const QVReportingInputBudget& budget);
+
+// The arguments after the dictionary (SetConfiguration's, SendMessage's): from decoded.rest when
+// it holds them, from the message otherwise.
+void QVReportingReadRest(sdbus::Message& message, const QVReportingDecodeResult& decoded,
+                         std::int64_t& reporterID);
+void QVReportingReadRest(sdbus::Message& message, const QVReportingDecodeResult& decoded,
+                         std::uint32_t& category, std::uint16_t& type,
+                         std::vector<std::int64_t>& reporterIDs);
 
 // Appends a value as a variant.
 void QVReportingAppendVariant(sdbus::Message& message, const Value& value);

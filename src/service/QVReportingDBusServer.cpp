@@ -472,7 +472,7 @@ void QVReportingDBusServer::registerReportingInterface() {
                 return;
             }
             ReporterID id = 0;
-            call >> id;
+            QVReportingReadRest(call, decoded, id);
             auto instance = client->instance;
             const std::size_t bytes = payloadBytes(decoded);
             instance->setConfiguration(std::move(decoded.dictionary), id,
@@ -493,7 +493,7 @@ void QVReportingDBusServer::registerReportingInterface() {
             std::uint32_t category = 0;
             std::uint16_t type = 0;
             std::vector<std::int64_t> ids;
-            call >> category >> type >> ids;
+            QVReportingReadRest(call, decoded, category, type, ids);
             if (ids.size() > limits_.maxReporterIDsPerMessage) {
                 QVReportingStats::shared().noteLimitExceeded(QVReportingStats::Limit::ReporterIDs);
                 return refuse(call, QVReportingError::limitsExceeded(
