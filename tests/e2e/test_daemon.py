@@ -76,6 +76,7 @@ class BadInput(DaemonTestCase):
         with self.assertRaises(dbus.exceptions.DBusException) as caught:
             call()
         self.assertEqual(caught.exception.get_dbus_name(), error_name)
+        return caught.exception.get_dbus_message()
 
     def test_input_beyond_limits_or_of_foreign_types_is_refused_and_counted(self):
         c = self.client()
@@ -88,7 +89,9 @@ class BadInput(DaemonTestCase):
                                "org.freedesktop.DBus.Error.InvalidArgs")
         limits = "org.freedesktop.DBus.Error.LimitsExceeded"
         self.assertRefused(lambda: c.send(deep, 1, 0, [5]), limits)
-        self.assertRefused(lambda: c.send({"big": "x" * 70000}, 1, 0, [5]), limits)
+        # The refusal names the key that passed the limit.
+        self.assertIn('"big"', self.assertRefused(
+            lambda: c.send({"small": 1, "big": "x" * 70000}, 1, 0, [5]), limits))
         self.assertRefused(lambda: c.send({"k": 1}, 1, 0, list(range(1, 2000))), limits)
         self.assertRefused(lambda: c.send({f"k{i}": i for i in range(10001)}, 1, 0, [5]), limits)
         stats = c.stats.GetStats()
@@ -98,6 +101,46 @@ class BadInput(DaemonTestCase):
         line = wait_until(lambda: self.daemon.events("com.korvane.qvsound.Generic.Generic"),
                           what="a good message after the bad ones")[0]["payload"]
         self.assertEqual((line["t"], line["st"]), (2**64 - 1, [1, "two"]))
+
+
+class CallBudgets(DaemonTestCase):
+    daemon_args = ("--max-held-calls-per-client", "2", "--max-call-bytes-per-client", "8192",
+                   "--max-payload-bytes-per-second", "1")
+
+    def test_held_starts_and_payload_bytes_are_bounded_per_client_and_unanswerable_calls_let_go(self):
+        c, other = self.client(), self.client()
+        for rid in (1, 2, 3):
+            c.create(rid)
+        c.start(1)
+        for _ in range(50):  # starts of a started session: never answered, so nothing is kept
+            c.start(1)
+        wait_until(lambda: (lambda s: s["held_calls"] == 1 and s["calls_awaiting_reply"] == 1)(
+            c.stats.GetStats()), what="the unanswerable starts to be let go")
+        c.start(2)
+        wait_until(lambda: c.stats.GetStats()["held_calls"] == 2, what="the second start held")
+        refused = "org.freedesktop.DBus.Error.LimitsExceeded"
+        with self.assertRaises(dbus.exceptions.DBusException) as caught:
+            c.reporting.StartReportingSession(dbus.Int64(3))  # a third held call
+        self.assertEqual(caught.exception.get_dbus_name(), refused)
+        self.assertTrue(c.stop(1))  # answers its held start
+        c.start(3)
+        wait_until(lambda: c.stats.GetStats()["held_calls"] == 2,
+                   what="the third start held")
+        other.create(4)  # another client has budgets of its own
+        other.start(4)
+
+        # A burst up to the call budget passes; then the client waits for its allowance.
+        c.send({"blob": "x" * 5000}, 1, 0, [3])
+        c.send({"blob": "x" * 5000}, 1, 0, [3])
+        with self.assertRaises(dbus.exceptions.DBusException) as caught:
+            c.send({"blob": "x"}, 1, 0, [3])
+        self.assertEqual(caught.exception.get_dbus_name(), refused)
+        self.assertIn("a second", caught.exception.get_dbus_message())
+        other.send({"blob": "x" * 5000}, 1, 0, [4])
+        stats = c.stats.GetStats()
+        self.assertEqual((stats["held_calls"], stats["held_calls_max"]), (3, 3))
+        self.assertEqual(stats["limit_exceeded_payload_rate_per_client"], 1)
+        self.assertGreaterEqual(stats["limit_exceeded_held_calls_per_client"], 1)
 
 
 class Notifications(DaemonTestCase):
