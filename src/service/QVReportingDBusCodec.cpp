@@ -12,56 +12,22 @@ namespace qv {
 namespace {
 
 // Reads values one complete type at a time, keeping count of what the input costs.
-class Reader {
+class Reader : public QVReportingPayloadMeter {
   public:
     Reader(sdbus::Message& message, const QVReportingInputBudget& budget)
-        : m_(message), budget_(budget) {}
+        : QVReportingPayloadMeter(budget), m_(message) {}
 
     bool readDictionary(const std::string& entrySignature, std::size_t depth, Value& out,
                         bool topLevel);
     bool read(std::size_t depth, Value& out);
 
-    std::optional<QVReportingError> error;
-    std::optional<QVReportingStats::Limit> limit;
     Dictionary topLevel;
-    std::string key;             // the top-level key being read, for error messages
     bool stringRefused = false;  // sd-bus would not read a string (a key's or a value's)
-    std::size_t bytes() const { return bytes_; }
 
   private:
     bool atEnd(std::string& type, std::string& contents) {
         m_.peekType(type, contents);
         return type.empty() || type[0] == '\0';
-    }
-    bool charge(std::size_t bytes) {
-        bytes_ += bytes;
-        if (bytes_ > budget_.maxBytes) {
-            return refuse(QVReportingStats::Limit::PayloadBytes,
-                          fmt::format("a payload may hold at most {} bytes", budget_.maxBytes));
-        }
-        return true;
-    }
-    // Values are counted as the payload will hold them, so that what is accepted keeps to the
-    // limit once decoded.
-    bool countValue() {
-        if (++values_ > budget_.maxValues) {
-            return refuse(QVReportingStats::Limit::PayloadValues,
-                          fmt::format("a payload may hold at most {} values", budget_.maxValues));
-        }
-        return true;
-    }
-    bool refuseDepth() {
-        return refuse(QVReportingStats::Limit::PayloadDepth,
-                      fmt::format("a payload may nest at most {} deep", budget_.maxDepth));
-    }
-    bool refuse(QVReportingStats::Limit which, std::string why) {
-        limit = which;
-        // The key tells the client which part of its payload to look at.
-        if (!key.empty()) {
-            why += fmt::format(" (passed at the value under \"{}\")", key);
-        }
-        error = QVReportingError::limitsExceeded(std::move(why));
-        return false;
     }
     template <typename T>
     bool readScalar(Value& out) {
@@ -92,9 +58,6 @@ class Reader {
     bool readStruct(const std::string& contents, std::size_t depth, Value& out);
 
     sdbus::Message& m_;
-    const QVReportingInputBudget& budget_;
-    std::size_t bytes_ = 0;
-    std::size_t values_ = 0;
 };
 
 bool Reader::read(std::size_t depth, Value& out) {
@@ -171,8 +134,8 @@ bool Reader::read(std::size_t depth, Value& out) {
 }
 
 bool Reader::readArray(const std::string& contents, std::size_t depth, Value& out) {
-    if (depth > budget_.maxDepth) {
-        return refuseDepth();
+    if (!enterDepth(depth)) {
+        return false;
     }
     if (!charge(4)) {
         return false;
@@ -210,8 +173,8 @@ bool Reader::readArray(const std::string& contents, std::size_t depth, Value& ou
 }
 
 bool Reader::readStruct(const std::string& contents, std::size_t depth, Value& out) {
-    if (depth > budget_.maxDepth) {
-        return refuseDepth();
+    if (!enterDepth(depth)) {
+        return false;
     }
     m_.enterStruct(contents);
     Array items;
@@ -234,8 +197,8 @@ bool Reader::readDictionary(const std::string& entrySignature, std::size_t depth
     const bool stringKeys = !entrySignature.empty() && entrySignature[0] == 's';
     // Entries with keys of another type become [key, value] pairs: a value each, one level down.
     const std::size_t entryDepth = stringKeys ? depth : depth + 1;
-    if (!stringKeys && entryDepth > budget_.maxDepth) {
-        return refuseDepth();
+    if (!stringKeys && !enterDepth(entryDepth)) {
+        return false;
     }
     Dictionary dict;
     Array pairs;

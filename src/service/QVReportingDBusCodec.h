@@ -23,17 +23,11 @@
 #include <sdbus-c++/Message.h>
 
 #include "service/QVReportingError.h"
+#include "service/QVReportingPayloadMeter.h"
 #include "session/QVReportingStats.h"
 #include "values/Value.h"
 
 namespace qv {
-
-// Bounds on one payload or configuration read from a client.
-struct QVReportingInputBudget {
-    std::size_t maxBytes;
-    std::size_t maxValues;
-    std::size_t maxDepth;
-};
 
 struct QVReportingDecodeResult {
     Dictionary dictionary;

@@ -77,48 +77,18 @@ class Cursor {
 };
 
 // QVReportingReadDictionary's reader, over bytes: its structure and its charges are the codec's.
-class Reader {
+class Reader : public QVReportingPayloadMeter {
   public:
-    Reader(Cursor& in, const QVReportingInputBudget& budget) : in_(in), budget_(budget) {}
+    Reader(Cursor& in, const QVReportingInputBudget& budget)
+        : QVReportingPayloadMeter(budget), in_(in) {}
 
     bool readDictionary(std::string_view entrySignature, std::size_t depth, Value& out,
                         bool isTopLevel);
     bool read(std::string_view type, std::size_t depth, Value& out);
 
-    std::optional<QVReportingError> error;
-    std::optional<QVReportingStats::Limit> limit;
     Dictionary topLevel;
-    std::string key;  // the top-level key being read, for error messages
-    std::size_t bytes() const { return bytes_; }
 
   private:
-    bool charge(std::size_t bytes) {
-        bytes_ += bytes;
-        if (bytes_ > budget_.maxBytes) {
-            return refuse(QVReportingStats::Limit::PayloadBytes,
-                          fmt::format("a payload may hold at most {} bytes", budget_.maxBytes));
-        }
-        return true;
-    }
-    bool countValue() {
-        if (++values_ > budget_.maxValues) {
-            return refuse(QVReportingStats::Limit::PayloadValues,
-                          fmt::format("a payload may hold at most {} values", budget_.maxValues));
-        }
-        return true;
-    }
-    bool refuseDepth() {
-        return refuse(QVReportingStats::Limit::PayloadDepth,
-                      fmt::format("a payload may nest at most {} deep", budget_.maxDepth));
-    }
-    bool refuse(QVReportingStats::Limit which, std::string why) {
-        limit = which;
-        if (!key.empty()) {
-            why += fmt::format(" (passed at the value under \"{}\")", key);
-        }
-        error = QVReportingError::limitsExceeded(std::move(why));
-        return false;
-    }
     bool malformed(std::string_view what) {
         error = QVReportingError::invalidArgs(
             !inKey_       ? fmt::format("the value under \"{}\" {}", key, what)
@@ -152,9 +122,6 @@ class Reader {
     bool openArray(std::size_t itemAlignment, std::size_t& end);
 
     Cursor& in_;
-    const QVReportingInputBudget& budget_;
-    std::size_t bytes_ = 0;
-    std::size_t values_ = 0;
     int open_ = 0;
     bool inKey_ = false;
 };
@@ -286,8 +253,8 @@ bool Reader::read(std::string_view type, std::size_t depth, Value& out) {
 }
 
 bool Reader::readArray(std::string_view contents, std::size_t depth, Value& out) {
-    if (depth > budget_.maxDepth) {
-        return refuseDepth();
+    if (!enterDepth(depth)) {
+        return false;
     }
     if (!charge(4)) {
         return false;
@@ -328,8 +295,8 @@ bool Reader::readArray(std::string_view contents, std::size_t depth, Value& out)
 }
 
 bool Reader::readStruct(std::string_view contents, std::size_t depth, Value& out) {
-    if (depth > budget_.maxDepth) {
-        return refuseDepth();
+    if (!enterDepth(depth)) {
+        return false;
     }
     if (!enter()) {
         return false;
@@ -361,8 +328,8 @@ bool Reader::readDictionary(std::string_view entrySignature, std::size_t depth, 
     const bool stringKeys = entrySignature[0] == 's';
     // Entries with keys of another type become [key, value] pairs: a value each, one level down.
     const std::size_t entryDepth = stringKeys ? depth : depth + 1;
-    if (!stringKeys && entryDepth > budget_.maxDepth) {
-        return refuseDepth();
+    if (!stringKeys && !enterDepth(entryDepth)) {
+        return false;
     }
     const std::string_view keyType = entrySignature.substr(0, 1);
     const std::string_view valueType = entrySignature.substr(1);
