@@ -130,8 +130,12 @@ int main(int argc, char** argv) {
     if (!device.loadError().empty()) {
         QVLOG_ERROR(logCategory(), "device file ignored: {}", device.loadError());
     }
+    if (device.fileRefused()) {
+        QVReportingStats::shared().noteFileRefused();
+    }
     LinuxProcessInfo process;
-    LinuxPreferenceStore preferences(options->stateDir, reportProblem);
+    LinuxPreferenceStore preferences(options->stateDir, reportProblem,
+                                     [] { QVReportingStats::shared().noteFileRefused(); });
     LinuxNotificationCenter notifications;
     const SinkCallbacks sinkCallbacks{
         [](std::string_view sink) { QVReportingStats::shared().noteSinkLineLost(sink); },
@@ -195,7 +199,8 @@ int main(int argc, char** argv) {
                     QVLOG_ERROR(QVReportingAudioRegistrationCategory(), "{}", line);
                     break;
             }
-        });
+        },
+        [] { QVReportingStats::shared().noteFileRefused(); });
     LinuxIssueCaptureService issueCapture(
         clock, preferences,
         std::make_unique<JsonlSink>(options->stateDir,
