@@ -245,6 +245,7 @@ std::string QVReportingCtlFormatSinkLine(std::string_view sink, std::string_view
         time = QVReportingCtlFormatUTC(t->get<double>());
         object.erase("time");
     }
+    object.erase("seq");  // where the line is, not what it says: kept for scripts (--json)
     std::string text =
         fmt::format("{} {} {}", time, sink,
                     object.dump(-1, ' ', false, nlohmann::ordered_json::error_handler_t::replace));

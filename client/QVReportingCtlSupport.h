@@ -58,9 +58,9 @@ std::string QVReportingCtlSinkPath(const std::string& stateDir, std::string_view
 bool QVReportingCtlIsSinkName(std::string_view sink);
 
 // One sink line for output. For people: "<UTC time> <sink> <the other fields as JSON>", the
-// "time" field shown as an ISO 8601 date; for scripts: the line's object with "sink" first. An
-// "mtx" line's "record" (base64 of the metric's wire bytes) is shown decoded as an
-// AudioIssueDetected (see QVReportingCtlDecodeMTXRecord). A line that is not a JSON object is
+// "time" field shown as an ISO 8601 date and the "seq" left out; for scripts: the line's object
+// with "sink" first. An "mtx" line's "record" (base64 of the metric's wire bytes) is shown decoded
+// as an AudioIssueDetected (see QVReportingCtlDecodeMTXRecord). A line that is not a JSON object is
 // shown as it is, marked unreadable.
 std::string QVReportingCtlFormatSinkLine(std::string_view sink, std::string_view line, bool json);
 

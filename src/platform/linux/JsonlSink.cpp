@@ -20,6 +20,7 @@
 #include "platform/SafeFileName.h"
 #include "platform/SinkSegments.h"
 #include "platform/linux/DiskBudget.h"
+#include "platform/linux/RegularFile.h"
 #include "values/ValueJson.h"
 
 namespace qv {
@@ -114,25 +115,6 @@ int openRegularForReading(const std::string& path, struct stat& st) {
         return -1;
     }
     return fd;
-}
-
-const char* fileKind(mode_t mode) {
-    switch (mode & S_IFMT) {
-        case S_IFDIR:
-            return "a directory";
-        case S_IFIFO:
-            return "a FIFO";
-        case S_IFSOCK:
-            return "a socket";
-        case S_IFCHR:
-            return "a character device";
-        case S_IFBLK:
-            return "a block device";
-        case S_IFLNK:
-            return "a symbolic link";
-        default:
-            return "not a regular file";
-    }
 }
 
 }  // namespace
@@ -375,13 +357,13 @@ bool JsonlSink::openFile(std::string& reason) {
     const int error = errno;
     if (fd >= 0) {
         ::close(fd);
-        reason =
-            fmt::format("refused {}: it is {}, not a regular file", path_, fileKind(st.st_mode));
+        reason = fmt::format("refused {}: it is {}, not a regular file", path_,
+                             QVReportingFileKind(st.st_mode));
     } else if (error == ELOOP || error == ENXIO || error == EISDIR) {
         struct stat link {};
-        reason = fmt::format(
-            "refused {}: it is {}, not a regular file", path_,
-            ::lstat(path_.c_str(), &link) == 0 ? fileKind(link.st_mode) : "not a regular file");
+        reason = fmt::format("refused {}: it is {}, not a regular file", path_,
+                             ::lstat(path_.c_str(), &link) == 0 ? QVReportingFileKind(link.st_mode)
+                                                                : "of an unknown kind");
     } else {
         reason = fmt::format("cannot open {}: {}", path_, errnoText(error));
         return false;

@@ -20,8 +20,12 @@ RegularFileRead refused(std::string reason) {
     return r;
 }
 
-const char* kindOf(mode_t mode) {
+}  // namespace
+
+const char* QVReportingFileKind(unsigned mode) {
     switch (mode & S_IFMT) {
+        case S_IFREG:
+            return "a regular file";
         case S_IFDIR:
             return "a directory";
         case S_IFIFO:
@@ -32,12 +36,12 @@ const char* kindOf(mode_t mode) {
             return "a character device";
         case S_IFBLK:
             return "a block device";
+        case S_IFLNK:
+            return "a symbolic link";
         default:
-            return "something else";
+            return "of an unknown kind";
     }
 }
-
-}  // namespace
 
 RegularFileRead QVReportingReadRegularFile(const std::string& path, std::size_t maxBytes) {
     int fd;
@@ -62,7 +66,8 @@ RegularFileRead QVReportingReadRegularFile(const std::string& path, std::size_t 
         return refused(fmt::format("cannot examine it: {}", std::strerror(errno)));
     }
     if (!S_ISREG(st.st_mode)) {
-        return refused(fmt::format("it is {}, not a regular file", kindOf(st.st_mode)));
+        return refused(
+            fmt::format("it is {}, not a regular file", QVReportingFileKind(st.st_mode)));
     }
     if (static_cast<std::uint64_t>(st.st_size) > maxBytes) {
         return refused(

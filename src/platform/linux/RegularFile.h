@@ -22,4 +22,7 @@ struct RegularFileRead {
 // maxBytes (also when it grows past them while being read), or unreadable.
 RegularFileRead QVReportingReadRegularFile(const std::string& path, std::size_t maxBytes);
 
+// What a file of this st_mode is, for a log line: "a FIFO", "a directory", "a symbolic link"...
+const char* QVReportingFileKind(unsigned mode);
+
 }  // namespace qv
