@@ -94,16 +94,16 @@ class Bus:
 
 
 class Daemon:
-    def __init__(self, bus, state_dir, *extra):
+    def __init__(self, bus, state_dir, *extra, preexec_fn=None, timeout=10.0):
         self.state_dir = state_dir
         self.log_path = os.path.join(state_dir, "..", "qvreportd.log")
         self.log = open(self.log_path, "w")
         self.process = subprocess.Popen(
             [DAEMON, "--bus", bus.address, "--state-dir", state_dir, "--log-level", "debug", *extra],
-            stderr=self.log, stdout=self.log)
+            stderr=self.log, stdout=self.log, preexec_fn=preexec_fn)
         probe = bus.connect()
         wait_until(lambda: probe.name_has_owner(BUS_NAME) or self.process.poll() is not None,
-                   what="the daemon to own its name")
+                   timeout=timeout, what="the daemon to own its name")
         probe.close()
         if self.process.poll() is not None:
             raise RuntimeError("qvreportd exited: " + self.log_text())
@@ -112,13 +112,22 @@ class Daemon:
         with open(self.log_path, errors="replace") as f:
             return f.read()
 
+    def sink_lines(self, sink):
+        """Every line of a sink, across its closed segments (by name) and then the current one."""
+        sinks = os.path.join(self.state_dir, "sinks")
+        closed = sorted(n for n in os.listdir(sinks) if n.startswith(sink + ".")
+                        and n.endswith(".jsonl") and n[len(sink) + 1:-6].isdigit()) \
+            if os.path.isdir(sinks) else []
+        lines = []
+        for name in closed + [sink + ".jsonl"]:
+            path = os.path.join(sinks, name)
+            if os.path.exists(path):
+                with open(path) as f:
+                    lines += [json.loads(line) for line in f if line.strip()]
+        return lines
+
     def events(self, prefix=""):
-        path = os.path.join(self.state_dir, "sinks", "analytics.jsonl")
-        if not os.path.exists(path):
-            return []
-        with open(path) as f:
-            lines = [json.loads(line) for line in f if line.strip()]
-        return [l for l in lines if l["event"].startswith(prefix)]
+        return [l for l in self.sink_lines("analytics") if l["event"].startswith(prefix)]
 
     def stop(self):
         if self.process.poll() is None:

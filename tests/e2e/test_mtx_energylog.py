@@ -57,7 +57,7 @@ class MTXSink(DaemonTestCase):
         self.assertEqual(self.daemon.stop(), 0)
         records = sink_lines(self.daemon, "mtx")
         self.assertEqual(len(records), 3, "only type 7 makes a record")
-        self.assertEqual([list(r) for r in records], [["time", "metric", "record"]] * 3)
+        self.assertEqual([list(r) for r in records], [["time", "seq", "metric", "record"]] * 3)
         self.assertEqual({r["metric"] for r in records}, {5963779})
 
         wires = [base64.b64decode(r["record"], validate=True) for r in records]
@@ -101,7 +101,7 @@ class EnergyLogSink(DaemonTestCase):
         events = sink_lines(self.daemon, "energylog")
         self.assertEqual(len(events), 5)
         self.assertEqual({e["registry"] for e in events}, {28})
-        self.assertEqual([list(e) for e in events], [["time", "registry", "event", "payload"]] * 5)
+        self.assertEqual([list(e) for e in events], [["time", "seq", "registry", "event", "payload"]] * 5)
         self.assertEqual([e["event"] for e in events],
                          ["Vantrel_Haptics_EngineOnDuration", "Vantrel_Haptics_ClientStatus",
                           "LeakedHapticsSessionInfo", "Vantrel_Haptics_EngineOnDuration",
