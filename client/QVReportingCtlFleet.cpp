@@ -1,0 +1,274 @@
+// qvreportctl fleet: the exporter's counters (export/status.json), and the stream it fills read
+// back: every device's sink lines, and the devices seen with their last report.
+#include <fstream>
+#include <iostream>
+#include <map>
+#include <memory>
+
+#include <fmt/format.h>
+
+#include "QVReportingCtl.h"
+#include "QVReportingCtlSupport.h"
+#include "QVReportingExportConnection.h"
+#include "QVReportingExportFiles.h"
+
+namespace qv::ctl {
+
+namespace {
+
+using qv::exporter::QVReportingExportNatsError;
+
+// How long an empty or quiet stream is waited on before `tail` without --follow ends.
+constexpr int kQuietMs = 2000;
+// JetStream requests (stream information, making the reading consumer): a cluster that has just
+// lost a node answers slowly.
+constexpr int kRequestWaitMs = 20000;
+// A status file older than this means the exporter is not running (it writes every second).
+constexpr double kStaleStatusSeconds = 10;
+
+// Holds a connection and its JetStream context for one command.
+class Stream {
+  public:
+    explicit Stream(const FleetOptions& fleet) {
+        qv::exporter::QVReportingExportServerSettings settings;
+        settings.urls = fleet.urls;
+        settings.credsFile = fleet.creds;
+        settings.nkeyFile = fleet.nkey;
+        settings.tlsCAFile = fleet.tlsCA;
+        std::string error;
+        options_ = qv::exporter::QVReportingExportNatsOptions(settings, "qvreportctl", error);
+        if (!options_) {
+            throw UsageError{error};
+        }
+        if (const natsStatus s = natsConnection_Connect(&connection_, options_); s != NATS_OK) {
+            throw Failure{"cannot connect to " + fleet.urls + ": " + QVReportingExportNatsError(s)};
+        }
+        jsOptions options;
+        jsOptions_Init(&options);
+        options.Wait = kRequestWaitMs;
+        if (const natsStatus s = natsConnection_JetStream(&js_, connection_, &options);
+            s != NATS_OK) {
+            throw Failure{"JetStream: " + QVReportingExportNatsError(s)};
+        }
+        name_ = fleet.stream;
+    }
+    ~Stream() {
+        jsCtx_Destroy(js_);
+        natsConnection_Destroy(connection_);
+        natsOptions_Destroy(options_);
+    }
+    Stream(const Stream&) = delete;
+    Stream& operator=(const Stream&) = delete;
+
+    jsCtx* js() const { return js_; }
+    const std::string& name() const { return name_; }
+
+    // The stream's subjects matching filter, with their message counts.
+    std::map<std::string, std::uint64_t> subjects(const std::string& filter) const {
+        jsOptions options;
+        jsOptions_Init(&options);
+        options.Stream.Info.SubjectsFilter = filter.c_str();
+        jsStreamInfo* info = nullptr;
+        jsErrCode code = static_cast<jsErrCode>(0);
+        if (const natsStatus s = js_GetStreamInfo(&info, js_, name_.c_str(), &options, &code);
+            s != NATS_OK) {
+            throw Failure{"stream " + name_ + ": " + QVReportingExportNatsError(s)};
+        }
+        std::map<std::string, std::uint64_t> out;
+        if (const auto* list = info->State.Subjects) {
+            for (int i = 0; i < list->Count; ++i) {
+                out[list->List[i].Subject] = list->List[i].Msgs;
+            }
+        }
+        jsStreamInfo_Destroy(info);
+        return out;
+    }
+
+  private:
+    natsOptions* options_ = nullptr;
+    natsConnection* connection_ = nullptr;
+    jsCtx* js_ = nullptr;
+    std::string name_;
+};
+
+// "qvreporting.DEVICE.SINK" -> (DEVICE, SINK).
+bool splitSubject(std::string_view subject, std::string& device, std::string& sink) {
+    constexpr std::string_view kPrefix = "qvreporting.";
+    if (!subject.starts_with(kPrefix)) {
+        return false;
+    }
+    subject.remove_prefix(kPrefix.size());
+    const auto dot = subject.find('.');
+    if (dot == std::string_view::npos || subject.find('.', dot + 1) != std::string_view::npos) {
+        return false;
+    }
+    device = subject.substr(0, dot);
+    sink = subject.substr(dot + 1);
+    return true;
+}
+
+std::string filterFor(const FleetOptions& fleet) {
+    return fmt::format("qvreporting.{}.{}", fleet.device.empty() ? "*" : fleet.device,
+                       fleet.sink.empty() ? "*" : fleet.sink);
+}
+
+// A stream message as `sinks` prints a line, with its device first.
+void printLine(const Options& options, natsMsg* msg) {
+    std::string device, sink;
+    if (!splitSubject(natsMsg_GetSubject(msg), device, sink)) {
+        return;
+    }
+    const std::string_view data(natsMsg_GetData(msg),
+                                static_cast<std::size_t>(natsMsg_GetDataLength(msg)));
+    const std::string line = qv::client::QVReportingCtlFormatSinkLine(sink, data, options.json);
+    if (!options.json) {
+        std::cout << device << ' ' << line << '\n';
+        return;
+    }
+    Json out = {{"device", device}};
+    Json parsed = Json::parse(line);
+    for (auto& [key, value] : parsed.items()) {
+        out[key] = std::move(value);
+    }
+    std::cout << dump(out) << '\n';
+}
+
+}  // namespace
+
+int fleetStatus(const Options& options) {
+    const auto path = qv::exporter::QVReportingExportStatusPath(options.stateDir);
+    std::ifstream in(path);
+    const Json status = Json::parse(in, nullptr, false);
+    if (!in.is_open()) {
+        throw Failure{"no exporter status in " + path.string() +
+                      " (qvreport-export writes it while it runs)"};
+    }
+    if (!status.is_object() || !status.contains("sinks")) {
+        throw Failure{path.string() + " is not an exporter status"};
+    }
+    if (options.json) {
+        emit(status);
+        return 0;
+    }
+    const double updated = status.value("updated", 0.0);
+    std::cout << fmt::format("device {} -> {} (stream {}): {}, stream {}\n",
+                             status.value("device", ""), status.value("servers", ""),
+                             status.value("stream", ""),
+                             status.value("connected", false) ? "connected" : "not connected",
+                             status.value("stream_ready", false) ? "ready" : "not ready");
+    std::cout << "updated " << qv::client::QVReportingCtlFormatUTC(updated);
+    if (now() - updated > kStaleStatusSeconds) {
+        std::cout << fmt::format(" ({:.0f} s ago: is qvreport-export running?)", now() - updated);
+    }
+    std::cout << '\n';
+    if (const auto error = status.value("last_error", ""); !error.empty()) {
+        std::cout << "last error: " << error << '\n';
+    }
+    std::cout << fmt::format("{:<14}{:>10}{:>14}{:>12}{:>9}{:>8}{:>9}{:>12}{:>11}{:>13}\n", "sink",
+                             "sent", "acknowledged", "duplicates", "retried", "failed", "expired",
+                             "cursor", "lag_lines", "lag_seconds");
+    for (const auto& [name, c] : status["sinks"].items()) {
+        std::cout << fmt::format(
+            "{:<14}{:>10}{:>14}{:>12}{:>9}{:>8}{:>9}{:>12}{:>11}{:>13.1f}\n", name,
+            c.value("sent", 0ull), c.value("acknowledged", 0ull), c.value("duplicates", 0ull),
+            c.value("retried", 0ull), c.value("failed", 0ull), c.value("expired", 0ull),
+            c.value("cursor", 0ull), c.value("lag_lines", 0ull), c.value("lag_seconds", 0.0));
+    }
+    return 0;
+}
+
+int fleetTail(const Options& options, const FleetOptions& fleet) {
+    if (!fleet.sink.empty() && !qv::client::QVReportingCtlIsSinkName(fleet.sink)) {
+        throw UsageError{"not a sink name: " + fleet.sink};
+    }
+    Stream stream(fleet);
+    const std::string filter = filterFor(fleet);
+    if (!fleet.follow && stream.subjects(filter).empty()) {
+        return 0;
+    }
+    jsSubOptions sub;
+    jsSubOptions_Init(&sub);
+    sub.Stream = stream.name().c_str();
+    sub.Ordered = true;  // in stream order, no acknowledgements, restarted by the library on gaps
+    natsSubscription* subscription = nullptr;
+    jsErrCode code = static_cast<jsErrCode>(0);
+    if (const natsStatus s =
+            js_SubscribeSync(&subscription, stream.js(), filter.c_str(), nullptr, &sub, &code);
+        s != NATS_OK) {
+        throw Failure{"cannot read " + stream.name() + ": " + QVReportingExportNatsError(s)};
+    }
+    std::unique_ptr<natsSubscription, void (*)(natsSubscription*)> owner(subscription,
+                                                                         natsSubscription_Destroy);
+    for (;;) {
+        natsMsg* msg = nullptr;
+        const natsStatus s = natsSubscription_NextMsg(&msg, subscription, kQuietMs);
+        if (s == NATS_TIMEOUT) {
+            std::cout.flush();
+            if (fleet.follow) {
+                continue;
+            }
+            return 0;  // nothing more came, though the stream said there was something
+        }
+        if (s != NATS_OK) {
+            throw Failure{"reading " + stream.name() + ": " + QVReportingExportNatsError(s)};
+        }
+        printLine(options, msg);
+        jsMsgMetaData* meta = nullptr;
+        const bool last = natsMsg_GetMetaData(&meta, msg) == NATS_OK && meta->NumPending == 0;
+        jsMsgMetaData_Destroy(meta);
+        natsMsg_Destroy(msg);
+        if (last) {
+            std::cout.flush();
+            if (!fleet.follow) {
+                return 0;
+            }
+        }
+    }
+}
+
+int fleetDevices(const Options& options, const FleetOptions& fleet) {
+    Stream stream(fleet);
+    struct Device {
+        double lastReport = 0;
+        std::map<std::string, std::uint64_t> sinks;
+    };
+    std::map<std::string, Device> devices;
+    for (const auto& [subject, count] : stream.subjects("qvreporting.*.*")) {
+        std::string device, sink;
+        if (!splitSubject(subject, device, sink)) {
+            continue;
+        }
+        auto& seen = devices[device];
+        seen.sinks[sink] = count;
+        // The last line of each of its sinks says when the device last reported.
+        natsMsg* msg = nullptr;
+        jsErrCode code = static_cast<jsErrCode>(0);
+        if (js_GetLastMsg(&msg, stream.js(), stream.name().c_str(), subject.c_str(), nullptr,
+                          &code) == NATS_OK) {
+            const Json line =
+                Json::parse(std::string_view(natsMsg_GetData(msg),
+                                             static_cast<std::size_t>(natsMsg_GetDataLength(msg))),
+                            nullptr, false);
+            if (line.is_object() && line.contains("time") && line["time"].is_number()) {
+                seen.lastReport = std::max(seen.lastReport, line["time"].get<double>());
+            }
+            natsMsg_Destroy(msg);
+        }
+    }
+    for (const auto& [device, seen] : devices) {
+        if (options.json) {
+            emit({{"device", device}, {"last_report", seen.lastReport}, {"sinks", seen.sinks}});
+            continue;
+        }
+        std::string sinks;
+        for (const auto& [sink, count] : seen.sinks) {
+            sinks += fmt::format("{}{} {}", sinks.empty() ? "" : ", ", sink, count);
+        }
+        std::cout << device << "  last report "
+                  << qv::client::QVReportingCtlFormatUTC(seen.lastReport) << "  lines: " << sinks
+                  << '\n';
+    }
+    return 0;
+}
+
+}  // namespace qv::ctl
