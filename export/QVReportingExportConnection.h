@@ -19,8 +19,6 @@ struct QVReportingExportServerSettings {
     std::string tlsCAFile;  // the servers' CA, when TLS is used
     std::string stream = "QVREPORTING";
     int replicas = 1;
-    // No acknowledgement within this counts as a failed publish.
-    std::chrono::milliseconds ackWait{5000};
     // The stream's duplicate window: longer than any resend takes (the acknowledgement wait, the
     // longest back-off, and a restart of the exporter).
     std::chrono::seconds duplicateWindow{600};

@@ -2,6 +2,7 @@
 
 #include <algorithm>
 #include <charconv>
+#include <cstdio>
 
 #include <nats/nats.h>
 
@@ -13,7 +14,7 @@ constexpr const char* kSubjects = "qvreporting.>";
 constexpr const char* kMessageIDHeader = "Nats-Msg-Id";
 // Reconnect back-off: doubling from the first delay up to the last, as long as it takes.
 constexpr std::int64_t kFirstReconnectDelayMs = 100;
-constexpr std::int64_t kLongestReconnectDelayMs = 5000;
+constexpr std::int64_t kLongestReconnectDelayMs = 2000;
 
 std::int64_t reconnectDelay(natsConnection*, int attempts, void*) {
     const int doublings = std::clamp(attempts - 1, 0, 16);
@@ -184,20 +185,42 @@ std::string QVReportingExportPublisher::ensureStream() {
 
 std::string QVReportingExportPublisher::publish(std::string_view sink, std::uint64_t seq,
                                                 std::string_view text) {
-    const std::string subj = subject(device_, sink);
-    const std::string id = messageID(device_, sink, seq);
+    auto prefix = idPrefixes_.find(sink);
+    if (prefix == idPrefixes_.end()) {
+        prefix =
+            idPrefixes_.emplace(std::string(sink), device_ + "." + std::string(sink) + ".").first;
+    }
+    // "qvreporting." + the ID's prefix without its last dot is the subject.
+    char subject[256];
+    char id[256];
+    const auto& idPrefix = prefix->second;
+    if (idPrefix.size() + 32 > sizeof(id)) {
+        return "sink name too long: " + std::string(sink);
+    }
+    std::snprintf(subject, sizeof(subject), "qvreporting.%.*s",
+                  static_cast<int>(idPrefix.size() - 1), idPrefix.data());
+    std::snprintf(id, sizeof(id), "%s%llu", idPrefix.c_str(), static_cast<unsigned long long>(seq));
     natsMsg* msg = nullptr;
     natsStatus s =
-        natsMsg_Create(&msg, subj.c_str(), nullptr, text.data(), static_cast<int>(text.size()));
+        natsMsg_Create(&msg, subject, nullptr, text.data(), static_cast<int>(text.size()));
     if (s == NATS_OK) {
         jsPubOptions options;
         jsPubOptions_Init(&options);
-        options.MsgId = id.c_str();
-        options.MaxWait = settings_.ackWait.count();
+        options.MsgId = id;
         s = js_PublishMsgAsync(nats_->js, &msg, &options);
     }
     natsMsg_Destroy(msg);  // nothing when the library took it
     return s == NATS_OK ? std::string() : QVReportingExportNatsError(s);
+}
+
+std::size_t QVReportingExportPublisher::abandonPending() {
+    natsMsgList pending{};
+    if (js_PublishAsyncGetPendingList(&pending, nats_->js) != NATS_OK) {
+        return 0;  // NATS_NOT_FOUND: nothing pending
+    }
+    const auto count = static_cast<std::size_t>(pending.Count);
+    natsMsgList_Destroy(&pending);
+    return count;
 }
 
 void QVReportingExportPublisher::drain(std::chrono::milliseconds timeout) {

@@ -6,14 +6,18 @@
 // Subject "qvreporting.DEVICE.SINK", header "Nats-Msg-Id: DEVICE.SINK.SEQ": a line sent twice
 // is stored once within the stream's duplicate window.
 //
-// Thread safety: start(), ensureStream(), publish() and drain() are called from one
-// thread. The callbacks run on the library's threads, never inside publish().
+// Acknowledgements are waited for without a time-out here: the caller decides when one is late
+// and abandons what is pending.
+//
+// Thread safety: start(), ensureStream(), publish(), abandonPending() and drain() are called from
+// one thread. The callbacks run on the library's threads, never inside publish().
 #pragma once
 
 #include <chrono>
 #include <cstddef>
 #include <cstdint>
 #include <functional>
+#include <map>
 #include <memory>
 #include <string>
 #include <string_view>
@@ -50,6 +54,9 @@ class QVReportingExportPublisher {
     // Publishes one line asynchronously. An empty string, or why the library refused it at once
     // (then no callback comes for it).
     std::string publish(std::string_view sink, std::uint64_t seq, std::string_view text);
+    // Drops every publish still waiting for its acknowledgement: no callback comes for those any
+    // more (an acknowledgement on its way is discarded). Returns how many.
+    std::size_t abandonPending();
     // Waits up to timeout for the acknowledgements in flight.
     void drain(std::chrono::milliseconds timeout);
 
@@ -62,6 +69,8 @@ class QVReportingExportPublisher {
     QVReportingExportServerSettings settings_;
     std::string device_;
     Callbacks callbacks_;
+    // "DEVICE.SINK." of each sink published to, the message ID's prefix (publishing thread only).
+    std::map<std::string, std::string, std::less<>> idPrefixes_;
 };
 
 }  // namespace qv::exporter

@@ -33,6 +33,11 @@ void log(const std::string& line) {
     std::cerr << "qvreport-export: " << line << std::endl;
 }
 
+// A steady time point in seconds, as the windows keep it.
+double seconds(std::chrono::steady_clock::time_point time) {
+    return std::chrono::duration<double>(time.time_since_epoch()).count();
+}
+
 double wallClock() {
     return std::chrono::duration<double>(std::chrono::system_clock::now().time_since_epoch())
         .count();
@@ -165,6 +170,7 @@ int QVReportingExportShipper::run() {
             nextDiscovery = now + kDiscoveryInterval;
         }
         ensureStream(now);
+        abandonLateLines(now);
         const bool read = readLines();
         const bool sent = sendLines(now);
         now = Clock::now();
@@ -186,7 +192,7 @@ int QVReportingExportShipper::run() {
         }
         wake_.wait_until(lock, until);
     }
-    publisher_->drain(settings_.server.ackWait);
+    publisher_->drain(settings_.ackWait);
     saveCursor();
     writeStatus();
     log("stopped");
@@ -280,8 +286,12 @@ bool QVReportingExportShipper::sendLines(Clock::time_point now) {
             if (now < holdUntil_ || stopping_) {
                 return any;
             }
-            batch =
-                sink->window.take(settings_.maxPending - std::min(settings_.maxPending, inFlight_));
+            // After a failure one line goes out alone until the stream acknowledges again, so
+            // that a recovering cluster is not answered with a whole window of refusals.
+            const std::size_t room =
+                probing_ ? (inFlight_ == 0 ? 1 : 0)
+                         : settings_.maxPending - std::min(settings_.maxPending, inFlight_);
+            batch = sink->window.take(room, seconds(now));
             inFlight_ += batch.size();
             auto& counters = stats_.sinks[name];
             counters.sent += batch.size();
@@ -299,6 +309,30 @@ bool QVReportingExportShipper::sendLines(Clock::time_point now) {
     return any;
 }
 
+void QVReportingExportShipper::abandonLateLines(Clock::time_point now) {
+    const double late = seconds(now - settings_.ackWait);
+    {
+        std::lock_guard lock(mutex_);
+        if (std::none_of(sinks_.begin(), sinks_.end(), [&](const auto& sink) {
+                const auto sentAt = sink.second->window.oldestSentAt();
+                return sentAt && *sentAt < late;
+            })) {
+            return;
+        }
+    }
+    // The library forgets them first, so that no acknowledgement arrives for a line the windows
+    // have already put back to be sent again.
+    publisher_->abandonPending();
+    std::lock_guard lock(mutex_);
+    for (auto& [name, sink] : sinks_) {
+        const auto failed = sink->window.failAll();
+        stats_.sinks[name].failed += failed;
+        inFlight_ -= failed;
+    }
+    noteFailureLocked("no acknowledgement within " + std::to_string(settings_.ackWait.count()) +
+                      " ms");
+}
+
 void QVReportingExportShipper::acknowledged(std::string_view name, std::uint64_t seq,
                                             bool duplicate) {
     std::lock_guard lock(mutex_);
@@ -310,6 +344,10 @@ void QVReportingExportShipper::acknowledged(std::string_view name, std::uint64_t
     ++counters.acknowledged;
     counters.duplicates += duplicate ? 1 : 0;
     backoff_ = kFirstBackoff;
+    if (probing_) {
+        probing_ = false;
+        wake_.notify_all();
+    }
     // Wake the sender once half the room is free, not at every acknowledgement.
     if (inFlight_-- == settings_.maxPending / 2 + 1) {
         wake_.notify_all();
@@ -330,6 +368,7 @@ void QVReportingExportShipper::failed(std::string_view name, std::uint64_t seq,
 
 void QVReportingExportShipper::noteFailureLocked(const std::string& error) {
     stats_.lastError = error;
+    probing_ = true;
     const auto now = Clock::now();
     // One back-off step per round of failures, however many lines failed in it.
     if (now >= holdUntil_) {

@@ -6,10 +6,10 @@
 // windows and counters under the lock. At most maxPending lines are in flight in all.
 //
 // Faults: a failed publish holds every sink's sending for a back-off (250 ms doubling to 4 s,
-// back to 250 ms at the next acknowledgement) and the sink resends from its oldest line not
-// acknowledged; servers that cannot be reached are retried by the connection for as long as it
-// takes, the lines staying in their segments; lines the disk budget removed before they were
-// read are counted as expired and logged.
+// back to 250 ms at the next acknowledgement), then a single line goes out until one is
+// acknowledged, and each sink resends from its oldest line not acknowledged; servers that cannot be
+// reached are retried by the connection for as long as it takes, the lines staying in their
+// segments; lines the disk budget removed before they were read are counted as expired and logged.
 //
 // Thread safety: run() on one thread; stop() from any thread (a signal-waiting thread).
 #pragma once
@@ -43,6 +43,8 @@ struct QVReportingExportSettings {
     QVReportingExportServerSettings server;
     // Acknowledgements in flight, all sinks together.
     std::size_t maxPending = 4096;
+    // A line in flight for longer counts as failed, and so does everything then in flight.
+    std::chrono::milliseconds ackWait{5000};
 };
 
 class QVReportingExportShipper {
@@ -68,6 +70,8 @@ class QVReportingExportShipper {
     bool readLines();
     // Publishes what the windows have waiting; true when any was sent.
     bool sendLines(Clock::time_point now);
+    // Past the acknowledgement wait, everything in flight is abandoned and sent again.
+    void abandonLateLines(Clock::time_point now);
     void saveCursor();
     void writeStatus();
 
@@ -95,6 +99,7 @@ class QVReportingExportShipper {
     std::size_t inFlight_ = 0;                                         // GUARDED_BY(mutex_)
     Clock::time_point holdUntil_{};                                    // GUARDED_BY(mutex_)
     std::chrono::milliseconds backoff_;                                // GUARDED_BY(mutex_)
+    bool probing_ = false;                                             // GUARDED_BY(mutex_)
     bool stopping_ = false;                                            // GUARDED_BY(mutex_)
 };
 

@@ -10,14 +10,15 @@ std::uint64_t QVReportingExportWindow::add(std::uint64_t seq, std::string text, 
     }
     const std::uint64_t missing = seq - last_ - 1;
     last_ = seq;
-    lines_.push_back(Line{seq, std::move(text), time, State::Waiting, false});
+    lines_.push_back(Line{seq, std::move(text), time, State::Waiting, false, 0});
     if (lines_.size() == 1) {
         cursor_ = seq - 1;  // the expired lines before it are behind the cursor now
     }
     return missing;
 }
 
-std::vector<QVReportingExportWindow::Outgoing> QVReportingExportWindow::take(std::size_t limit) {
+std::vector<QVReportingExportWindow::Outgoing> QVReportingExportWindow::take(std::size_t limit,
+                                                                             double now) {
     std::vector<Outgoing> out;
     if (settling_) {
         return out;
@@ -27,9 +28,10 @@ std::vector<QVReportingExportWindow::Outgoing> QVReportingExportWindow::take(std
         if (line.state != State::Waiting) {
             continue;
         }
-        out.push_back(Outgoing{line.seq, line.text, line.sent});
+        out.push_back(Outgoing{line.seq, std::string_view(line.text), line.sent});
         line.state = State::InFlight;
         line.sent = true;
+        line.sentAt = now;
         ++inFlight_;
     }
     return out;
@@ -94,6 +96,20 @@ void QVReportingExportWindow::rewindWhenSettled() {
         settling_ = false;
         next_ = 0;
     }
+}
+
+std::optional<double> QVReportingExportWindow::oldestSentAt() const {
+    // Lines go out in seq order, and after a failure again from the oldest once none is in
+    // flight, so the first line in flight is the one sent longest ago.
+    if (inFlight_ == 0) {
+        return std::nullopt;
+    }
+    for (const auto& line : lines_) {
+        if (line.state == State::InFlight) {
+            return line.sentAt;
+        }
+    }
+    return std::nullopt;
 }
 
 std::optional<double> QVReportingExportWindow::oldestTime() const {

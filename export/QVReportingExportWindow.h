@@ -18,16 +18,19 @@
 #include <deque>
 #include <optional>
 #include <string>
+#include <string_view>
 #include <vector>
 
 namespace qv::exporter {
 
 class QVReportingExportWindow {
   public:
-    // A line to publish, copied out so that it is sent without the window's lock.
+    // A line to publish. The text stays where it is while the line is in flight (a line leaves
+    // the window only once acknowledged, and other lines coming and going do not move it), so
+    // it is read without the window's lock by the thread that took it.
     struct Outgoing {
         std::uint64_t seq = 0;
-        std::string text;
+        std::string_view text;
         bool retry = false;  // it was sent before and failed
     };
 
@@ -37,9 +40,9 @@ class QVReportingExportWindow {
     // before (expired before they were read). A line at or below the last one is ignored.
     std::uint64_t add(std::uint64_t seq, std::string text, double time);
 
-    // Up to limit lines to publish now, in seq order, marked in flight. None while a failure is
-    // settling.
-    std::vector<Outgoing> take(std::size_t limit);
+    // Up to limit lines to publish now, in seq order, marked in flight and sent at now (any
+    // steady clock, in seconds). None while a failure is settling.
+    std::vector<Outgoing> take(std::size_t limit, double now = 0);
 
     // The stream acknowledged seq. False for a line that was not in flight (already
     // acknowledged, or never sent from this window).
@@ -50,6 +53,8 @@ class QVReportingExportWindow {
     // Every line in flight failed at once (the publisher dropped what it was waiting for).
     // Returns how many.
     std::size_t failAll();
+    // When the longest-waiting line in flight was sent (the now of its take()).
+    std::optional<double> oldestSentAt() const;
 
     // The seq up to which every line is acknowledged or expired.
     std::uint64_t cursor() const { return cursor_; }
@@ -70,6 +75,7 @@ class QVReportingExportWindow {
         double time;
         State state;
         bool sent;
+        double sentAt;
     };
 
     Line* find(std::uint64_t seq);

@@ -20,7 +20,7 @@ int run(int argc, char** argv) {
     auto& server = settings.server;
     std::string stateDir;
     server.urls = "nats://127.0.0.1:4222";
-    int ackWaitMs = static_cast<int>(server.ackWait.count());
+    int ackWaitMs = static_cast<int>(settings.ackWait.count());
     int duplicateWindowS = static_cast<int>(server.duplicateWindow.count());
 
     CLI::App app{
@@ -65,7 +65,7 @@ int run(int argc, char** argv) {
     } catch (const CLI::ParseError& e) {
         return app.exit(e) == 0 ? 0 : 2;
     }
-    server.ackWait = std::chrono::milliseconds(ackWaitMs);
+    settings.ackWait = std::chrono::milliseconds(ackWaitMs);
     server.duplicateWindow = std::chrono::seconds(duplicateWindowS);
     settings.stateDir = stateDir.empty() ? QVReportingExportDefaultStateDirectory() : stateDir;
 

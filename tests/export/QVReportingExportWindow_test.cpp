@@ -88,6 +88,29 @@ TEST(QVReportingExportWindow, AFailureSettlesThenResendsEverythingNotAcknowledge
     EXPECT_EQ(window.size(), 0u);
 }
 
+TEST(QVReportingExportWindow, LateLinesAreFoundByWhenTheyWereSentAndFailTogether) {
+    auto window = withLines(0, 1, 5);
+    EXPECT_EQ(window.oldestSentAt(), std::nullopt);
+    window.take(2, 10.0);
+    window.take(2, 11.0);
+    EXPECT_EQ(window.oldestSentAt(), 10.0);
+    window.acknowledge(1);
+    EXPECT_EQ(window.oldestSentAt(), 10.0) << "2 went out with 1";
+    window.acknowledge(2);
+    EXPECT_EQ(window.oldestSentAt(), 11.0);
+    window.acknowledge(4);
+    EXPECT_EQ(window.failAll(), 1u);  // 3
+    EXPECT_FALSE(window.settling()) << "nothing is left in flight to settle";
+    EXPECT_EQ(window.oldestSentAt(), std::nullopt);
+    const auto resent = window.take(10, 20.0);
+    EXPECT_EQ(seqs(resent), (std::vector<std::uint64_t>{3, 5}));
+    EXPECT_TRUE(resent[0].retry);
+    EXPECT_EQ(window.oldestSentAt(), 20.0);
+    EXPECT_EQ(window.failAll(), 2u);
+    EXPECT_EQ(window.failAll(), 0u);
+    EXPECT_EQ(window.cursor(), 2u);
+}
+
 TEST(QVReportingExportWindow, LinesMissingBetweenLinesReadAreExpiredAndPassedOnceTheOlderAreIn) {
     QVReportingExportWindow window(40);
     EXPECT_EQ(window.add(40, "old", 0), 0u) << "at or below the last line: ignored";
