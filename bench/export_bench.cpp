@@ -21,6 +21,7 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <atomic>
 #include <chrono>
 #include <cstdio>
@@ -40,6 +41,7 @@ using Clock = std::chrono::steady_clock;
 using namespace std::chrono_literals;
 
 constexpr int kMaxPending = 4096;
+constexpr int kRounds = 3;
 
 [[noreturn]] void fail(const std::string& what) {
     std::fprintf(stderr, "qv_export_bench: %s\n", what.c_str());
@@ -188,13 +190,12 @@ struct Nats {
         return count;
     }
 
-    void publish(const std::string& text, std::uint64_t seq) {
-        const std::string id = "bench.analytics." + std::to_string(seq);
+    void publish(const char* subject, const std::string& text, std::uint64_t seq) {
+        const std::string id = std::string(subject) + "." + std::to_string(seq);
         jsPubOptions options;
         jsPubOptions_Init(&options);
         options.MsgId = id.c_str();
-        check(js_PublishAsync(js, "qvbench.device.analytics", text.data(),
-                              static_cast<int>(text.size()), &options),
+        check(js_PublishAsync(js, subject, text.data(), static_cast<int>(text.size()), &options),
               "publish");
     }
 };
@@ -246,38 +247,60 @@ int main(int argc, char** argv) {
         "flight at most\n",
         static_cast<unsigned long long>(lines), bytes / lines, url.c_str(), kMaxPending);
 
+    // Rounds alternate, and each side's best counts: the machine is shared, and a round that
+    // another process slowed says nothing about either side.
     Nats nats(url);
-    nats.addStream("QVBENCH", "qvbench.>");
-    auto start = Clock::now();
-    for (std::uint64_t seq = 1; seq <= lines; ++seq) {
-        nats.publish(texts[seq - 1], seq);
-    }
     jsPubOptions wait;
     jsPubOptions_Init(&wait);
     wait.MaxWait = 120000;
-    check(js_PublishAsyncComplete(nats.js, &wait), "waiting for acknowledgements");
-    const double plainSeconds = std::chrono::duration<double>(Clock::now() - start).count();
-    if (nats.errors > 0 || nats.messages("QVBENCH") != lines) {
-        fail("the plain publisher lost lines");
-    }
-
-    start = Clock::now();
-    const pid_t shipper = spawn({exporter, "--state-dir", (work / "state").string(), "--nats-url",
-                                 url, "--max-pending", std::to_string(kMaxPending)},
-                                (work / "exporter.log").string());
-    while (nats.messages("QVREPORTING") < lines) {
-        if (Clock::now() - start > 300s) {
-            fail("the exporter did not ship every line; see " + (work / "exporter.log").string());
+    double plainBest = 0;
+    double exporterBest = 0;
+    pid_t shipper = 0;
+    for (int round = 1; round <= kRounds; ++round) {
+        const std::string stream = "QVBENCH" + std::to_string(round);
+        nats.addStream(stream.c_str(), ("qvbench" + std::to_string(round) + ".>").c_str());
+        const std::string subject = "qvbench" + std::to_string(round) + ".device.analytics";
+        auto start = Clock::now();
+        for (std::uint64_t seq = 1; seq <= lines; ++seq) {
+            nats.publish(subject.c_str(), texts[seq - 1], seq);
         }
-        std::this_thread::sleep_for(5ms);
+        check(js_PublishAsyncComplete(nats.js, &wait), "waiting for acknowledgements");
+        const double plainSeconds = std::chrono::duration<double>(Clock::now() - start).count();
+        if (nats.errors > 0 || nats.messages(stream.c_str()) != lines) {
+            fail("the plain publisher lost lines");
+        }
+
+        // The exporter starts afresh each round: no stream, no cursor.
+        if (shipper) {
+            stop(shipper);
+            js_DeleteStream(nats.js, "QVREPORTING", nullptr, nullptr);
+            std::filesystem::remove_all(work / "state" / "export");
+        }
+        start = Clock::now();
+        shipper = spawn({exporter, "--state-dir", (work / "state").string(), "--nats-url", url,
+                         "--max-pending", std::to_string(kMaxPending)},
+                        (work / "exporter.log").string());
+        while (nats.messages("QVREPORTING") < lines) {
+            if (Clock::now() - start > 300s) {
+                fail("the exporter did not ship every line; see " +
+                     (work / "exporter.log").string());
+            }
+            std::this_thread::sleep_for(5ms);
+        }
+        const double exporterSeconds = std::chrono::duration<double>(Clock::now() - start).count();
+        const double plainRate = static_cast<double>(lines) / plainSeconds;
+        const double exporterRate = static_cast<double>(lines) / exporterSeconds;
+        std::printf(
+            "round %d: plain libnats async publisher %.0f lines/s, qvreport-export %.0f "
+            "lines/s: ratio %.2f\n",
+            round, plainRate, exporterRate, exporterRate / plainRate);
+        plainBest = std::max(plainBest, plainRate);
+        exporterBest = std::max(exporterBest, exporterRate);
     }
-    const double exporterSeconds = std::chrono::duration<double>(Clock::now() - start).count();
-    const double plainRate = static_cast<double>(lines) / plainSeconds;
-    const double exporterRate = static_cast<double>(lines) / exporterSeconds;
     std::printf(
-        "throughput: plain libnats async publisher %.0f lines/s, qvreport-export %.0f "
-        "lines/s (from the sink file, start included): ratio %.2f\n",
-        plainRate, exporterRate, exporterRate / plainRate);
+        "throughput, best of %d: plain libnats async publisher %.0f lines/s, qvreport-export "
+        "%.0f lines/s (from the sink file, its start included): ratio %.2f\n",
+        kRounds, plainBest, exporterBest, exporterBest / plainBest);
 
     // Cost at a daemon's everyday pace.
     const auto paced = [&](auto&& onLine) {
@@ -293,7 +316,7 @@ int main(int argc, char** argv) {
     paced([&](std::uint64_t seq) { appendLine(sinkFile, line(seq)); });
     const double exporterCPU = (processCPU(shipper) - cpu) / seconds;
     const double own = ownCPU();
-    paced([&](std::uint64_t seq) { nats.publish(line(seq), seq); });
+    paced([&](std::uint64_t seq) { nats.publish("qvbench1.device.analytics", line(seq), seq); });
     check(js_PublishAsyncComplete(nats.js, &wait), "waiting for acknowledgements");
     const double plainCPU = (ownCPU() - own) / seconds;
     const auto shipped = nats.messages("QVREPORTING");
