@@ -1,4 +1,5 @@
-// qvreportctl sinks: the sink files printed, merged by time, or followed.
+// qvreportctl sinks: the sink files printed (each sink across its segments, oldest first, the
+// sinks merged by time), or followed.
 #include <algorithm>
 #include <filesystem>
 #include <iostream>
@@ -7,6 +8,7 @@
 
 #include "QVReportingCtl.h"
 #include "QVReportingCtlSupport.h"
+#include "platform/SinkSegments.h"
 
 namespace qv::ctl {
 
@@ -20,43 +22,43 @@ int printSinks(const Options& options, const std::string& sink, bool follow) {
     if (!sink.empty() && !qv::client::QVReportingCtlIsSinkName(sink)) {
         throw UsageError{"not a sink name: " + sink};
     }
+    const std::filesystem::path sinksDir = std::filesystem::path(options.stateDir) / "sinks";
     const auto sinkNames = [&] {
         return sink.empty() ? qv::client::QVReportingCtlListSinks(options.stateDir)
                             : std::vector<std::string>{sink};
     };
-    std::map<std::string, qv::client::QVReportingSinkTail> tails;
-    const auto addTails = [&] {
+    // Each sink is read across its segments, oldest first, and followed through their renames.
+    std::map<std::string, SinkLineReader> readers;
+    const auto addReaders = [&] {
         for (const auto& name : sinkNames()) {
-            tails.try_emplace(name, qv::client::QVReportingCtlSinkPath(options.stateDir, name));
+            readers.try_emplace(name, sinksDir, name, 0);
         }
     };
-    addTails();
+    addReaders();
     if (!follow) {
-        if (!sink.empty() &&
-            !std::filesystem::exists(qv::client::QVReportingCtlSinkPath(options.stateDir, sink))) {
+        if (!sink.empty() && QVReportingListSinkSegments(sinksDir, sink).empty()) {
             throw Failure{"no sink file " +
                           qv::client::QVReportingCtlSinkPath(options.stateDir, sink)};
         }
-        if (tails.empty()) {
-            std::cerr << "qvreportctl: no sink files in " << options.stateDir << "/sinks"
-                      << std::endl;
+        if (readers.empty()) {
+            std::cerr << "qvreportctl: no sink files in " << sinksDir.string() << std::endl;
             return 0;
         }
-        // Several files are merged by time, so one session's lines read in order.
+        // Several sinks are merged by time, so one session's lines read in order.
         struct Line {
             double time;
             std::string text;
         };
         std::vector<Line> lines;
-        for (auto& [name, tail] : tails) {
-            for (auto& raw : tail.readNewLines()) {
-                const Json parsed = Json::parse(raw, nullptr, false);
+        for (auto& [name, reader] : readers) {
+            while (auto line = reader.next()) {
+                const Json parsed = Json::parse(line->text, nullptr, false);
                 const double time =
                     parsed.is_object() && parsed.contains("time") && parsed["time"].is_number()
                         ? parsed["time"].get<double>()
                         : 0.0;
-                lines.push_back(
-                    {time, qv::client::QVReportingCtlFormatSinkLine(name, raw, options.json)});
+                lines.push_back({time, qv::client::QVReportingCtlFormatSinkLine(name, line->text,
+                                                                                options.json)});
             }
         }
         std::stable_sort(lines.begin(), lines.end(),
@@ -68,11 +70,12 @@ int printSinks(const Options& options, const std::string& sink, bool follow) {
         return 0;
     }
     for (;;) {
-        addTails();  // sinks that appear while following are picked up
+        addReaders();  // sinks that appear while following are picked up
         bool any = false;
-        for (auto& [name, tail] : tails) {
-            for (auto& raw : tail.readNewLines()) {
-                std::cout << qv::client::QVReportingCtlFormatSinkLine(name, raw, options.json)
+        for (auto& [name, reader] : readers) {
+            while (auto line = reader.next()) {
+                std::cout << qv::client::QVReportingCtlFormatSinkLine(name, line->text,
+                                                                      options.json)
                           << '\n';
                 any = true;
             }

@@ -14,6 +14,7 @@
 #include <unistd.h>
 
 #include "QVReportingCtlMTXRecord.h"
+#include "platform/SinkSegments.h"
 #include "session/QVReportingVocabulary.h"
 
 namespace qv::client {
@@ -194,19 +195,9 @@ std::string QVReportingCtlSinkPath(const std::string& stateDir, std::string_view
 }
 
 std::vector<std::string> QVReportingCtlListSinks(const std::string& stateDir) {
-    std::vector<std::string> sinks;
-    std::error_code error;
-    for (const auto& entry : std::filesystem::directory_iterator(stateDir + "/sinks", error)) {
-        const std::string name = entry.path().filename().string();
-        if (name.size() > kSinkSuffix.size() && name.ends_with(kSinkSuffix) &&
-            entry.is_regular_file(error)) {
-            std::string sink = name.substr(0, name.size() - kSinkSuffix.size());
-            if (QVReportingCtlIsSinkName(sink)) {
-                sinks.push_back(std::move(sink));
-            }
-        }
-    }
-    std::sort(sinks.begin(), sinks.end());
+    std::vector<std::string> sinks =
+        QVReportingListSinks(std::filesystem::path(stateDir) / "sinks");
+    std::erase_if(sinks, [](const std::string& sink) { return !QVReportingCtlIsSinkName(sink); });
     return sinks;
 }
 
@@ -262,43 +253,6 @@ std::string QVReportingCtlFormatSinkLine(std::string_view sink, std::string_view
         text += decodedRecord;
     }
     return text;
-}
-
-std::vector<std::string> QVReportingSinkTail::readNewLines() {
-    std::vector<std::string> lines;
-    struct stat st {};
-    if (::stat(path_.c_str(), &st) != 0) {
-        return lines;
-    }
-    const auto size = static_cast<std::uint64_t>(st.st_size);
-    const auto inode = static_cast<std::uint64_t>(st.st_ino);
-    if (inode != inode_ || size < offset_) {
-        // Replaced or truncated: what was read belongs to another file.
-        inode_ = inode;
-        offset_ = 0;
-        partial_.clear();
-    }
-    if (size == offset_) {
-        return lines;
-    }
-    std::ifstream in(path_, std::ios::binary);
-    if (!in) {
-        return lines;
-    }
-    in.seekg(static_cast<std::streamoff>(offset_));
-    std::string chunk(size - offset_, '\0');
-    in.read(chunk.data(), static_cast<std::streamsize>(chunk.size()));
-    chunk.resize(static_cast<std::size_t>(in.gcount()));
-    offset_ += chunk.size();
-    partial_ += chunk;
-    std::size_t start = 0;
-    for (std::size_t nl = partial_.find('\n'); nl != std::string::npos;
-         nl = partial_.find('\n', start)) {
-        lines.emplace_back(partial_, start, nl - start);
-        start = nl + 1;
-    }
-    partial_.erase(0, start);
-    return lines;
 }
 
 }  // namespace qv::client

@@ -2,8 +2,7 @@
 // numbers or vocabulary names, the state directory the daemon settles on, and reading and
 // printing its sink files.
 //
-// Thread safety: the free functions are pure (apart from reading files); a QVReportingSinkTail
-// belongs to one thread.
+// Thread safety: the free functions are pure (apart from reading files).
 #pragma once
 
 #include <cstdint>
@@ -50,7 +49,8 @@ std::string QVReportingCtlDefaultStateDirectory();
 
 // --- Sink files ---------------------------------------------------------------------------------
 
-// The sinks with a file in <stateDir>/sinks ("analytics" for analytics.jsonl), sorted.
+// The sinks with a current file or closed segments in <stateDir>/sinks ("analytics" for
+// analytics.jsonl and analytics.000000000001.jsonl), sorted.
 std::vector<std::string> QVReportingCtlListSinks(const std::string& stateDir);
 std::string QVReportingCtlSinkPath(const std::string& stateDir, std::string_view sink);
 // A sink name the daemon could have written: not empty, no '/', no leading '.', no control
@@ -66,22 +66,5 @@ std::string QVReportingCtlFormatSinkLine(std::string_view sink, std::string_view
 
 // "2024-05-01T12:30:45.250Z" for seconds since 1970 (milliseconds rounded down).
 std::string QVReportingCtlFormatUTC(double secondsSince1970);
-
-// Reads the complete lines appended to one file since the last call. A file that shrank (it was
-// truncated or replaced) is read again from its start; a line still being written (no newline
-// yet) waits for the next call.
-class QVReportingSinkTail {
-  public:
-    explicit QVReportingSinkTail(std::string path) : path_(std::move(path)) {}
-
-    // The new complete lines, without their newlines; none when the file is missing.
-    std::vector<std::string> readNewLines();
-
-  private:
-    std::string path_;
-    std::uint64_t offset_ = 0;
-    std::uint64_t inode_ = 0;
-    std::string partial_;
-};
 
 }  // namespace qv::client

@@ -108,6 +108,31 @@ std::optional<QVReportingDaemonOptions> QVReportingParseDaemonOptions(int argc, 
                    "Directory standing for / when driver statistics are read from /proc and /sys "
                    "(a fixture tree in tests)")
         ->capture_default_str();
+    // --- Files on disk ---
+    app.add_option("--sink-segment-bytes", o.sinkSegmentBytes,
+                   "Size past which a sink's current file (sinks/NAME.jsonl) is closed as "
+                   "sinks/NAME.SEQ.jsonl and a new one begins")
+        ->capture_default_str()
+        ->check(CLI::PositiveNumber);
+    app.add_option("--sink-segment-seconds", o.sinkSegmentSeconds,
+                   "Age (from its first line) past which a sink's current file is closed")
+        ->capture_default_str()
+        ->check(CLI::PositiveNumber);
+    app.add_option("--sinks-max-bytes", o.sinksMaxBytes,
+                   "Disk the closed sink files of all sinks may take; past it the oldest are "
+                   "removed (counted as sink_bytes_expired_SINK)")
+        ->capture_default_str()
+        ->check(CLI::PositiveNumber);
+    app.add_option("--reporting-max-bytes", o.reportingMaxBytes,
+                   "Disk the session summary files (logs/Audio/Reporting/) may take; past it the "
+                   "oldest are removed")
+        ->capture_default_str()
+        ->check(CLI::PositiveNumber);
+    app.add_option("--spinlogs-max-bytes", o.spinlogsMaxBytes,
+                   "Disk the stack samples (logs/Audio/Spinlogs/) may take; past it the oldest "
+                   "are removed")
+        ->capture_default_str()
+        ->check(CLI::PositiveNumber);
     try {
         app.parse(argc, argv);
     } catch (const CLI::ParseError& e) {

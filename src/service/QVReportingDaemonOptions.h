@@ -1,6 +1,7 @@
 // The daemon's command line and the state directory it settles on.
 #pragma once
 
+#include <cstdint>
 #include <optional>
 #include <string>
 
@@ -26,6 +27,16 @@ struct QVReportingDaemonOptions {
     std::string tracefsRoot;
     // The directory that stands for "/" when kernel counters are read (driver statistics).
     std::string sysfsRoot = "/";
+
+    // --- Files on disk ---
+    // A sink's current segment is closed past this size or this age (from its first line).
+    std::uint64_t sinkSegmentBytes = std::uint64_t{64} << 20;
+    double sinkSegmentSeconds = 86400;
+    // The closed segments of all sinks together; past it the oldest are removed.
+    std::uint64_t sinksMaxBytes = std::uint64_t{1} << 30;
+    // Session summary files (logs/Audio/Reporting/) and stack samples (logs/Audio/Spinlogs/).
+    std::uint64_t reportingMaxBytes = std::uint64_t{256} << 20;
+    std::uint64_t spinlogsMaxBytes = std::uint64_t{512} << 20;
 };
 
 // Parses argv. Returns the options, or nothing after printing help, the version or an error;

@@ -16,6 +16,7 @@
 #include <sdbus-c++/sdbus-c++.h>
 
 #include "monitoring/QVReportingSystemMonitor.h"
+#include "platform/linux/DiskBudget.h"
 #include "platform/linux/LinuxAnalyticsService.h"
 #include "platform/linux/LinuxBluetoothFacility.h"
 #include "platform/linux/LinuxClock.h"
@@ -74,6 +75,10 @@ constexpr std::size_t kFreeBytesWorthReturning = 1u << 20;
 constexpr std::chrono::milliseconds kPoolDrainTimeout{5000};
 constexpr auto kShutdownFlushTimeout = std::chrono::seconds(4);
 
+// The sinks keep to their budget whenever one closes a segment; the log directories, whose files
+// are written by workers and services that know nothing of budgets, are looked at this often.
+constexpr auto kLogBudgetInterval = std::chrono::seconds(30);
+
 void returnFreeMemory() {
     if (mallinfo2().fordblks > kFreeBytesWorthReturning) {
         malloc_trim(0);
@@ -103,6 +108,9 @@ int main(int argc, char** argv) {
     sigaddset(&stopSignals, SIGINT);
     pthread_sigmask(SIG_BLOCK, &stopSignals, nullptr);
     signal(SIGPIPE, SIG_IGN);
+    // Under a file size limit (LimitFSIZE=, ulimit -f) a write past it fails with EFBIG, which
+    // the sinks count as lines lost, instead of killing the daemon.
+    signal(SIGXFSZ, SIG_IGN);
 
     std::error_code ec;
     std::filesystem::create_directories(options->stateDir, ec);
@@ -122,24 +130,59 @@ int main(int argc, char** argv) {
     if (!device.loadError().empty()) {
         QVLOG_ERROR(logCategory(), "device file ignored: {}", device.loadError());
     }
+    if (device.fileRefused()) {
+        QVReportingStats::shared().noteFileRefused();
+    }
     LinuxProcessInfo process;
-    LinuxPreferenceStore preferences(options->stateDir, reportProblem);
+    LinuxPreferenceStore preferences(options->stateDir, reportProblem,
+                                     [] { QVReportingStats::shared().noteFileRefused(); });
     LinuxNotificationCenter notifications;
     const SinkCallbacks sinkCallbacks{
         [](std::string_view sink) { QVReportingStats::shared().noteSinkLineLost(sink); },
         [](std::string_view) { QVReportingStats::shared().noteSinkTornLineRemoved(); },
-        reportProblem};
-    auto analytics = LinuxAnalyticsService::create(options->stateDir, clock,
-                                                   options->analyticsEventsFile, sinkCallbacks);
+        reportProblem, [](const std::string&) { QVReportingStats::shared().noteFileRefused(); }};
+    // Disk budgets: the sinks' closed segments, the summary files and the stack samples.
+    const auto logsAudio = device.diagnosticLogsDirectory() / "Audio";
+    const auto sinkSegments = SinkSegmentPolicy{
+        options->sinkSegmentBytes, options->sinkSegmentSeconds,
+        std::make_shared<DiskBudget>(
+            "sinks", options->sinksMaxBytes,
+            DiskBudget::closedSinkSegmentsIn(std::filesystem::path(options->stateDir) / "sinks"),
+            DiskBudget::Callbacks{[](std::string_view sink, std::uint64_t bytes) {
+                                      QVReportingStats::shared().noteSinkBytesExpired(sink, bytes);
+                                  },
+                                  reportProblem})};
+    const auto logBudget = [&](const char* dir, const char* group, std::uint64_t maxBytes) {
+        return std::make_shared<DiskBudget>(
+            (std::filesystem::path("logs/Audio") / dir).string(), maxBytes,
+            DiskBudget::filesIn(logsAudio / dir, group),
+            DiskBudget::Callbacks{[](std::string_view group, std::uint64_t bytes) {
+                                      QVReportingStats::shared().noteLogBytesExpired(group, bytes);
+                                  },
+                                  reportProblem});
+    };
+    const std::shared_ptr<DiskBudget> logBudgets[] = {
+        logBudget("Reporting", "reporting", options->reportingMaxBytes),
+        logBudget("Spinlogs", "spinlogs", options->spinlogsMaxBytes)};
+    // A budget lowered since the last run applies at once.
+    sinkSegments.closedSegments->enforce();
+    const auto enforceLogBudgets = [&logBudgets] {
+        for (const auto& budget : logBudgets) {
+            budget->enforce();
+        }
+    };
+    enforceLogBudgets();
+    auto analytics = LinuxAnalyticsService::create(
+        options->stateDir, clock, options->analyticsEventsFile, sinkCallbacks, sinkSegments);
     if (!analytics.service) {
         QVLOG_ERROR(logCategory(), "{}", analytics.error);
         return 1;
     }
     LinuxSystemCondition condition;
-    LinuxConvoService convo(
-        preferences,
-        std::make_unique<JsonlSink>(options->stateDir, std::string(LinuxConvoService::kSinkName),
-                                    clock, sinkCallbacks));
+    LinuxConvoService convo(preferences,
+                            std::make_unique<JsonlSink>(
+                                options->stateDir, std::string(LinuxConvoService::kSinkName), clock,
+                                sinkCallbacks, JsonlSink::kDefaultCapacity, sinkSegments));
     // BlueZ is followed on a thread of the facility's own; a bus that cannot be reached now only
     // leaves Bluetooth unavailable until it can.
     LinuxBluetoothFacility bluetooth(
@@ -156,12 +199,13 @@ int main(int argc, char** argv) {
                     QVLOG_ERROR(QVReportingAudioRegistrationCategory(), "{}", line);
                     break;
             }
-        });
+        },
+        [] { QVReportingStats::shared().noteFileRefused(); });
     LinuxIssueCaptureService issueCapture(
         clock, preferences,
         std::make_unique<JsonlSink>(options->stateDir,
                                     std::string(LinuxIssueCaptureService::kSinkName), clock,
-                                    sinkCallbacks),
+                                    sinkCallbacks, JsonlSink::kDefaultCapacity, sinkSegments),
         LinuxIssueCaptureService::Options{
             (device.diagnosticLogsDirectory() / "Audio" / "Captures").string(),
             options->journalDir.empty() ? std::nullopt
@@ -175,7 +219,7 @@ int main(int argc, char** argv) {
     LinuxIssueFilerService issueFiler(
         std::make_unique<JsonlSink>(options->stateDir,
                                     std::string(LinuxIssueFilerService::kSinkName), clock,
-                                    sinkCallbacks),
+                                    sinkCallbacks, JsonlSink::kDefaultCapacity, sinkSegments),
         LinuxIssueFilerService::Options{
             .sessionBusAddress = LinuxIssueFilerService::sessionBusAddressFor(
                 std::getenv("DBUS_SESSION_BUS_ADDRESS"), ::geteuid()),
@@ -186,7 +230,7 @@ int main(int argc, char** argv) {
         clock,
         std::make_unique<JsonlSink>(options->stateDir,
                                     std::string(LinuxDiagnosticRequestService::kSinkName), clock,
-                                    sinkCallbacks),
+                                    sinkCallbacks, JsonlSink::kDefaultCapacity, sinkSegments),
         LinuxDiagnosticRequestService::Options{
             .spinlogsDirectory = device.diagnosticLogsDirectory() / "Audio" / "Spinlogs",
             .notice = [](const std::string& message) {
@@ -205,9 +249,11 @@ int main(int argc, char** argv) {
     LinuxProcessLauncher processLauncher;
 
     LinuxMTXMetricsService mtx(std::make_unique<JsonlSink>(
-        options->stateDir, std::string(LinuxMTXMetricsService::kSinkName), clock, sinkCallbacks));
+        options->stateDir, std::string(LinuxMTXMetricsService::kSinkName), clock, sinkCallbacks,
+        JsonlSink::kDefaultCapacity, sinkSegments));
     LinuxEnergyLogService energyLog(std::make_unique<JsonlSink>(
-        options->stateDir, std::string(LinuxEnergyLogService::kSinkName), clock, sinkCallbacks));
+        options->stateDir, std::string(LinuxEnergyLogService::kSinkName), clock, sinkCallbacks,
+        JsonlSink::kDefaultCapacity, sinkSegments));
 
     LinuxTaskExecutor executor;
 
@@ -234,6 +280,7 @@ int main(int argc, char** argv) {
     }
 
     RepeatingTimer memoryReturn(std::chrono::seconds(5), returnFreeMemory);
+    RepeatingTimer logBudgetCheck(kLogBudgetInterval, enforceLogBudgets);
 
     int signal = 0;
     sigwait(&stopSignals, &signal);

@@ -63,6 +63,37 @@ void QVReportingStats::noteIssueCaptureRefused(std::string_view reason) {
     ++it->second;
 }
 
+// --- Files on disk ---
+
+void QVReportingStats::noteSinkBytesExpired(std::string_view sink, std::uint64_t bytes) {
+    std::lock_guard lock(mutex_);
+    const std::string key = "sink_bytes_expired_" + std::string(sink);
+    auto it = bytesExpired_.find(key);
+    if (it == bytesExpired_.end()) {
+        it = bytesExpired_
+                 .emplace(
+                     bytesExpired_.size() < 2 * kMaxTrackedSinks ? key : "sink_bytes_expired_other",
+                     0)
+                 .first;
+    }
+    it->second += bytes;
+}
+
+void QVReportingStats::noteLogBytesExpired(std::string_view dir, std::uint64_t bytes) {
+    std::lock_guard lock(mutex_);
+    bytesExpired_["log_bytes_expired_" + std::string(dir)] += bytes;
+}
+
+void QVReportingStats::noteFileRefused() {
+    filesRefused_.fetch_add(1, std::memory_order_relaxed);
+}
+
+std::uint64_t QVReportingStats::sinkBytesExpired(std::string_view sink) const {
+    std::lock_guard lock(mutex_);
+    auto it = bytesExpired_.find("sink_bytes_expired_" + std::string(sink));
+    return it == bytesExpired_.end() ? 0 : it->second;
+}
+
 void QVReportingStats::noteClientCount(std::size_t clients) {
     clients_.store(clients);
     raiseMax(clientsMax_, clients);
@@ -165,6 +196,14 @@ Dictionary QVReportingStats::dump() const {
     out.set("session_store_budget_bytes", sessionStoreBudget_.load());
     out.set("messages_not_stored", messagesNotStored_.load());
     out.set("previous_values_dropped", previousValuesDropped_.load());
+    // Files on disk.
+    out.set("files_refused", filesRefused_.load());
+    {
+        std::lock_guard lock(mutex_);
+        for (const auto& [name, n] : bytesExpired_) {
+            out.set(name, n);
+        }
+    }
     return out;
 }
 
@@ -186,6 +225,8 @@ void QVReportingStats::TEST_reset() {
     std::lock_guard lock(mutex_);
     sinkLinesLost_.clear();
     issueCaptureRefused_.clear();
+    filesRefused_.store(0);
+    bytesExpired_.clear();
 }
 
 }  // namespace qv

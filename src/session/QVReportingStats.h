@@ -70,6 +70,18 @@ class QVReportingStats {
     // A request the issue-capture service refused (its policy, or no room); reason names the
     // error code.
     void noteIssueCaptureRefused(std::string_view reason);
+    // --- Files on disk ---
+    // Bytes of closed sink segments removed to keep the sinks within their disk budget.
+    void noteSinkBytesExpired(std::string_view sink, std::uint64_t bytes);
+    // Bytes of files under logs/Audio/ removed to keep a directory within its budget; dir names
+    // it ("reporting", "spinlogs").
+    void noteLogBytesExpired(std::string_view dir, std::uint64_t bytes);
+    // A file that is not what it should be (a pipe, a device, a directory or a link where a
+    // regular file belongs, or one past its size limit), refused.
+    void noteFileRefused();
+    std::uint64_t sinkBytesExpired(std::string_view sink) const;
+    std::uint64_t filesRefused() const { return filesRefused_.load(); }
+
     void noteClientCount(std::size_t clients);
     void noteSessionCount(std::size_t sessions);
 
@@ -123,6 +135,9 @@ class QVReportingStats {
     mutable std::mutex mutex_;
     std::map<std::string, std::uint64_t, std::less<>> sinkLinesLost_;        // guarded by mutex_
     std::map<std::string, std::uint64_t, std::less<>> issueCaptureRefused_;  // guarded by mutex_
+    // Files on disk.
+    std::atomic<std::uint64_t> filesRefused_{0};
+    std::map<std::string, std::uint64_t, std::less<>> bytesExpired_;  // guarded by mutex_
 };
 
 }  // namespace qv

@@ -40,26 +40,16 @@ TEST(TheCtlVocabulary, ReadsNumbersAtTheirLimitsAndOnlyNamesThatStandForOneValue
     EXPECT_EQ(QVReportingCtlParseReporterID("5x"), std::nullopt);
 }
 
-TEST(ASinkTail, HoldsBackPartialLinesAndStartsOverWhenTheFileIsTruncatedOrReplaced) {
-    char pattern[] = "/tmp/qvsinktail.XXXXXX";
+TEST(ASinkList, NamesEachSinkOnceWhateverSegmentsItHas) {
+    char pattern[] = "/tmp/qvsinklist.XXXXXX";
     ASSERT_NE(mkdtemp(pattern), nullptr);
     const std::string dir = pattern;
-    const std::string path = dir + "/sinks/analytics.jsonl";
     std::filesystem::create_directories(dir + "/sinks");
-    QVReportingSinkTail tail(path);
-    EXPECT_TRUE(tail.readNewLines().empty());  // no file yet
-
-    std::ofstream(path, std::ios::app) << "{\"a\":1}\n{\"b\":";
-    EXPECT_EQ(tail.readNewLines(), std::vector<std::string>{"{\"a\":1}"});
-    std::ofstream(path, std::ios::app) << "2}\n\n";
-    EXPECT_EQ(tail.readNewLines(), (std::vector<std::string>{"{\"b\":2}", ""}));
-    std::ofstream(path, std::ios::trunc) << "x\n";
-    EXPECT_EQ(tail.readNewLines(), std::vector<std::string>{"x"});
-    // A new file of the same name, longer than what was read of the old one.
-    std::ofstream(dir + "/sinks/next") << "first\nsecond\n";
-    std::filesystem::rename(dir + "/sinks/next", path);
-    EXPECT_EQ(tail.readNewLines(), (std::vector<std::string>{"first", "second"}));
-    EXPECT_EQ(QVReportingCtlListSinks(dir), std::vector<std::string>{"analytics"});
+    for (const char* name : {"analytics.jsonl", "analytics.000000000001.jsonl",
+                             "mtx.000000000007.jsonl", ".hidden.jsonl", "notes.txt"}) {
+        std::ofstream(dir + "/sinks/" + name) << "";
+    }
+    EXPECT_EQ(QVReportingCtlListSinks(dir), (std::vector<std::string>{"analytics", "mtx"}));
     std::filesystem::remove_all(dir);
 }
 

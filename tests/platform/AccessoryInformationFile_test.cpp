@@ -75,7 +75,8 @@ TEST(AnAccessoryFile, LoadsAWellFormedFileAndRefusesEverythingElseWithAReason) {
     EXPECT_EQ(linked.reason, "it is a symbolic link");
     std::filesystem::remove(path);
     ASSERT_EQ(::mkfifo(path.c_str(), 0600), 0);
-    EXPECT_EQ(QVReportingReadAccessoryFile(dirName, kAddress).reason, "it is not a regular file");
+    EXPECT_EQ(QVReportingReadAccessoryFile(dirName, kAddress).reason,
+              "it is a FIFO, not a regular file");
 }
 
 }  // namespace

@@ -13,6 +13,8 @@
 #include <cstdint>
 #include <filesystem>
 #include <fstream>
+#include <functional>
+#include <future>
 #include <limits>
 #include <mutex>
 #include <nlohmann/json.hpp>
@@ -23,6 +25,7 @@
 
 #include "fakes/FakeClock.h"
 #include "fakes/TempDirectory.h"
+#include "platform/SinkSegments.h"
 
 namespace qv {
 namespace {
@@ -41,7 +44,8 @@ class AJsonlSink : public ::testing::Test {
                 [this](const std::string& message) {
                     std::lock_guard lock(mutex);
                     problems.push_back(message);
-                }};
+                },
+                [this](const std::string&) { ++filesRefused; }};
     }
     std::size_t lostCount() {
         std::lock_guard lock(mutex);
@@ -67,6 +71,7 @@ class AJsonlSink : public ::testing::Test {
     std::vector<std::string> lost;      // guarded by mutex
     std::vector<std::string> problems;  // guarded by mutex
     std::atomic<int> tornRemoved{0};
+    std::atomic<int> filesRefused{0};
 };
 
 TEST_F(AJsonlSink, WritesOneObjectPerLineWithTheTimeFirstAndEveryValueExact) {
@@ -88,7 +93,10 @@ TEST_F(AJsonlSink, WritesOneObjectPerLineWithTheTimeFirstAndEveryValueExact) {
     EXPECT_EQ(first.begin().key(), "time");
     EXPECT_EQ(first["time"].get<double>(), startTime);
     EXPECT_TRUE(first["zeta"].is_number_unsigned());
+    EXPECT_EQ(std::next(first.begin()).key(), "seq");
+    EXPECT_EQ(first["seq"], 1);
     first.erase("time");
+    first.erase("seq");
     EXPECT_EQ(first, ordered_json::parse(R"({"zeta":18446744073709551615,
         "alpha":-9223372036854775808,"third":0.30000000000000004,"bytes":"AAEC/w==",
         "nested":{"b":1,"a":2},"text":"two\nlines \"quoted\""})"));
@@ -97,43 +105,48 @@ TEST_F(AJsonlSink, WritesOneObjectPerLineWithTheTimeFirstAndEveryValueExact) {
 }
 
 TEST_F(AJsonlSink, DropsAndCountsLinesWhenItsBufferIsFull) {
-    // A FIFO without a reader holds the sink's thread in open() until the test opens it.
-    const fs::path path = stateDir / "sinks" / "busy.jsonl";
-    fs::create_directories(path.parent_path());
-    ASSERT_EQ(::mkfifo(path.c_str(), 0600), 0);
-    int reader = -1;
-    std::string text;
+    // The sink's thread is held in the loss callback of a line it cannot write (a plain file
+    // where its directory should be) until the test lets it go.
+    std::ofstream(tmp / "plain") << "x";
+    const auto testThread = std::this_thread::get_id();
+    std::promise<void> release;
+    std::shared_future<void> released = release.get_future().share();
+    std::atomic<bool> holding{false};
+    SinkCallbacks callbacks = recording();
+    callbacks.lineLost = [&, count = callbacks.lineLost](std::string_view sink) {
+        count(sink);
+        if (std::this_thread::get_id() != testThread && !holding.exchange(true)) {
+            released.wait();
+        }
+    };
     std::size_t refused = 0;
     {
-        JsonlSink sink(stateDir.string(), "busy", clock, recording(), /*capacity=*/2);
-        for (int i = 0; i < 5; ++i) {
+        JsonlSink sink((tmp / "plain").string(), "busy", clock, callbacks, /*capacity=*/2);
+        sink.append({{"n", 0}});
+        const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(30);
+        while (!holding && std::chrono::steady_clock::now() < deadline) {
+            std::this_thread::sleep_for(std::chrono::milliseconds(1));
+        }
+        ASSERT_TRUE(holding);
+        fs::remove(tmp / "plain");
+        for (int i = 1; i <= 5; ++i) {
             refused += sink.append({{"n", i}}) ? 0 : 1;
         }
-        reader = ::open(path.c_str(), O_RDONLY | O_NONBLOCK);
+        release.set_value();
         sink.flush();
-        EXPECT_TRUE(sink.append({{"n", 5}})) << "room again once the buffer drains";
-        sink.flush();
-        char buffer[4096];
-        for (ssize_t n; (n = ::read(reader, buffer, sizeof buffer)) > 0;) {
-            text.append(buffer, static_cast<std::size_t>(n));
-        }
-    }  // the sink closes its end before the reader goes
-    ASSERT_GE(reader, 0);
-    ::close(reader);
-
-    // At most a batch of two lines in the thread's hands and two in the buffer.
-    EXPECT_GE(refused, 1u);
-    EXPECT_EQ(lost, std::vector<std::string>(refused, "busy"));
-    std::vector<int> received;
-    std::istringstream stream(text);
-    for (std::string line; std::getline(stream, line);) {
-        received.push_back(ordered_json::parse(line)["n"].get<int>());
+        EXPECT_TRUE(sink.append({{"n", 6}})) << "room again once the buffer drains";
     }
-    EXPECT_EQ(received.size() + refused, 6u);
-    EXPECT_TRUE(std::is_sorted(received.begin(), received.end()));
-    EXPECT_EQ(received.back(), 5);
-    ASSERT_FALSE(problems.empty());
-    EXPECT_NE(problems[0].find("full"), std::string::npos);
+    EXPECT_EQ(refused, 3u) << "two lines fit in the buffer while the thread is held";
+    EXPECT_EQ(lostCount(), 1 + refused);
+    std::vector<int> received;
+    for (const auto& line : readLines(tmp / "plain/sinks/busy.jsonl")) {
+        received.push_back(line["n"].get<int>());
+    }
+    EXPECT_EQ(received, (std::vector<int>{1, 2, 6}));
+    const auto reported = problemsSoFar();
+    EXPECT_TRUE(std::any_of(reported.begin(), reported.end(), [](const std::string& p) {
+        return p.find("full") != std::string::npos;
+    }));
 }
 
 TEST_F(AJsonlSink, ReportsACauseOnceCountsLostLinesAndRecovers) {
@@ -246,6 +259,197 @@ TEST_F(AJsonlSink, KeepsEveryLineWholeAndInOrderWhenThreadsAppendAtOnce) {
         EXPECT_EQ(line["i"].get<int>(), next.at(line["thread"].get<std::size_t>())++);
     }
     EXPECT_EQ(lostCount(), 0u);
+}
+
+// --- Segments ---------------------------------------------------------------------------------
+
+// Every line of a sink through the segment reader, as (seq, "i").
+std::vector<std::pair<std::uint64_t, int>> readSink(const fs::path& sinks,
+                                                    const std::string& sink) {
+    std::vector<std::pair<std::uint64_t, int>> out;
+    SinkLineReader reader(sinks, sink, 0);
+    while (auto line = reader.next()) {
+        out.emplace_back(line->seq, ordered_json::parse(line->text)["i"].get<int>());
+    }
+    return out;
+}
+
+std::vector<std::uint64_t> closedFirstSeqs(const fs::path& sinks, const std::string& sink) {
+    std::vector<std::uint64_t> seqs;
+    for (const auto& segment : QVReportingListSinkSegments(sinks, sink)) {
+        if (!segment.current) {
+            seqs.push_back(segment.firstSeq);
+        }
+    }
+    return seqs;
+}
+
+TEST_F(AJsonlSink, ClosesItsSegmentPastItsSizeOrAgeAndNumbersLinesAcrossThem) {
+    const fs::path sinks = stateDir / "sinks";
+    const struct {
+        const char* sink;
+        std::uint64_t bytes;
+        double seconds;
+        std::vector<double> advances;  // before each line
+        std::vector<std::uint64_t> closed;
+    } cases[] = {
+        // Lines of 46 bytes: the third passes 130 bytes, so the fourth begins a segment.
+        {"bysize", 130, 1e9, std::vector<double>(8, 0), {1, 4}},
+        // A day measured from the segment's first line: 100 s after it, a new one.
+        {"byage", 1 << 20, 100, {0, 50, 49.9, 0.1, 50, 100, 0, 0}, {1, 4}},
+        {"byboth", 130, 100, {0, 0, 150, 0, 0, 0, 0, 0}, {1, 3}},
+    };
+    for (const auto& c : cases) {
+        SCOPED_TRACE(c.sink);
+        {
+            JsonlSink sink(stateDir.string(), c.sink, clock, recording(),
+                           JsonlSink::kDefaultCapacity,
+                           SinkSegmentPolicy{c.bytes, c.seconds, nullptr});
+            for (std::size_t i = 0; i < c.advances.size(); ++i) {
+                clock.advance(c.advances[i]);
+                sink.append({{"i", static_cast<int>(i)}, {"pad", "p"}});
+                sink.flush();  // one batch a line, as a quiet sink writes
+            }
+        }
+        EXPECT_EQ(closedFirstSeqs(sinks, c.sink), c.closed);
+        const auto lines = readSink(sinks, c.sink);
+        ASSERT_EQ(lines.size(), c.advances.size());
+        for (std::size_t i = 0; i < lines.size(); ++i) {
+            EXPECT_EQ(lines[i], std::make_pair(std::uint64_t{i + 1}, static_cast<int>(i)));
+        }
+        for (const auto& segment : QVReportingListSinkSegments(sinks, c.sink)) {
+            const auto first = readLines(segment.path).front();
+            EXPECT_EQ(std::next(first.begin()).key(), "seq");
+            if (!segment.current) {
+                EXPECT_EQ(first["seq"].get<std::uint64_t>(), segment.firstSeq);
+            }
+        }
+    }
+    // Many lines in one batch are split at the same boundaries.
+    {
+        JsonlSink sink(stateDir.string(), "batched", clock, recording(),
+                       JsonlSink::kDefaultCapacity, SinkSegmentPolicy{130, 1e9, nullptr});
+        for (int i = 0; i < 8; ++i) {
+            sink.append({{"i", i}, {"pad", "p"}});
+        }
+    }
+    EXPECT_EQ(closedFirstSeqs(sinks, "batched"), (std::vector<std::uint64_t>{1, 4}));
+    EXPECT_EQ(readSink(sinks, "batched").size(), 8u);
+}
+
+TEST_F(AJsonlSink, GoesOnFromTheNewestSegmentsLastWholeLineWhenItStartsAgain) {
+    const fs::path sinks = stateDir / "sinks";
+    fs::create_directories(sinks);
+    const auto line = [](std::uint64_t seq, double time) {
+        return "{\"time\":" + std::to_string(time) + ",\"seq\":" + std::to_string(seq) +
+               ",\"i\":" + std::to_string(seq) + "}\n";
+    };
+    const double now = clock.now();
+    const struct {
+        const char* what;
+        std::string current;  // "" for no current file
+        std::string closed;   // lines of a closed segment beginning at 1, "" for none
+        std::uint64_t expectedSeq;
+        std::vector<std::uint64_t> closedAfter;
+        int torn;
+    } cases[] = {
+        {"nothing yet", "", "", 1, {}, 0},
+        {"a current file with a torn line",
+         line(7, now) + line(8, now) + "{\"time\":1,\"se",
+         "",
+         9,
+         {},
+         1},
+        {"only closed segments", "", line(1, now) + line(2, now) + line(3, now), 4, {1}, 0},
+        {"an empty current file", "\n", line(1, now) + line(2, now), 3, {1}, 0},
+        // A current segment begun more than a day ago is closed before the first new line.
+        {"an old current file",
+         line(4, now - 86401) + line(5, now - 86400),
+         line(1, now) + line(2, now) + line(3, now),
+         6,
+         {1, 4},
+         0},
+    };
+    for (const auto& c : cases) {
+        SCOPED_TRACE(c.what);
+        fs::remove_all(sinks);
+        fs::create_directories(sinks);
+        if (!c.current.empty()) {
+            std::ofstream(sinks / "s.jsonl", std::ios::binary)
+                << (c.current == "\n" ? "" : c.current);
+        }
+        if (!c.closed.empty()) {
+            std::ofstream(sinks / QVReportingSinkSegmentName("s", 1), std::ios::binary) << c.closed;
+        }
+        tornRemoved = 0;
+        {
+            JsonlSink sink(stateDir.string(), "s", clock, recording());
+            sink.append({{"i", 0}});
+        }
+        const auto lines = readLines(sinks / "s.jsonl");
+        ASSERT_FALSE(lines.empty());
+        EXPECT_EQ(lines.back()["seq"].get<std::uint64_t>(), c.expectedSeq);
+        EXPECT_EQ(closedFirstSeqs(sinks, "s"), c.closedAfter);
+        EXPECT_EQ(tornRemoved, c.torn);
+    }
+}
+
+TEST_F(AJsonlSink, RefusesWhatIsNotARegularFileInItsPlaceWithoutBlocking) {
+    const fs::path sinks = stateDir / "sinks";
+    int fifoReader = -1;
+    const struct {
+        const char* what;
+        std::function<void(const fs::path&)> make;
+        const char* cause;
+    } cases[] = {
+        {"a FIFO nobody reads", [](const fs::path& p) { ASSERT_EQ(::mkfifo(p.c_str(), 0600), 0); },
+         "a FIFO"},
+        {"a FIFO being read",
+         [&](const fs::path& p) {
+             ASSERT_EQ(::mkfifo(p.c_str(), 0600), 0);
+             fifoReader = ::open(p.c_str(), O_RDONLY | O_NONBLOCK | O_CLOEXEC);
+         },
+         "a FIFO"},
+        {"a link to a file",
+         [&](const fs::path& p) {
+             std::ofstream(tmp / "elsewhere") << "";
+             fs::create_symlink(tmp / "elsewhere", p);
+         },
+         "a symbolic link"},
+        {"a directory", [](const fs::path& p) { fs::create_directories(p); }, "a directory"},
+    };
+    for (const auto& c : cases) {
+        SCOPED_TRACE(c.what);
+        fs::remove_all(sinks);
+        fs::create_directories(sinks);
+        c.make(sinks / "odd.jsonl");
+        lost.clear();
+        problems.clear();
+        filesRefused = 0;
+        {
+            JsonlSink sink(stateDir.string(), "odd", clock, recording());
+            sink.append({{"i", 1}});
+            sink.append({{"i", 2}});
+            EXPECT_TRUE(
+                sink.flushUntil(std::chrono::steady_clock::now() + std::chrono::seconds(30)))
+                << "the sink's thread must not block on it";
+            sink.append({{"i", 3}});
+        }
+        EXPECT_EQ(lostCount(), 3u);
+        EXPECT_EQ(filesRefused, 1) << "said and counted once";
+        const auto reported = problemsSoFar();
+        ASSERT_EQ(reported.size(), 1u);
+        EXPECT_NE(reported[0].find((sinks / "odd.jsonl").string()), std::string::npos)
+            << reported[0];
+        EXPECT_NE(reported[0].find(c.cause), std::string::npos) << reported[0];
+        if (fifoReader >= 0) {
+            char buffer[64];
+            EXPECT_LE(::read(fifoReader, buffer, sizeof buffer), 0) << "nothing written to it";
+            ::close(fifoReader);
+            fifoReader = -1;
+        }
+    }
+    EXPECT_EQ(fs::file_size(tmp / "elsewhere"), 0u);
 }
 
 }  // namespace

@@ -70,7 +70,7 @@ TEST_F(ALinuxAnalyticsService, BuildsThePayloadAtOnceOnlyForEventsInUseAndRefuse
     service->flush();
     std::ifstream in(tmp / "state/sinks/analytics.jsonl");
     const std::string text(std::istreambuf_iterator<char>(in), {});
-    EXPECT_EQ(text, fmt::format(R"({{"time":{:.1f},"event":"{}","payload":{{"v":1}}}})"
+    EXPECT_EQ(text, fmt::format(R"({{"time":{:.1f},"seq":1,"event":"{}","payload":{{"v":1}}}})"
                                 "\n",
                                 clock.now(), "com.korvane.qvsound.Playback.Start"));
 

@@ -2,8 +2,11 @@
 
 #include <gtest/gtest.h>
 
+#include <sys/stat.h>
+
 #include <filesystem>
 #include <fstream>
+#include <functional>
 #include <optional>
 #include <string>
 
@@ -54,6 +57,42 @@ TEST_F(ALinuxDeviceInformation, UsesAnObjectAndRefusesEverythingElseNamingTheFil
     EXPECT_EQ(missing.loadError(), "");
     EXPECT_EQ(missing.boolAnswer("InternalBuild"), true);
     EXPECT_FALSE(missing.hasCapability("haptics"));
+}
+
+TEST_F(ALinuxDeviceInformation, RefusesWhatIsNotASmallRegularFileWithoutBlockingOrReadingOn) {
+    const std::string valid = write(R"({"InternalBuild": true})");
+    const struct {
+        std::string path;
+        std::function<void(const fs::path&)> make;
+        const char* cause;
+    } cases[] = {
+        {(dir / "adir").string(), [](const fs::path& p) { fs::create_directories(p); },
+         "it is a directory, not a regular file"},
+        {"/dev/zero", nullptr, "it is a character device, not a regular file"},
+        {(dir / "fifo").string(),
+         [](const fs::path& p) { ASSERT_EQ(::mkfifo(p.c_str(), 0600), 0); },
+         "it is a FIFO, not a regular file"},
+        {(dir / "link").string(), [&](const fs::path& p) { fs::create_symlink(valid, p); },
+         "it is a symbolic link"},
+        {(dir / "large").string(),
+         [](const fs::path& p) {
+             std::ofstream(p) << "{\"InternalBuild\": true, \"pad\": \""
+                              << std::string(LinuxDeviceInformation::kMaxDeviceFileBytes, ' ')
+                              << "\"}";
+         },
+         "more than the 1048576 accepted"},
+    };
+    for (const auto& c : cases) {
+        if (c.make) {
+            c.make(c.path);
+        }
+        const LinuxDeviceInformation device(c.path, dir, std::nullopt);
+        EXPECT_EQ(device.loadError().find(c.path), 0u) << device.loadError();
+        EXPECT_NE(device.loadError().find(c.cause), std::string::npos) << device.loadError();
+        EXPECT_TRUE(device.fileRefused()) << c.path;
+        EXPECT_EQ(device.boolAnswer("InternalBuild"), std::nullopt) << c.path;
+    }
+    EXPECT_FALSE(LinuxDeviceInformation(valid, dir, std::nullopt).fileRefused());
 }
 
 }  // namespace

@@ -141,6 +141,7 @@ TEST_F(TheLinuxDiagnosticRequestService, RecordsRequestsAndSaysOnceThatPerfIsMis
     auto requests = lines("request");
     ASSERT_EQ(requests.size(), 3u);
     EXPECT_EQ(requests[0], (Json{{"time", requests[0]["time"]},
+                                 {"seq", requests[0]["seq"]},
                                  {"op", "request"},
                                  {"request", 1},
                                  {"domain", "com.korvane.qvsound"},

@@ -56,11 +56,12 @@ TEST(TheLinuxMTXAndEnergyLogServices, CopyWhatTheyAreGivenBeforeTheCallReturns) 
     energyLog.flush();
     const auto records = linesOf(state + "/sinks/mtx.jsonl");
     ASSERT_EQ(records.size(), 1u);
-    EXPECT_EQ(records[0].dump(), R"({"time":1706707501.0,"metric":5963779,"record":"EAEaAA=="})");
+    EXPECT_EQ(records[0].dump(),
+              R"({"time":1706707501.0,"seq":1,"metric":5963779,"record":"EAEaAA=="})");
     const auto events = linesOf(state + "/sinks/energylog.jsonl");
     ASSERT_EQ(events.size(), 1u);
     EXPECT_EQ(events[0].dump(),
-              R"({"time":1706707501.0,"registry":28,"event":"LeakedHapticsSessionInfo",)"
+              R"({"time":1706707501.0,"seq":1,"registry":28,"event":"LeakedHapticsSessionInfo",)"
               R"("payload":{"z":1,"a":["x"]},"options":{"o":true}})");
 }
 

@@ -118,6 +118,41 @@ TEST_F(ALinuxPreferenceStore, ReadsMalformedFilesAsEmptyReportsEachVersionOnceAn
     EXPECT_EQ(store.values("bad"), (Dictionary{{"k", Value(6)}, {"ok", Value(true)}}));
 }
 
+TEST_F(ALinuxPreferenceStore, RefusesWhatIsNotASmallRegularFileOnceWithoutBlockingOrWriting) {
+    int refused = 0;
+    LinuxPreferenceStore store(stateDir.string(), recordErrors(), [&] { ++refused; });
+    writeText(tmp / "elsewhere.json", R"({"k": 1})");
+    const struct {
+        const char* suite;
+        void (*make)(const fs::path& path, const fs::path& elsewhere);
+        const char* cause;
+    } cases[] = {
+        {"fifo", [](const fs::path& p, const fs::path&) { ::mkfifo(p.c_str(), 0600); },
+         "is not a regular file"},
+        {"link", [](const fs::path& p, const fs::path& e) { fs::create_symlink(e, p); },
+         "is a symbolic link"},
+        {"large",
+         [](const fs::path& p, const fs::path&) {
+             std::ofstream(p) << "{\"k\": \"" << std::string((16 << 20) + 1, 'x') << "\"}";
+         },
+         "is too large"},
+    };
+    for (const auto& c : cases) {
+        SCOPED_TRACE(c.suite);
+        const fs::path path = store.pathForSuite(c.suite);
+        c.make(path, tmp / "elsewhere.json");
+        const int before = refused;
+        for (int i = 0; i < 2; ++i) {
+            EXPECT_FALSE(store.value(c.suite, "k"));
+        }
+        EXPECT_EQ(refused, before + 1) << "counted once";
+        EXPECT_NE(errors.back().find(path.string() + " " + c.cause), std::string::npos)
+            << errors.back();
+        EXPECT_FALSE(store.setValue(c.suite, "k", Value(2)));
+    }
+    EXPECT_EQ(fs::file_size(tmp / "elsewhere.json"), 8u) << "not written through the link";
+}
+
 TEST_F(ALinuxPreferenceStore, KeepsHostileSuiteNamesInsideItsDirectoryAndApart) {
     LinuxPreferenceStore store(stateDir.string(), recordErrors());
     const std::string names[] = {"../../etc/x",

@@ -3,6 +3,9 @@
 #include <gtest/gtest.h>
 #include <nlohmann/json.hpp>
 
+#include <signal.h>
+#include <sys/resource.h>
+
 #include <cctype>
 #include <fstream>
 #include <iterator>
@@ -135,6 +138,35 @@ TEST_F(ASummaryJsonFileWorker, LogsFileErrorsAndLetsTheSessionGoOn) {
                   static_cast<std::size_t>(run));
     }
     EXPECT_EQ(log->count("can't create logging directory at "), 2u);
+}
+
+TEST_F(ASummaryJsonFileWorker, LeavesNoFileNorHalfOfOneWhenTheDiskIsFull) {
+    // A file size limit plays the full disk: a write past it fails (SIGXFSZ ignored: EFBIG).
+    test::ScopedMemoryLog log;
+    fake.device.logsDirectory = logs.path();
+    const auto previous = ::signal(SIGXFSZ, SIG_IGN);
+    rlimit saved{};
+    ASSERT_EQ(::getrlimit(RLIMIT_FSIZE, &saved), 0);
+    auto session = make(service::kTest);
+    session->start();
+    send(*session, {{"pad", std::string(4096, 'p')}}, category::kPlayback, type::kStart);
+    rlimit small = saved;
+    small.rlim_cur = 1024;
+    ASSERT_EQ(::setrlimit(RLIMIT_FSIZE, &small), 0);
+    session->stop();
+    ASSERT_EQ(::setrlimit(RLIMIT_FSIZE, &saved), 0);
+    ::signal(SIGXFSZ, previous);
+    EXPECT_TRUE(files().empty()) << "neither the file nor its temporary one";
+    EXPECT_TRUE(log->contains("SummaryJsonFileWorker failed to write line."));
+    EXPECT_TRUE(log->contains("(no file left)"));
+
+    // Room again: the next stop writes a whole file.
+    session->start();
+    send(*session, {{"n", 2}}, category::kPlayback, type::kStart);
+    session->stop();
+    ASSERT_EQ(files().size(), 1u);
+    std::ifstream in(files()[0]);
+    EXPECT_FALSE(nlohmann::ordered_json::parse(in, nullptr, false).is_discarded());
 }
 
 }  // namespace

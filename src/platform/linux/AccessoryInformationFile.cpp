@@ -12,6 +12,7 @@
 
 #include "platform/BluetoothFacility.h"
 #include "platform/SafeFileName.h"
+#include "platform/linux/RegularFile.h"
 #include "values/ValueJson.h"
 
 namespace qv {
@@ -26,16 +27,6 @@ AccessoryFileResult refused(std::string reason) {
     r.reason = std::move(reason);
     return r;
 }
-
-// Closes the descriptor however the reader leaves.
-struct FileDescriptor {
-    int fd;
-    ~FileDescriptor() {
-        if (fd >= 0) {
-            ::close(fd);
-        }
-    }
-};
 
 }  // namespace
 
@@ -69,48 +60,14 @@ AccessoryFileResult QVReportingReadAccessoryFile(const std::string& directory,
                                                  const std::string& canonicalAddress) {
     const std::string path = QVReportingAccessoryFilePath(directory, canonicalAddress);
     // No symbolic link may lead out of the directory, and a pipe or device must not block us.
-    FileDescriptor file{::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOFOLLOW | O_NONBLOCK)};
-    if (file.fd < 0) {
-        if (errno == ENOENT) {
-            return {};
-        }
-        if (errno == ELOOP) {
-            return refused("it is a symbolic link");
-        }
-        return refused(fmt::format("cannot open it: {}", std::strerror(errno)));
+    RegularFileRead file = QVReportingReadRegularFile(path, kMaxAccessoryFileBytes);
+    if (file.status == RegularFileRead::Status::Missing) {
+        return {};
     }
-    struct stat st {};
-    if (::fstat(file.fd, &st) != 0) {
-        return refused(fmt::format("cannot examine it: {}", std::strerror(errno)));
+    if (file.status == RegularFileRead::Status::Refused) {
+        return refused(std::move(file.reason));
     }
-    if (!S_ISREG(st.st_mode)) {
-        return refused("it is not a regular file");
-    }
-    if (static_cast<std::uint64_t>(st.st_size) > kMaxAccessoryFileBytes) {
-        return refused(fmt::format("it holds {} bytes, more than the {} accepted", st.st_size,
-                                   kMaxAccessoryFileBytes));
-    }
-    std::string text;
-    text.resize(kMaxAccessoryFileBytes + 1);
-    std::size_t length = 0;
-    while (length < text.size()) {
-        const ssize_t n = ::read(file.fd, text.data() + length, text.size() - length);
-        if (n < 0) {
-            if (errno == EINTR) {
-                continue;
-            }
-            return refused(fmt::format("cannot read it: {}", std::strerror(errno)));
-        }
-        if (n == 0) {
-            break;
-        }
-        length += static_cast<std::size_t>(n);
-    }
-    if (length > kMaxAccessoryFileBytes) {  // it grew while being read
-        return refused(
-            fmt::format("it holds more than the {} bytes accepted", kMaxAccessoryFileBytes));
-    }
-    text.resize(length);
+    const std::string& text = file.text;
 
     if (text.find('\0') != std::string::npos) {
         return refused("it is not JSON");  // the parser would read up to the NUL only

@@ -1,6 +1,7 @@
 #include "platform/linux/JsonlSink.h"
 
 #include <fcntl.h>
+#include <stdio.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -17,6 +18,8 @@
 
 #include "platform/Clock.h"
 #include "platform/SafeFileName.h"
+#include "platform/SinkSegments.h"
+#include "platform/linux/DiskBudget.h"
 #include "values/ValueJson.h"
 
 namespace qv {
@@ -54,10 +57,88 @@ off_t startOfTornLine(int fd, off_t size) {
     return 0;
 }
 
+// Where the line that ends just before `end` starts: just after the line feed before it.
+off_t startOfLineBefore(int fd, off_t end) {
+    char block[4096];
+    while (end > 0) {
+        const off_t from = std::max<off_t>(0, end - static_cast<off_t>(sizeof block));
+        const ssize_t n = ::pread(fd, block, static_cast<std::size_t>(end - from), from);
+        if (n != end - from) {
+            return -1;
+        }
+        for (ssize_t i = n - 1; i >= 0; --i) {
+            if (block[i] == '\n') {
+                return from + i + 1;
+            }
+        }
+        end = from;
+    }
+    return 0;
+}
+
+// The start of the line at offset: enough for its "time" and "seq".
+std::string lineHead(int fd, off_t offset) {
+    std::string head(256, '\0');
+    const ssize_t n = ::pread(fd, head.data(), head.size(), offset);
+    head.resize(static_cast<std::size_t>(std::max<ssize_t>(n, 0)));
+    return head;
+}
+
+// The "time" of a line's head, when it starts as a sink line does.
+std::optional<double> lineTime(const std::string& head) {
+    constexpr std::string_view prefix = "{\"time\":";
+    if (!head.starts_with(prefix)) {
+        return std::nullopt;
+    }
+    char* end = nullptr;
+    const double time = std::strtod(head.c_str() + prefix.size(), &end);
+    return end == head.c_str() + prefix.size() ? std::nullopt : std::optional<double>(time);
+}
+
+// The seq of the last whole line of a sink file (a torn tail after it is passed over).
+std::optional<std::uint64_t> lastLineSeq(int fd, off_t size) {
+    const off_t torn = startOfTornLine(fd, size);
+    const off_t end = torn < 0 ? size : torn;
+    if (end <= 0) {
+        return std::nullopt;
+    }
+    const off_t start = startOfLineBefore(fd, end - 1);
+    return start < 0 ? std::nullopt : QVReportingSinkLineSeq(lineHead(fd, start));
+}
+
+// A file opened to be read, without following a link or blocking; -1 unless it is regular.
+int openRegularForReading(const std::string& path, struct stat& st) {
+    const int fd = ::open(path.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC);
+    if (fd >= 0 && (::fstat(fd, &st) != 0 || !S_ISREG(st.st_mode))) {
+        ::close(fd);
+        return -1;
+    }
+    return fd;
+}
+
+const char* fileKind(mode_t mode) {
+    switch (mode & S_IFMT) {
+        case S_IFDIR:
+            return "a directory";
+        case S_IFIFO:
+            return "a FIFO";
+        case S_IFSOCK:
+            return "a socket";
+        case S_IFCHR:
+            return "a character device";
+        case S_IFBLK:
+            return "a block device";
+        case S_IFLNK:
+            return "a symbolic link";
+        default:
+            return "not a regular file";
+    }
+}
+
 }  // namespace
 
 JsonlSink::JsonlSink(std::string stateDir, std::string name, const Clock& clock,
-                     SinkCallbacks callbacks, std::size_t capacity)
+                     SinkCallbacks callbacks, std::size_t capacity, SinkSegmentPolicy segments)
     : name_(std::move(name)),
       directory_((std::filesystem::path(stateDir) / "sinks").string()),
       path_((std::filesystem::path(directory_) / (QVReportingSafeFileComponent(name_) + ".jsonl"))
@@ -65,6 +146,7 @@ JsonlSink::JsonlSink(std::string stateDir, std::string name, const Clock& clock,
       clock_(clock),
       callbacks_(std::move(callbacks)),
       capacity_(std::max<std::size_t>(capacity, 1)),
+      segments_(std::move(segments)),
       writer_(std::make_unique<BoundedWriter<Line>>(
           BoundedWriter<Line>::kBatches, capacity_,
           [this](std::deque<Line>& lines) { writeBatch(lines); })) {
@@ -114,10 +196,12 @@ void JsonlSink::flush() {
     writer_->flush();
 }
 
-void JsonlSink::formatLine(std::string& out, const Line& line) {
+void JsonlSink::formatLine(std::string& out, const Line& line, std::uint64_t seq) {
     const std::size_t start = out.size();
     out += "{\"time\":";
     QVReportingAppendJsonText(out, Value(line.time));
+    out += ",\"seq\":";
+    out += std::to_string(seq);
     bool valid = true;
     for (const auto& [key, value] : line.members) {
         out += ',';
@@ -133,6 +217,7 @@ void JsonlSink::formatLine(std::string& out, const Line& line) {
         out.resize(start);
         nlohmann::ordered_json object = nlohmann::ordered_json::object();
         object["time"] = line.time;
+        object["seq"] = seq;
         for (const auto& [key, value] : line.members) {
             object[key] = QVReportingValueToJson(value);
         }
@@ -146,13 +231,36 @@ void JsonlSink::formatLine(std::string& out, const Line& line) {
 void JsonlSink::writeBatch(std::deque<Line>& lines) {
     text_.clear();
     std::size_t pending = 0;
+    std::string reason;
     for (const Line& line : lines) {
+        // The file is open before a line is numbered: the first open finds where the seq is.
+        if (!openFile(reason)) {
+            lose(reason);
+            continue;
+        }
+        if (segmentIsFull(line, text_.size())) {
+            if (pending > 0) {
+                writeText(text_, pending);
+                text_.clear();
+                pending = 0;
+            }
+            closeSegment();
+            if (!openFile(reason)) {
+                lose(reason);
+                continue;
+            }
+        }
         try {
-            formatLine(text_, line);
+            formatLine(text_, line, nextSeq_);
         } catch (const std::exception& e) {
             lose(fmt::format("cannot format a line: {}", e.what()));
             continue;
         }
+        if (segmentFirstSeq_ == 0) {
+            segmentFirstSeq_ = nextSeq_;
+            segmentStartTime_ = line.time;
+        }
+        ++nextSeq_;
         ++pending;
         if (text_.size() >= kMaxWriteBytes) {
             writeText(text_, pending);
@@ -172,10 +280,12 @@ void JsonlSink::writeBatch(std::deque<Line>& lines) {
 void JsonlSink::writeText(const std::string& text, std::size_t lines) {
     std::string reason;
     if (!openFile(reason)) {
+        nextSeq_ -= lines;
         lose(reason, lines);
         return;
     }
     std::string_view rest = text;
+    const std::uint64_t firstSeq = nextSeq_ - lines;
     if (tornByUs_) {
         // Our last write stopped inside a line: end that fragment so these lines stay whole.
         if (::write(fd_, "\n", 1) == 1) {
@@ -191,6 +301,7 @@ void JsonlSink::writeText(const std::string& text, std::size_t lines) {
             break;
         }
         rest.remove_prefix(static_cast<std::size_t>(n));
+        segmentBytes_ += static_cast<std::uint64_t>(n);
     }
     if (rest.empty()) {
         if (!lastProblem_.empty() && callbacks_.problem) {
@@ -212,6 +323,11 @@ void JsonlSink::writeText(const std::string& text, std::size_t lines) {
         tornByUs_ = lastEnd == std::string_view::npos ? tornByUs_ || !cut : !cut;
     }
     const auto whole = static_cast<std::size_t>(std::count(written.begin(), written.end(), '\n'));
+    // The lines not written give their seqs to the next ones.
+    nextSeq_ = firstSeq + whole;
+    if (segmentFirstSeq_ >= nextSeq_) {
+        segmentFirstSeq_ = 0;
+    }
     reason = fmt::format("cannot write to {}: {}", path_, errnoText(error));
     // A descriptor that failed once is not trusted again: the next lines open the file afresh.
     closeFile();
@@ -239,20 +355,108 @@ bool JsonlSink::openFile(std::string& reason) {
         reason = fmt::format("cannot create {}: {}", directory_, ec.message());
         return false;
     }
+    // Neither a pipe (which would block the open until a reader came) nor a link is written.
     int fd;
     do {
-        fd = ::open(path_.c_str(), O_WRONLY | O_APPEND | O_CREAT | O_CLOEXEC, 0644);
+        fd = ::open(path_.c_str(),
+                    O_WRONLY | O_APPEND | O_CREAT | O_CLOEXEC | O_NOFOLLOW | O_NONBLOCK, 0644);
     } while (fd < 0 && errno == EINTR);
-    if (fd < 0) {
-        reason = fmt::format("cannot open {}: {}", path_, errnoText(errno));
+    struct stat st {};
+    if (fd >= 0 && ::fstat(fd, &st) == 0 && S_ISREG(st.st_mode)) {
+        fd_ = fd;
+        segmentBytes_ = static_cast<std::uint64_t>(st.st_size);
+        if (!tailChecked_) {
+            tailChecked_ = true;
+            repairTornTail();
+            recoverSegment();
+        }
+        return true;
+    }
+    const int error = errno;
+    if (fd >= 0) {
+        ::close(fd);
+        reason =
+            fmt::format("refused {}: it is {}, not a regular file", path_, fileKind(st.st_mode));
+    } else if (error == ELOOP || error == ENXIO || error == EISDIR) {
+        struct stat link {};
+        reason = fmt::format(
+            "refused {}: it is {}, not a regular file", path_,
+            ::lstat(path_.c_str(), &link) == 0 ? fileKind(link.st_mode) : "not a regular file");
+    } else {
+        reason = fmt::format("cannot open {}: {}", path_, errnoText(error));
         return false;
     }
-    fd_ = fd;
-    if (!tailChecked_) {
-        tailChecked_ = true;
-        repairTornTail();
+    if (reason != lastProblem_ && callbacks_.fileRefused) {
+        callbacks_.fileRefused(path_);
     }
-    return true;
+    return false;
+}
+
+void JsonlSink::recoverSegment() {
+    struct stat st {};
+    std::optional<std::uint64_t> last;
+    if (const int reader = openRegularForReading(path_, st); reader >= 0) {
+        if (st.st_size > 0) {
+            const std::string head = lineHead(reader, 0);
+            segmentFirstSeq_ = QVReportingSinkLineSeq(head).value_or(0);
+            segmentStartTime_ = lineTime(head).value_or(clock_.now());
+            last = lastLineSeq(reader, st.st_size);
+        }
+        ::close(reader);
+    }
+    if (!last) {
+        // An empty current segment (or one of lines without a seq): the newest closed one says.
+        auto segments = QVReportingListSinkSegments(directory_, name_);
+        if (!segments.empty() && segments.back().current) {
+            segments.pop_back();
+        }
+        if (!segments.empty()) {
+            const auto& newest = segments.back();
+            nextSeq_ = std::max(nextSeq_, newest.firstSeq + 1);
+            if (const int reader = openRegularForReading(newest.path.string(), st); reader >= 0) {
+                last = lastLineSeq(reader, st.st_size);
+                ::close(reader);
+            }
+        }
+    }
+    if (last) {
+        nextSeq_ = std::max(nextSeq_, *last + 1);
+    }
+    if (segmentBytes_ > 0 && segmentFirstSeq_ == 0) {
+        // Lines without a seq: the segment is named after the first line that has one.
+        segmentFirstSeq_ = nextSeq_;
+        segmentStartTime_ = clock_.now();
+    }
+}
+
+bool JsonlSink::segmentIsFull(const Line& line, std::size_t pendingBytes) const {
+    return segmentFirstSeq_ != 0 && (segmentBytes_ + pendingBytes >= segments_.segmentBytes ||
+                                     line.time - segmentStartTime_ >= segments_.segmentSeconds);
+}
+
+void JsonlSink::closeSegment() {
+    const std::string closed =
+        (std::filesystem::path(directory_) /
+         QVReportingSinkSegmentName(QVReportingSafeFileComponent(name_), segmentFirstSeq_))
+            .string();
+    // Never over another segment: seqs are not reused, so a name taken means something is amiss.
+    if (::renameat2(AT_FDCWD, path_.c_str(), AT_FDCWD, closed.c_str(), RENAME_NOREPLACE) != 0) {
+        if (!closeProblem_ && callbacks_.problem) {
+            callbacks_.problem(
+                fmt::format("sink {}: cannot close the segment {} as {}: {}; "
+                            "writing on in it",
+                            name_, path_, closed, errnoText(errno)));
+        }
+        closeProblem_ = true;
+        return;
+    }
+    closeProblem_ = false;
+    closeFile();
+    segmentFirstSeq_ = 0;
+    segmentBytes_ = 0;
+    if (segments_.closedSegments) {
+        segments_.closedSegments->enforce();
+    }
 }
 
 void JsonlSink::repairTornTail() {
@@ -260,8 +464,9 @@ void JsonlSink::repairTornTail() {
     if (::fstat(fd_, &st) != 0 || !S_ISREG(st.st_mode) || st.st_size == 0) {
         return;
     }
-    // The sink's own descriptor only writes (a pipe in the file's place must not be read).
-    const int reader = ::open(path_.c_str(), O_RDONLY | O_CLOEXEC);
+    // The sink's own descriptor only writes.
+    struct stat readSt {};
+    const int reader = openRegularForReading(path_, readSt);
     if (reader < 0) {
         return;
     }
@@ -280,6 +485,7 @@ void JsonlSink::repairTornTail() {
     if (callbacks_.tornLineRemoved) {
         callbacks_.tornLineRemoved(name_);
     }
+    segmentBytes_ = static_cast<std::uint64_t>(keep);
     if (callbacks_.problem) {
         callbacks_.problem(
             fmt::format("sink {}: removed a torn last line of {} bytes from {} (left by a crash)",

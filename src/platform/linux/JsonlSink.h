@@ -1,7 +1,20 @@
 // A sink file: <stateDir>/sinks/<name>.jsonl, one JSON object a line, each starting with "time"
-// (seconds since 1970, a double, read from the clock when the line is appended) followed by the
-// caller's members in their order. This is where the Linux stand-ins of the platform's telemetry
-// services put what they receive.
+// (seconds since 1970, a double, read from the clock when the line is appended) and "seq" (the
+// sink's line number, from 1 over the life of the state directory) followed by the caller's
+// members in their order. This is where the Linux stand-ins of the platform's telemetry services
+// put what they receive.
+//
+// Segments (see platform/SinkSegments.h): <name>.jsonl is the current segment. Before a line
+// that would go into a segment already past SinkSegmentPolicy's bytes, or begun more than its
+// seconds before the line's time, the segment is renamed to <name>.<SEQ>.jsonl (SEQ: its first
+// line's seq) and a new one begins; the closed segments' shared budget is then enforced. At the
+// first open the seq goes on from the newest segment's last whole line (the current one, else
+// the newest closed one). A line that is lost gives its seq to the next one, so the files' seqs
+// run without gaps unless a budget removed a segment.
+//
+// The file is opened without following a link and without blocking, and must be a regular file:
+// anything else in its place (a pipe, a device, a link) is refused, said once and counted, and
+// the lines meant for it are lost.
 //
 // append() never waits: lines go through a bounded buffer to the sink's own thread, which turns
 // them into JSON and writes them on an O_APPEND descriptor as soon as it is woken: each write(2)
@@ -30,6 +43,7 @@
 #include <deque>
 #include <functional>
 #include <memory>
+#include <optional>
 #include <string>
 #include <string_view>
 
@@ -39,6 +53,17 @@
 namespace qv {
 
 class Clock;
+class DiskBudget;
+
+// When a sink closes its current segment, and the budget of the closed ones.
+struct SinkSegmentPolicy {
+    static constexpr std::uint64_t kDefaultSegmentBytes = std::uint64_t{64} << 20;
+    static constexpr double kDefaultSegmentSeconds = 86400;
+    std::uint64_t segmentBytes = kDefaultSegmentBytes;
+    double segmentSeconds = kDefaultSegmentSeconds;  // from the segment's first line, by the Clock
+    // Shared by every sink of the daemon; null keeps every closed segment.
+    std::shared_ptr<DiskBudget> closedSegments;
+};
 
 // How a sink tells its owner about trouble. Platform code neither counts nor logs by itself:
 // main() wires these to the guardrail counters and to the log.
@@ -51,6 +76,8 @@ struct SinkCallbacks {
     // cause are not reported again until a line is written or the cause changes, so a broken
     // disk costs one log line, not one per event; lineLost still hears of every line.
     std::function<void(const std::string& message)> problem;
+    // Something other than a regular file in the sink file's place (reported with problem).
+    std::function<void(const std::string& path)> fileRefused;
 };
 
 class JsonlSink {
@@ -61,7 +88,7 @@ class JsonlSink {
     // name must be a plain file name (the daemon names its sinks); it is made safe all the same.
     // Nothing is opened yet: the first line makes the directory and opens the file.
     JsonlSink(std::string stateDir, std::string name, const Clock& clock, SinkCallbacks callbacks,
-              std::size_t capacity = kDefaultCapacity);
+              std::size_t capacity = kDefaultCapacity, SinkSegmentPolicy segments = {});
     // Writes every line still queued, then closes the file.
     ~JsonlSink();
 
@@ -96,15 +123,22 @@ class JsonlSink {
 
     // The sink's thread only, from here down.
     void writeBatch(std::deque<Line>& lines);
-    // Appends the line's JSON text and its line feed to out.
-    void formatLine(std::string& out, const Line& line);
-    // Writes text, which holds `lines` whole lines; on failure they are lost.
+    // Appends the line's JSON text, with seq, and its line feed to out.
+    void formatLine(std::string& out, const Line& line, std::uint64_t seq);
+    // Writes text, which holds `lines` whole lines; on failure they are lost and their seqs go
+    // to the next lines.
     void writeText(const std::string& text, std::size_t lines);
     // Makes the directory and opens the file when no descriptor is open; false with a reason.
     bool openFile(std::string& reason);
     // On the first open: a last line cut short by a crash is removed, so the file stays whole
     // JSON lines.
     void repairTornTail();
+    // On the first open: the next seq, and the current segment's first seq and time.
+    void recoverSegment();
+    // Whether the line must begin a new segment.
+    bool segmentIsFull(const Line& line, std::size_t pendingBytes) const;
+    // Renames the current segment to its closed name and enforces the budget.
+    void closeSegment();
     bool cutOwnFragment(std::size_t bytes);
     void closeFile();
     void lose(const std::string& reason, std::size_t lines = 1);
@@ -115,6 +149,7 @@ class JsonlSink {
     const Clock& clock_;
     const SinkCallbacks callbacks_;
     const std::size_t capacity_;
+    const SinkSegmentPolicy segments_;
     // A run of drops for a full buffer is reported once; cleared by the next accepted line.
     std::atomic<bool> dropping_{false};
 
@@ -124,6 +159,12 @@ class JsonlSink {
     bool tailChecked_ = false;     // sink's thread only: the file's end was looked at
     bool tornByUs_ = false;        // sink's thread only: our last write ended inside a line
     std::string text_;             // sink's thread only: lines being written
+    // Sink's thread only: the segment being written.
+    std::uint64_t nextSeq_ = 1;
+    std::uint64_t segmentFirstSeq_ = 0;  // 0 while the current segment holds no line
+    double segmentStartTime_ = 0;        // its first line's time
+    std::uint64_t segmentBytes_ = 0;     // its size
+    bool closeProblem_ = false;          // a failed rename was reported
 
     // Last, and reset first in the destructor: its thread uses every member above.
     std::unique_ptr<BoundedWriter<Line>> writer_;

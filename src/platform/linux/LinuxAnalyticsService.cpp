@@ -82,7 +82,8 @@ std::vector<std::string> parsePatterns(std::string_view contents) {
 LinuxAnalyticsService::Created LinuxAnalyticsService::create(const std::string& stateDir,
                                                              const Clock& clock,
                                                              const std::string& eventsFile,
-                                                             SinkCallbacks callbacks) {
+                                                             SinkCallbacks callbacks,
+                                                             SinkSegmentPolicy segments) {
     std::optional<std::vector<std::string>> patterns;
     if (!eventsFile.empty()) {
         std::string error;
@@ -94,7 +95,8 @@ LinuxAnalyticsService::Created LinuxAnalyticsService::create(const std::string& 
         patterns = parsePatterns(*contents);
     }
     auto sink =
-        std::make_unique<JsonlSink>(stateDir, std::string(kSinkName), clock, std::move(callbacks));
+        std::make_unique<JsonlSink>(stateDir, std::string(kSinkName), clock, std::move(callbacks),
+                                    JsonlSink::kDefaultCapacity, std::move(segments));
     return {std::make_unique<LinuxAnalyticsService>(std::move(sink), std::move(patterns)), {}};
 }
 

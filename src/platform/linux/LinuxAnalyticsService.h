@@ -39,7 +39,8 @@ class LinuxAnalyticsService final : public AnalyticsService {
     // The service writing to <stateDir>/sinks/analytics.jsonl; eventsFile empty means every
     // event is in use. An events file that cannot be read gives no service and says why.
     static Created create(const std::string& stateDir, const Clock& clock,
-                          const std::string& eventsFile, SinkCallbacks callbacks);
+                          const std::string& eventsFile, SinkCallbacks callbacks,
+                          SinkSegmentPolicy segments = {});
 
     // eventPatterns: names and globs in use, or nothing for every event.
     LinuxAnalyticsService(std::unique_ptr<JsonlSink> sink,

@@ -369,10 +369,11 @@ class LinuxBluetoothFacility::Session {
 };
 
 LinuxBluetoothFacility::LinuxBluetoothFacility(std::string bus, std::string accessoryDirectory,
-                                               LogCallback log)
+                                               LogCallback log, std::function<void()> fileRefused)
     : bus_(std::move(bus)),
       accessoryDirectory_(std::move(accessoryDirectory)),
-      log_(std::move(log)) {
+      log_(std::move(log)),
+      fileRefused_(std::move(fileRefused)) {
     stopFd_ = ::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK);
     if (stopFd_ < 0) {
         note(LogLevel::Error, fmt::format("BlueZ: eventfd failed: {}; Bluetooth is unavailable",
@@ -593,6 +594,9 @@ void LinuxBluetoothFacility::readMarkedAccessories() {
                      fmt::format("accessory file {} refused: {}; the device has no accessory "
                                  "information",
                                  path, result.reason));
+                if (fileRefused_) {
+                    fileRefused_();
+                }
             } else {
                 note(LogLevel::Info, fmt::format("accessory file {} {}", path, outcome));
             }

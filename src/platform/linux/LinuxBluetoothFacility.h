@@ -60,8 +60,10 @@ class LinuxBluetoothFacility final : public BluetoothFacility {
     using LogCallback = std::function<void(LogLevel level, const std::string& line)>;
 
     // bus: "system" or a D-Bus address. Starts the facility's thread, which connects at once.
-    // log hears every line, on the facility's thread.
-    LinuxBluetoothFacility(std::string bus, std::string accessoryDirectory, LogCallback log);
+    // log hears every line, on the facility's thread; fileRefused hears of each accessory file
+    // newly refused (it is logged too).
+    LinuxBluetoothFacility(std::string bus, std::string accessoryDirectory, LogCallback log,
+                           std::function<void()> fileRefused = {});
     // Ends the thread (within kCallTimeout when it is waiting on BlueZ).
     ~LinuxBluetoothFacility() override;
 
@@ -122,6 +124,7 @@ class LinuxBluetoothFacility final : public BluetoothFacility {
     const std::string bus_;
     const std::string accessoryDirectory_;
     const LogCallback log_;
+    const std::function<void()> fileRefused_;
     int stopFd_ = -1;
     int inotifyFd_ = -1;
     int watch_ = -1;

@@ -2,11 +2,9 @@
 
 #include <nlohmann/json.hpp>
 
-#include <cerrno>
-#include <cstring>
-#include <fstream>
-#include <iterator>
 #include <string>
+
+#include "platform/linux/RegularFile.h"
 
 namespace qv {
 
@@ -14,10 +12,9 @@ LinuxDeviceInformation::LinuxDeviceInformation(const std::string& path,
                                                std::filesystem::path logsDirectory,
                                                std::optional<bool> internalBuildOverride)
     : logsDirectory_(std::move(logsDirectory)) {
-    std::ifstream in(path, std::ios::binary);
-    if (in) {
-        const std::string text{std::istreambuf_iterator<char>(in),
-                               std::istreambuf_iterator<char>()};
+    const RegularFileRead file = QVReportingReadRegularFile(path, kMaxDeviceFileBytes);
+    if (file.status == RegularFileRead::Status::Read) {
+        const std::string& text = file.text;
         // The parser takes a NUL byte for the end of the text; JSON holds none, so such a file
         // is not one (rather than the part before the NUL).
         const auto doc = text.find('\0') != std::string::npos
@@ -37,8 +34,9 @@ LinuxDeviceInformation::LinuxDeviceInformation(const std::string& path,
                 }
             }
         }
-    } else if (errno != ENOENT) {
-        loadError_ = path + ": " + std::strerror(errno);
+    } else if (file.status == RegularFileRead::Status::Refused) {
+        loadError_ = path + ": " + file.reason;
+        fileRefused_ = true;
     }
     if (internalBuildOverride) {
         internalBuild_ = internalBuildOverride;

@@ -98,8 +98,11 @@ bool LinuxPreferenceStore::Identity::operator==(const Identity& other) const {
            modified.tv_sec == other.modified.tv_sec && modified.tv_nsec == other.modified.tv_nsec;
 }
 
-LinuxPreferenceStore::LinuxPreferenceStore(std::string stateDir, ErrorCallback onError)
-    : directory_(std::move(stateDir) + "/defaults"), onError_(std::move(onError)) {
+LinuxPreferenceStore::LinuxPreferenceStore(std::string stateDir, ErrorCallback onError,
+                                           std::function<void()> onFileRefused)
+    : directory_(std::move(stateDir) + "/defaults"),
+      onError_(std::move(onError)),
+      onFileRefused_(std::move(onFileRefused)) {
     Problems problems;
     ensureDirectory(problems);
     report(problems);
@@ -173,7 +176,8 @@ const Dictionary& LinuxPreferenceStore::loadLocked(const std::string& path, Prob
     if (intact != nullptr) {
         *intact = true;
     }
-    FileDescriptor fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOCTTY | O_NONBLOCK));
+    FileDescriptor fd(
+        ::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOCTTY | O_NONBLOCK | O_NOFOLLOW));
     const int openError = fd.get() < 0 ? errno : 0;
     if (openError == ENOENT) {
         cache_.erase(path);
@@ -199,12 +203,17 @@ const Dictionary& LinuxPreferenceStore::loadLocked(const std::string& path, Prob
     entry.identity = identity;
     entry.trusted = realNow() - secondsOf(identity.modified) >= kTrustAfterSeconds;
     std::string text;
-    if (fd.get() < 0) {
+    if (fd.get() < 0 && openError == ELOOP) {
+        entry.problem = path + " is a symbolic link";
+        entry.refused = true;
+    } else if (fd.get() < 0) {
         entry.problem = "cannot open " + path + ": " + errnoText(openError);
     } else if (!S_ISREG(info.st_mode)) {
         entry.problem = path + " is not a regular file";
+        entry.refused = true;
     } else if (info.st_size > kMaximumFileSize) {
         entry.problem = path + " is too large to be a defaults file";
+        entry.refused = true;
     } else if (!readAll(fd.get(), text)) {
         entry.problem = "cannot read " + path + ": " + errnoText(errno);
     } else if (text.find('\0') != std::string::npos) {
@@ -225,6 +234,9 @@ const Dictionary& LinuxPreferenceStore::loadLocked(const std::string& path, Prob
     if (!entry.problem.empty()) {
         if (!seen || it->second.problem != entry.problem) {
             problems.push_back(entry.problem + "; it reads as empty");
+            if (entry.refused && onFileRefused_) {
+                onFileRefused_();
+            }
         }
         if (intact != nullptr) {
             *intact = false;

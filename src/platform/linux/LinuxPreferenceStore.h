@@ -40,8 +40,11 @@ class LinuxPreferenceStore final : public PreferenceStore {
 
     // Creates <stateDir>/defaults when it is missing (and again before a write, should it go
     // away). onError, when set, hears of every problem; it may be called from any thread that
-    // uses the store, never with the store's lock held.
-    explicit LinuxPreferenceStore(std::string stateDir, ErrorCallback onError = {});
+    // uses the store, never with the store's lock held. onFileRefused hears of each defaults
+    // file newly refused for what it is (a link, not a regular file, too large); it may be called
+    // with the lock held, so it must not use the store.
+    explicit LinuxPreferenceStore(std::string stateDir, ErrorCallback onError = {},
+                                  std::function<void()> onFileRefused = {});
 
     LinuxPreferenceStore(const LinuxPreferenceStore&) = delete;
     LinuxPreferenceStore& operator=(const LinuxPreferenceStore&) = delete;
@@ -69,7 +72,8 @@ class LinuxPreferenceStore final : public PreferenceStore {
         Identity identity;
         bool trusted = false;  // false: read again even when the identity matches
         Dictionary values;
-        std::string problem;  // why the file reads as empty, when it could not be used
+        std::string problem;   // why the file reads as empty, when it could not be used
+        bool refused = false;  // for what it is, not for what it holds
     };
     using Problems = std::vector<std::string>;
 
@@ -87,6 +91,7 @@ class LinuxPreferenceStore final : public PreferenceStore {
 
     const std::string directory_;
     const ErrorCallback onError_;
+    const std::function<void()> onFileRefused_;
     mutable std::mutex mutex_;
     mutable std::map<std::string, CachedSuite, std::less<>> cache_;  // by path; guarded by mutex_
 };

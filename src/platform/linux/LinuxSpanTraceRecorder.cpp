@@ -375,8 +375,10 @@ struct LinuxSpanTraceRecorder::Core {
             return std::nullopt;
         }
         const fs::path target = options.traceDirectory / (rec.name + ".trace");
+        // Written under a hidden name and renamed when whole: a reader never sees half a trace.
+        const fs::path partial = options.traceDirectory / ("." + rec.name + ".trace.partial");
         const int out =
-            ::open(target.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_NOFOLLOW | O_CLOEXEC, 0644);
+            ::open(partial.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_NOFOLLOW | O_CLOEXEC, 0644);
         if (out < 0) {
             error = fmt::format("cannot create {}: {}", target.string(), errnoText(errno));
             ::close(in);
@@ -425,13 +427,19 @@ struct LinuxSpanTraceRecorder::Core {
                                options.maxTraceBytes));
         }
         ::close(in);
+        if (failure == 0 && ::fsync(out) != 0) {
+            failure = errno;
+        }
         if (::close(out) != 0 && failure == 0) {
+            failure = errno;
+        }
+        if (failure == 0 && ::rename(partial.c_str(), target.c_str()) != 0) {
             failure = errno;
         }
         if (failure != 0) {
             error = fmt::format("cannot copy the trace of {} to {}: {}", rec.instance.string(),
                                 target.string(), errnoText(failure));
-            fs::remove(target, ec);
+            fs::remove(partial, ec);
             return std::nullopt;
         }
         return target;

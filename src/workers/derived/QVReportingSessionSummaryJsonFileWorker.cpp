@@ -55,6 +55,7 @@ QVReportingSessionSummaryJsonFileWorker::initWithSession(
 QVReportingSessionSummaryJsonFileWorker::~QVReportingSessionSummaryJsonFileWorker() {
     if (reportFileHandle_ >= 0) {
         ::close(reportFileHandle_);
+        ::unlink(tempPath_.c_str());
     }
 }
 
@@ -77,8 +78,10 @@ void QVReportingSessionSummaryJsonFileWorker::openFile() {
         QVReportingSafeFileComponent(QVReportingUtilityRetrieveAppName(owner->configuration())),
         QVReportingSafeFileComponent(owner->serviceName(), 64));
     reportPath_ = (directory / name).string();
+    tempPath_ = (directory / ("." + name + ".partial")).string();
+    writeFailed_ = false;
     reportFileHandle_ =
-        ::open(reportPath_.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_NOFOLLOW | O_CLOEXEC, 0666);
+        ::open(tempPath_.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_NOFOLLOW | O_CLOEXEC, 0666);
     if (reportFileHandle_ < 0) {
         QVLOG_ERROR(logCategory(),
                     "SummaryJsonFileWorker failed to open file. action=open file={} error=\"{}\"",
@@ -103,9 +106,11 @@ void QVReportingSessionSummaryJsonFileWorker::writeLine(std::string_view line) {
 }
 
 void QVReportingSessionSummaryJsonFileWorker::writePending() {
-    const bool written = writeAll(reportFileHandle_, pending_);
+    // After a failure the rest is not written: the file will not be kept.
+    const bool written = !writeFailed_ && writeAll(reportFileHandle_, pending_);
     pending_.clear();
-    if (!written) {
+    if (!written && !writeFailed_) {
+        writeFailed_ = reportFileHandle_ >= 0;
         QVLOG_ERROR(
             logCategory(),
             "SummaryJsonFileWorker failed to write line. action=writeline file={} error=\"{}\"",
@@ -116,13 +121,23 @@ void QVReportingSessionSummaryJsonFileWorker::writePending() {
 void QVReportingSessionSummaryJsonFileWorker::closeFile() {
     writeLine("]");
     writePending();
-    const int result = ::close(reportFileHandle_);
+    int error = writeFailed_ ? EIO : 0;
+    if (error == 0 && ::fsync(reportFileHandle_) != 0) {
+        error = errno;
+    }
+    if (::close(reportFileHandle_) != 0 && error == 0) {
+        error = errno;
+    }
     reportFileHandle_ = -1;
-    if (result != 0) {
-        QVLOG_ERROR(
-            logCategory(),
-            "SummaryJsonFileWorker failed to closed file. action=close file={} error=\"{}\"",
-            reportPath_, std::strerror(errno));
+    if (error == 0 && ::rename(tempPath_.c_str(), reportPath_.c_str()) != 0) {
+        error = errno;
+    }
+    if (error != 0) {
+        ::unlink(tempPath_.c_str());
+        QVLOG_ERROR(logCategory(),
+                    "SummaryJsonFileWorker failed to closed file. action=close file={} "
+                    "error=\"{}\" (no file left)",
+                    reportPath_, writeFailed_ ? "a write failed" : std::strerror(error));
     } else {
         QVLOG_INFO(logCategory(), "SummaryJsonFileWorker closed file. action=close file={}",
                    reportPath_);

@@ -6,8 +6,10 @@
 // array written line by line: "[", each message as a pretty-printed object
 // {"<category>_<type>_<n>": payload with "isSessionStarted"}, "," between two objects, "]". It is
 // opened at the first message to write, so an empty session leaves no file. The parts of the name
-// that clients choose are made safe, so the file always lands in the directory. File errors are
-// logged; the session goes on.
+// that clients choose are made safe, so the file always lands in the directory. It is written
+// under a hidden temporary name (".<name>.partial") beside it, synced and renamed when whole, so a
+// reader never sees half a file; when a write fails (a full disk) the temporary file is removed
+// and no file is left. File errors are logged; the session goes on.
 //
 // Thread safety: called on the session's queue, like every worker.
 #pragma once
@@ -49,7 +51,9 @@ class QVReportingSessionSummaryJsonFileWorker final : public QVReportingSessionW
     void writePending();
 
     std::string reportPath_;
+    std::string tempPath_;  // where the file is written until it is whole
     int reportFileHandle_ = -1;
+    bool writeFailed_ = false;
     std::string pending_;  // lines not yet written
 };
 

@@ -301,10 +301,14 @@ void QVReportingSessionTraceWorker::processTraceThreadline(
     threadlineModel_.reset();
 
     if (mWriter_) {
-        if (const int error = mWriter_->close(); error != 0) {
-            QVLOG_ERROR(logCategory(), "Failed to write gaugedata. errno: {}", error);
-        }
+        const int error = mWriter_->close();
         mWriter_.reset();
+        if (error != 0) {
+            // Half a results file is worse than none: a reader would take it for the results.
+            QVLOG_ERROR(logCategory(), "Failed to write gaugedata. errno: {}", error);
+            fs::remove(tempWriterPath_, ec);
+            return;
+        }
     }
     QVLOG_DEBUG(logCategory(), "Moving file from tempWriterPath: {} to {}", tempWriterPath_,
                 fullWriterPath_);

@@ -1,0 +1,134 @@
+#include "platform/linux/DiskBudget.h"
+
+#include <gtest/gtest.h>
+
+#include <fcntl.h>
+#include <sys/stat.h>
+
+#include <filesystem>
+#include <fstream>
+#include <map>
+#include <string>
+#include <vector>
+
+#include "fakes/FakeClock.h"
+#include "fakes/TempDirectory.h"
+#include "platform/SinkSegments.h"
+#include "platform/linux/JsonlSink.h"
+
+namespace qv {
+namespace {
+
+namespace fs = std::filesystem;
+
+void makeFile(const fs::path& path, std::size_t bytes, time_t modified) {
+    std::ofstream(path, std::ios::binary) << std::string(bytes, 'x');
+    const timespec times[2] = {{modified, 0}, {modified, 0}};
+    ASSERT_EQ(::utimensat(AT_FDCWD, path.c_str(), times, 0), 0);
+}
+
+TEST(ADiskBudget, RemovesTheOldestClosedSegmentsFirstKeepingEachSinksOrderAndCountsThem) {
+    test::TempDirectory tmp{"qvbudget"};
+    const fs::path sinks = tmp.path();
+    // b.5 was modified before b.1 (a clock set back), yet a sink's segments go in seq order.
+    const struct {
+        std::uint64_t maxBytes;
+        std::vector<std::string> left;
+        std::map<std::string, std::uint64_t> expired;
+    } cases[] = {
+        {400,
+         {"a.000000000001.jsonl", "a.000000000011.jsonl", "b.000000000001.jsonl",
+          "b.000000000005.jsonl"},
+         {}},
+        {300,
+         {"a.000000000011.jsonl", "b.000000000001.jsonl", "b.000000000005.jsonl"},
+         {{"a", 100}}},
+        {250, {"a.000000000011.jsonl", "b.000000000005.jsonl"}, {{"a", 100}, {"b", 100}}},
+        {100, {"a.000000000011.jsonl"}, {{"a", 100}, {"b", 200}}},
+        {0, {}, {{"a", 200}, {"b", 200}}},
+    };
+    for (const auto& c : cases) {
+        SCOPED_TRACE(c.maxBytes);
+        makeFile(sinks / "a.000000000001.jsonl", 100, 1000);
+        makeFile(sinks / "a.000000000011.jsonl", 100, 3000);
+        makeFile(sinks / "b.000000000001.jsonl", 100, 2000);
+        makeFile(sinks / "b.000000000005.jsonl", 100, 500);
+        makeFile(sinks / "a.jsonl", 5000, 100);  // current: never removed nor counted
+        std::map<std::string, std::uint64_t> expired;
+        std::vector<std::string> logged;
+        DiskBudget budget("sinks", c.maxBytes, DiskBudget::closedSinkSegmentsIn(sinks),
+                          {[&](std::string_view sink, std::uint64_t bytes) {
+                               expired[std::string(sink)] += bytes;
+                           },
+                           [&](const std::string& line) { logged.push_back(line); }});
+        budget.enforce();
+        std::vector<std::string> left;
+        for (const auto& sink : {"a", "b"}) {
+            for (const auto& segment : QVReportingListSinkSegments(sinks, sink)) {
+                if (!segment.current) {
+                    left.push_back(segment.path.filename().string());
+                }
+            }
+        }
+        EXPECT_EQ(left, c.left);
+        EXPECT_EQ(expired, c.expired);
+        EXPECT_TRUE(fs::exists(sinks / "a.jsonl"));
+        EXPECT_EQ(logged.size(), c.expired.empty() ? 0u : 1u);
+        for (const auto& entry : fs::directory_iterator(sinks)) {
+            fs::remove(entry.path());
+        }
+    }
+}
+
+TEST(ADiskBudget, KeepsTheClosedSegmentsOfSinksThatShareItWithinIt) {
+    test::TempDirectory tmp{"qvbudget"};
+    test::FakeClock clock;
+    const fs::path sinks = tmp.path() / "sinks";
+    std::map<std::string, std::uint64_t> expired;
+    auto budget = std::make_shared<DiskBudget>(
+        "sinks", 600, DiskBudget::closedSinkSegmentsIn(sinks),
+        DiskBudget::Callbacks{[&](std::string_view sink, std::uint64_t bytes) {
+                                  expired[std::string(sink)] += bytes;
+                              },
+                              nullptr});
+    {
+        const SinkSegmentPolicy policy{200, 1e9, budget};
+        JsonlSink a(tmp.path().string(), "a", clock, {}, JsonlSink::kDefaultCapacity, policy);
+        JsonlSink b(tmp.path().string(), "b", clock, {}, JsonlSink::kDefaultCapacity, policy);
+        for (int i = 0; i < 40; ++i) {
+            (i % 4 == 0 ? b : a).append({{"i", i}});
+            a.flush();
+            b.flush();
+        }
+    }
+    std::uint64_t closedBytes = 0;
+    std::uint64_t allBytes = 0;
+    for (const auto& entry : fs::directory_iterator(sinks)) {
+        allBytes += entry.file_size();
+        if (entry.path().filename().string().find(".0") != std::string::npos) {
+            closedBytes += entry.file_size();
+        }
+    }
+    EXPECT_LE(closedBytes, 600u);
+    EXPECT_GT(expired["a"], 0u);
+    // Every byte written is either on disk or counted as expired.
+    SinkLineReader reader(sinks, "a", 0);
+    std::vector<std::uint64_t> seqs;
+    while (auto line = reader.next()) {
+        seqs.push_back(line->seq);
+    }
+    ASSERT_FALSE(seqs.empty());
+    EXPECT_GT(seqs.front(), 1u) << "the oldest lines expired: a gap before the first";
+    EXPECT_EQ(seqs.back(), 30u);
+    EXPECT_EQ(seqs.size(), 30 - seqs.front() + 1) << "no gap after it";
+    std::uint64_t written = 0;
+    for (int i = 0; i < 40; ++i) {
+        // {"time":1706707501.0,"seq":N,"i":I}\n
+        written += 34 + std::to_string(i % 4 == 0 ? i / 4 + 1 : i - i / 4).size() +
+                   std::to_string(i).size();
+    }
+    EXPECT_EQ(allBytes + expired["a"] + expired["b"], written);
+}
+
+}  // namespace
+}  // namespace qv
