@@ -144,7 +144,7 @@ int fleetStatus(const Options& options);
 // Prints the stream's lines as `sinks` does, each with its device first; with follow, keeps
 // printing new ones.
 int fleetTail(const Options& options, const FleetOptions& fleet);
-// Lists the devices in the stream with their last report time and lines per sink.
+// Lists the devices in the stream with their last report time and each sink's last seq.
 int fleetDevices(const Options& options, const FleetOptions& fleet);
 
 // --- Captures (QVReportingCtlCaptures.cpp) -----------------------------------------------------

@@ -63,25 +63,66 @@ class Stream {
     jsCtx* js() const { return js_; }
     const std::string& name() const { return name_; }
 
-    // The stream's subjects matching filter, with their message counts.
-    std::map<std::string, std::uint64_t> subjects(const std::string& filter) const {
-        jsOptions options;
-        jsOptions_Init(&options);
-        options.Stream.Info.SubjectsFilter = filter.c_str();
+    // Messages in the stream.
+    std::uint64_t messages() const {
         jsStreamInfo* info = nullptr;
         jsErrCode code = static_cast<jsErrCode>(0);
-        if (const natsStatus s = js_GetStreamInfo(&info, js_, name_.c_str(), &options, &code);
+        if (const natsStatus s = js_GetStreamInfo(&info, js_, name_.c_str(), nullptr, &code);
             s != NATS_OK) {
             throw Failure{"stream " + name_ + ": " + QVReportingExportNatsError(s)};
         }
-        std::map<std::string, std::uint64_t> out;
-        if (const auto* list = info->State.Subjects) {
-            for (int i = 0; i < list->Count; ++i) {
-                out[list->List[i].Subject] = list->List[i].Msgs;
+        const auto count = info->State.Msgs;
+        jsStreamInfo_Destroy(info);
+        return count;
+    }
+
+    // Hands each message of the subjects matching filter to onMessage, in stream order, from
+    // where policy says: until none is left, or for as long as the process runs with follow.
+    template <typename OnMessage>
+    void read(const std::string& filter, jsDeliverPolicy policy, bool follow,
+              OnMessage&& onMessage) const {
+        if (!follow && messages() == 0) {
+            return;
+        }
+        jsSubOptions sub;
+        jsSubOptions_Init(&sub);
+        sub.Stream = name_.c_str();
+        sub.Config.DeliverPolicy = policy;
+        sub.Ordered = true;  // no acknowledgements; the library starts it again after a gap
+        natsSubscription* subscription = nullptr;
+        jsErrCode code = static_cast<jsErrCode>(0);
+        if (const natsStatus s =
+                js_SubscribeSync(&subscription, js_, filter.c_str(), nullptr, &sub, &code);
+            s != NATS_OK) {
+            throw Failure{"cannot read " + name_ + ": " + QVReportingExportNatsError(s)};
+        }
+        std::unique_ptr<natsSubscription, void (*)(natsSubscription*)> owner(
+            subscription, natsSubscription_Destroy);
+        for (;;) {
+            natsMsg* msg = nullptr;
+            const natsStatus s = natsSubscription_NextMsg(&msg, subscription, kQuietMs);
+            if (s == NATS_TIMEOUT) {
+                std::cout.flush();
+                if (follow) {
+                    continue;
+                }
+                return;  // nothing matches the filter, or nothing more came
+            }
+            if (s != NATS_OK) {
+                throw Failure{"reading " + name_ + ": " + QVReportingExportNatsError(s)};
+            }
+            onMessage(msg);
+            jsMsgMetaData* meta = nullptr;
+            const bool last = natsMsg_GetMetaData(&meta, msg) == NATS_OK && meta->NumPending == 0;
+            jsMsgMetaData_Destroy(meta);
+            natsMsg_Destroy(msg);
+            if (last) {
+                std::cout.flush();
+                if (!follow) {
+                    return;
+                }
             }
         }
-        jsStreamInfo_Destroy(info);
-        return out;
     }
 
   private:
@@ -181,91 +222,49 @@ int fleetTail(const Options& options, const FleetOptions& fleet) {
     if (!fleet.sink.empty() && !qv::client::QVReportingCtlIsSinkName(fleet.sink)) {
         throw UsageError{"not a sink name: " + fleet.sink};
     }
-    Stream stream(fleet);
-    const std::string filter = filterFor(fleet);
-    if (!fleet.follow && stream.subjects(filter).empty()) {
-        return 0;
-    }
-    jsSubOptions sub;
-    jsSubOptions_Init(&sub);
-    sub.Stream = stream.name().c_str();
-    sub.Ordered = true;  // in stream order, no acknowledgements, restarted by the library on gaps
-    natsSubscription* subscription = nullptr;
-    jsErrCode code = static_cast<jsErrCode>(0);
-    if (const natsStatus s =
-            js_SubscribeSync(&subscription, stream.js(), filter.c_str(), nullptr, &sub, &code);
-        s != NATS_OK) {
-        throw Failure{"cannot read " + stream.name() + ": " + QVReportingExportNatsError(s)};
-    }
-    std::unique_ptr<natsSubscription, void (*)(natsSubscription*)> owner(subscription,
-                                                                         natsSubscription_Destroy);
-    for (;;) {
-        natsMsg* msg = nullptr;
-        const natsStatus s = natsSubscription_NextMsg(&msg, subscription, kQuietMs);
-        if (s == NATS_TIMEOUT) {
-            std::cout.flush();
-            if (fleet.follow) {
-                continue;
-            }
-            return 0;  // nothing more came, though the stream said there was something
-        }
-        if (s != NATS_OK) {
-            throw Failure{"reading " + stream.name() + ": " + QVReportingExportNatsError(s)};
-        }
-        printLine(options, msg);
-        jsMsgMetaData* meta = nullptr;
-        const bool last = natsMsg_GetMetaData(&meta, msg) == NATS_OK && meta->NumPending == 0;
-        jsMsgMetaData_Destroy(meta);
-        natsMsg_Destroy(msg);
-        if (last) {
-            std::cout.flush();
-            if (!fleet.follow) {
-                return 0;
-            }
-        }
-    }
+    Stream(fleet).read(filterFor(fleet), js_DeliverAll, fleet.follow,
+                       [&](natsMsg* msg) { printLine(options, msg); });
+    return 0;
 }
 
 int fleetDevices(const Options& options, const FleetOptions& fleet) {
-    Stream stream(fleet);
     struct Device {
         double lastReport = 0;
-        std::map<std::string, std::uint64_t> sinks;
+        std::map<std::string, std::uint64_t> lastSeqs;  // per sink
     };
     std::map<std::string, Device> devices;
-    for (const auto& [subject, count] : stream.subjects("qvreporting.*.*")) {
+    // The last line of each device's sinks says when it last reported and how far each got.
+    Stream(fleet).read("qvreporting.*.*", js_DeliverLastPerSubject, false, [&](natsMsg* msg) {
         std::string device, sink;
-        if (!splitSubject(subject, device, sink)) {
-            continue;
+        if (!splitSubject(natsMsg_GetSubject(msg), device, sink)) {
+            return;
         }
         auto& seen = devices[device];
-        seen.sinks[sink] = count;
-        // The last line of each of its sinks says when the device last reported.
-        natsMsg* msg = nullptr;
-        jsErrCode code = static_cast<jsErrCode>(0);
-        if (js_GetLastMsg(&msg, stream.js(), stream.name().c_str(), subject.c_str(), nullptr,
-                          &code) == NATS_OK) {
-            const Json line =
-                Json::parse(std::string_view(natsMsg_GetData(msg),
-                                             static_cast<std::size_t>(natsMsg_GetDataLength(msg))),
-                            nullptr, false);
-            if (line.is_object() && line.contains("time") && line["time"].is_number()) {
-                seen.lastReport = std::max(seen.lastReport, line["time"].get<double>());
-            }
-            natsMsg_Destroy(msg);
+        const Json line =
+            Json::parse(std::string_view(natsMsg_GetData(msg),
+                                         static_cast<std::size_t>(natsMsg_GetDataLength(msg))),
+                        nullptr, false);
+        if (!line.is_object()) {
+            return;
         }
-    }
+        if (line.contains("time") && line["time"].is_number()) {
+            seen.lastReport = std::max(seen.lastReport, line["time"].get<double>());
+        }
+        seen.lastSeqs[sink] = line.contains("seq") && line["seq"].is_number_unsigned()
+                                  ? line["seq"].get<std::uint64_t>()
+                                  : 0;
+    });
     for (const auto& [device, seen] : devices) {
         if (options.json) {
-            emit({{"device", device}, {"last_report", seen.lastReport}, {"sinks", seen.sinks}});
+            emit({{"device", device}, {"last_report", seen.lastReport}, {"sinks", seen.lastSeqs}});
             continue;
         }
         std::string sinks;
-        for (const auto& [sink, count] : seen.sinks) {
-            sinks += fmt::format("{}{} {}", sinks.empty() ? "" : ", ", sink, count);
+        for (const auto& [sink, seq] : seen.lastSeqs) {
+            sinks += fmt::format("{}{} {}", sinks.empty() ? "" : ", ", sink, seq);
         }
         std::cout << device << "  last report "
-                  << qv::client::QVReportingCtlFormatUTC(seen.lastReport) << "  lines: " << sinks
+                  << qv::client::QVReportingCtlFormatUTC(seen.lastReport) << "  last seq: " << sinks
                   << '\n';
     }
     return 0;
