@@ -16,6 +16,33 @@ EXPORTER = os.environ.get("QVREPORT_EXPORT", "qvreport-export")
 CTL = os.environ.get("QVREPORTCTL", "qvreportctl")
 
 
+def nkey_pair():
+    """A user's nkey (public key, seed) as the NATS tools write them: the ed25519 key with its
+    prefix byte and CRC-16 (XMODEM, little end first), in base32 without padding."""
+    import base64
+    from cryptography.hazmat.primitives import serialization
+    from cryptography.hazmat.primitives.asymmetric.ed25519 import Ed25519PrivateKey
+
+    def crc16(data):
+        crc = 0
+        for byte in data:
+            crc ^= byte << 8
+            for _ in range(8):
+                crc = ((crc << 1) ^ 0x1021 if crc & 0x8000 else crc << 1) & 0xFFFF
+        return crc
+
+    def encode(raw):
+        crc = crc16(raw)
+        return base64.b32encode(raw + bytes([crc & 0xFF, crc >> 8])).decode().rstrip("=")
+
+    seed = os.urandom(32)
+    public = Ed25519PrivateKey.from_private_bytes(seed).public_key().public_bytes(
+        serialization.Encoding.Raw, serialization.PublicFormat.Raw)
+    user, seed_prefix = 20 << 3, 18 << 3
+    return (encode(bytes([user]) + public),
+            encode(bytes([seed_prefix | user >> 5, (user & 31) << 3]) + seed))
+
+
 def free_port():
     with socket.socket() as s:
         s.bind(("127.0.0.1", 0))

@@ -8,11 +8,12 @@ import json
 import os
 import shutil
 import signal
+import subprocess
 import tempfile
 import unittest
 
 from harness import wait_until
-from nats_harness import (CTL, Exporter, NatsServer, SinkFiles, StreamComparison, ctl,
+from nats_harness import (CTL, Exporter, NatsServer, SinkFiles, StreamComparison, ctl, nkey_pair,
                           stream_lines)
 
 # The exporter's application ID (export/QVReportingExportDevice.cpp).
@@ -168,6 +169,73 @@ class Everyday(ExportTestCase):
         self.assertEqual((counters["expired"], counters["sent"]), (160, 110))
         self.assertIn("160 lines expired before they were sent (seq 41 to 200)", exporter.log())
         StreamComparison(self.server.url, self.state, ["analytics"]).check(self)
+
+
+class Security(unittest.TestCase):
+    """TLS through the URL and an nkey file, against a server that requires both."""
+
+    def setUp(self):
+        self.workdir = tempfile.mkdtemp(prefix="qvexport-tls-")
+        cert, key = (os.path.join(self.workdir, n) for n in ("cert.pem", "key.pem"))
+        subprocess.run(["openssl", "req", "-x509", "-newkey", "ec", "-pkeyopt",
+                        "ec_paramgen_curve:prime256v1", "-nodes", "-keyout", key, "-out", cert,
+                        "-days", "1", "-subj", "/CN=127.0.0.1",
+                        "-addext", "subjectAltName=IP:127.0.0.1"],
+                       check=True, capture_output=True)
+        self.cert = cert
+        public, seed = nkey_pair()
+        self.nkey = os.path.join(self.workdir, "user.nk")
+        with open(self.nkey, "w") as f:
+            f.write(f"{public}\n{seed}\n")
+        stranger_public, stranger_seed = nkey_pair()
+        self.stranger = os.path.join(self.workdir, "stranger.nk")
+        with open(self.stranger, "w") as f:
+            f.write(f"{stranger_public}\n{stranger_seed}\n")
+        self.server = NatsServer(
+            self.workdir, "secure",
+            extra_config=(f'tls {{ cert_file: "{cert}", key_file: "{key}" }}\n'
+                          f"authorization {{ users = [ {{ nkey: {public} }} ] }}\n"))
+        self.server.start()
+        self.url = f"tls://127.0.0.1:{self.server.port}"
+        self.exporters = []
+
+    def tearDown(self):
+        for exporter in self.exporters:
+            exporter.stop(signal.SIGKILL)
+        self.server.stop()
+        shutil.rmtree(self.workdir, ignore_errors=True)
+
+    def test_tls_and_nkey(self):
+        state = os.path.join(self.workdir, "state")
+        SinkFiles(state, "analytics").append(20)
+        exporter = Exporter(self.workdir, state, self.url, "--tls-ca", self.cert, "--nkey",
+                            self.nkey)
+        self.exporters.append(exporter)
+        exporter.start().wait_caught_up({"analytics": 20})
+        secure = ("--tls-ca", self.cert, "--nkey", self.nkey)
+        lines = stream_lines(self.url, *secure)
+        self.assertEqual([seq for _, lines in lines.items() for seq, _ in lines], list(range(1, 21)))
+
+        # Without the key, without TLS, with a key the server does not know: refused.
+        for args in ((self.url, "--tls-ca", self.cert),
+                     (f"nats://127.0.0.1:{self.server.port}", "--nkey", self.nkey),
+                     (self.url, "--tls-ca", self.cert, "--nkey", self.stranger)):
+            done = subprocess.run([CTL, "fleet", "tail", "--nats-url", *args],
+                                  capture_output=True, text=True, timeout=60)
+            self.assertEqual(done.returncode, 1, args)
+            self.assertIn("cannot connect", done.stderr)
+        stranger_state = os.path.join(self.workdir, "stranger-state")
+        SinkFiles(stranger_state, "analytics").append(5)
+        stranger = Exporter(self.workdir, stranger_state, self.url, "--tls-ca", self.cert,
+                            "--nkey", self.stranger, name="stranger")
+        self.exporters.append(stranger)
+        stranger.start()
+        # Three seconds of trying (the right key connects within a few milliseconds).
+        wait_until(lambda: (stranger.status() or {}).get("updated", 0) -
+                   stranger.status()["started"] >= 3, timeout=60, what="the stranger's status")
+        self.assertFalse(stranger.status()["connected"])
+        self.assertEqual(stranger.cursor(), {})
+        self.assertEqual(self.server.stream_messages("QVREPORTING"), 20)
 
 
 class KillMidBatch(ExportTestCase):
