@@ -231,9 +231,10 @@ class Security(unittest.TestCase):
         self.exporters.append(stranger)
         stranger.start()
         # Three seconds of trying (the right key connects within a few milliseconds).
-        wait_until(lambda: (stranger.status() or {}).get("updated", 0) -
-                   stranger.status()["started"] >= 3, timeout=60, what="the stranger's status")
-        self.assertFalse(stranger.status()["connected"])
+        def tried_long_enough():
+            status = stranger.status()
+            return status if status and status["updated"] - status["started"] >= 3 else None
+        self.assertFalse(wait_until(tried_long_enough, timeout=60, what="three seconds")["connected"])
         self.assertEqual(stranger.cursor(), {})
         self.assertEqual(self.server.stream_messages("QVREPORTING"), 20)
 
