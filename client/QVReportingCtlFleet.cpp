@@ -18,8 +18,10 @@ namespace {
 
 using qv::exporter::QVReportingExportNatsError;
 
-// How long an empty or quiet stream is waited on before `tail` without --follow ends.
+// How long `tail` without --follow waits for a first line (none may match), and for the next
+// one while the server says more are pending.
 constexpr int kQuietMs = 2000;
+constexpr int kStalledMs = 30000;
 // JetStream requests (stream information, making the reading consumer): a cluster that has just
 // lost a node answers slowly.
 constexpr int kRequestWaitMs = 20000;
@@ -29,45 +31,39 @@ constexpr double kStaleStatusSeconds = 10;
 // Holds a connection and its JetStream context for one command.
 class Stream {
   public:
-    explicit Stream(const FleetOptions& fleet) {
+    explicit Stream(const FleetOptions& fleet) : name_(fleet.stream) {
         qv::exporter::QVReportingExportServerSettings settings;
         settings.urls = fleet.urls;
         settings.credsFile = fleet.creds;
         settings.nkeyFile = fleet.nkey;
         settings.tlsCAFile = fleet.tlsCA;
         std::string error;
-        options_ = qv::exporter::QVReportingExportNatsOptions(settings, "qvreportctl", error);
+        options_.reset(qv::exporter::QVReportingExportNatsOptions(settings, "qvreportctl", error));
         if (!options_) {
             throw UsageError{error};
         }
-        if (const natsStatus s = natsConnection_Connect(&connection_, options_); s != NATS_OK) {
+        natsConnection* connection = nullptr;
+        if (const natsStatus s = natsConnection_Connect(&connection, options_.get());
+            s != NATS_OK) {
             throw Failure{"cannot connect to " + fleet.urls + ": " + QVReportingExportNatsError(s)};
         }
+        connection_.reset(connection);
         jsOptions options;
         jsOptions_Init(&options);
         options.Wait = kRequestWaitMs;
-        if (const natsStatus s = natsConnection_JetStream(&js_, connection_, &options);
+        jsCtx* js = nullptr;
+        if (const natsStatus s = natsConnection_JetStream(&js, connection, &options);
             s != NATS_OK) {
             throw Failure{"JetStream: " + QVReportingExportNatsError(s)};
         }
-        name_ = fleet.stream;
+        js_.reset(js);
     }
-    ~Stream() {
-        jsCtx_Destroy(js_);
-        natsConnection_Destroy(connection_);
-        natsOptions_Destroy(options_);
-    }
-    Stream(const Stream&) = delete;
-    Stream& operator=(const Stream&) = delete;
-
-    jsCtx* js() const { return js_; }
-    const std::string& name() const { return name_; }
 
     // Messages in the stream.
     std::uint64_t messages() const {
         jsStreamInfo* info = nullptr;
         jsErrCode code = static_cast<jsErrCode>(0);
-        if (const natsStatus s = js_GetStreamInfo(&info, js_, name_.c_str(), nullptr, &code);
+        if (const natsStatus s = js_GetStreamInfo(&info, js_.get(), name_.c_str(), nullptr, &code);
             s != NATS_OK) {
             throw Failure{"stream " + name_ + ": " + QVReportingExportNatsError(s)};
         }
@@ -76,12 +72,37 @@ class Stream {
         return count;
     }
 
+    // The subjects matching filter with their message counts, as the stream's leader has them.
+    std::map<std::string, std::uint64_t> subjects(const std::string& filter) const {
+        jsOptions options;
+        jsOptions_Init(&options);
+        options.Wait = kRequestWaitMs;
+        options.Stream.Info.SubjectsFilter = filter.c_str();
+        jsStreamInfo* info = nullptr;
+        jsErrCode code = static_cast<jsErrCode>(0);
+        if (const natsStatus s = js_GetStreamInfo(&info, js_.get(), name_.c_str(), &options, &code);
+            s != NATS_OK) {
+            throw Failure{"stream " + name_ + ": " + QVReportingExportNatsError(s)};
+        }
+        std::map<std::string, std::uint64_t> out;
+        if (const auto* list = info->State.Subjects) {
+            for (int i = 0; i < list->Count; ++i) {
+                out[list->List[i].Subject] = list->List[i].Msgs;
+            }
+        }
+        jsStreamInfo_Destroy(info);
+        return out;
+    }
+
     // Hands each message of the subjects matching filter to onMessage, in stream order, from
-    // where policy says: until none is left, or for as long as the process runs with follow.
+    // where policy says: for as long as the process runs with follow, else until expected
+    // messages came and the server says none is left. The reading consumer may sit on a replica
+    // still catching up, which counts none left before it has them all: expected (what the
+    // leader holds; 0 when not known) is waited for.
     template <typename OnMessage>
     void read(const std::string& filter, jsDeliverPolicy policy, bool follow,
-              OnMessage&& onMessage) const {
-        if (!follow && messages() == 0) {
+              std::uint64_t expected, OnMessage&& onMessage) const {
+        if (!follow && expected == 0 && messages() == 0) {
             return;
         }
         jsSubOptions sub;
@@ -92,33 +113,46 @@ class Stream {
         natsSubscription* subscription = nullptr;
         jsErrCode code = static_cast<jsErrCode>(0);
         if (const natsStatus s =
-                js_SubscribeSync(&subscription, js_, filter.c_str(), nullptr, &sub, &code);
+                js_SubscribeSync(&subscription, js_.get(), filter.c_str(), nullptr, &sub, &code);
             s != NATS_OK) {
             throw Failure{"cannot read " + name_ + ": " + QVReportingExportNatsError(s)};
         }
         std::unique_ptr<natsSubscription, void (*)(natsSubscription*)> owner(
             subscription, natsSubscription_Destroy);
+        std::uint64_t pending = 0;  // after the last message, as the server counted
+        std::uint64_t delivered = 0;
         for (;;) {
             natsMsg* msg = nullptr;
-            const natsStatus s = natsSubscription_NextMsg(&msg, subscription, kQuietMs);
+            // A pause with lines still to come is a consumer being made again or a replica
+            // catching up (a cluster that lost a node), and is waited out.
+            const bool more = pending > 0 || delivered < expected;
+            const int wait = more ? kStalledMs : kQuietMs;
+            const natsStatus s = natsSubscription_NextMsg(&msg, subscription, wait);
             if (s == NATS_TIMEOUT) {
                 std::cout.flush();
                 if (follow) {
                     continue;
                 }
-                return;  // nothing matches the filter, or nothing more came
+                if (more) {
+                    throw Failure{fmt::format("reading {} stalled after {} of {} lines", name_,
+                                              delivered, expected)};
+                }
+                return;
             }
             if (s != NATS_OK) {
                 throw Failure{"reading " + name_ + ": " + QVReportingExportNatsError(s)};
             }
             onMessage(msg);
+            ++delivered;
             jsMsgMetaData* meta = nullptr;
-            const bool last = natsMsg_GetMetaData(&meta, msg) == NATS_OK && meta->NumPending == 0;
+            if (natsMsg_GetMetaData(&meta, msg) == NATS_OK) {
+                pending = meta->NumPending;
+            }
             jsMsgMetaData_Destroy(meta);
             natsMsg_Destroy(msg);
-            if (last) {
+            if (pending == 0) {
                 std::cout.flush();
-                if (!follow) {
+                if (!follow && delivered >= expected) {
                     return;
                 }
             }
@@ -126,9 +160,11 @@ class Stream {
     }
 
   private:
-    natsOptions* options_ = nullptr;
-    natsConnection* connection_ = nullptr;
-    jsCtx* js_ = nullptr;
+    // Destroyed in reverse: the context, the connection, then its options.
+    std::unique_ptr<natsOptions, void (*)(natsOptions*)> options_{nullptr, natsOptions_Destroy};
+    std::unique_ptr<natsConnection, void (*)(natsConnection*)> connection_{nullptr,
+                                                                           natsConnection_Destroy};
+    std::unique_ptr<jsCtx, void (*)(jsCtx*)> js_{nullptr, jsCtx_Destroy};
     std::string name_;
 };
 
@@ -222,8 +258,16 @@ int fleetTail(const Options& options, const FleetOptions& fleet) {
     if (!fleet.sink.empty() && !qv::client::QVReportingCtlIsSinkName(fleet.sink)) {
         throw UsageError{"not a sink name: " + fleet.sink};
     }
-    Stream(fleet).read(filterFor(fleet), js_DeliverAll, fleet.follow,
-                       [&](natsMsg* msg) { printLine(options, msg); });
+    const Stream stream(fleet);
+    const std::string filter = filterFor(fleet);
+    std::uint64_t expected = 0;
+    if (!fleet.follow) {
+        for (const auto& [subject, count] : stream.subjects(filter)) {
+            expected += count;
+        }
+    }
+    stream.read(filter, js_DeliverAll, fleet.follow, expected,
+                [&](natsMsg* msg) { printLine(options, msg); });
     return 0;
 }
 
@@ -234,26 +278,29 @@ int fleetDevices(const Options& options, const FleetOptions& fleet) {
     };
     std::map<std::string, Device> devices;
     // The last line of each device's sinks says when it last reported and how far each got.
-    Stream(fleet).read("qvreporting.*.*", js_DeliverLastPerSubject, false, [&](natsMsg* msg) {
-        std::string device, sink;
-        if (!splitSubject(natsMsg_GetSubject(msg), device, sink)) {
-            return;
-        }
-        auto& seen = devices[device];
-        const Json line =
-            Json::parse(std::string_view(natsMsg_GetData(msg),
-                                         static_cast<std::size_t>(natsMsg_GetDataLength(msg))),
-                        nullptr, false);
-        if (!line.is_object()) {
-            return;
-        }
-        if (line.contains("time") && line["time"].is_number()) {
-            seen.lastReport = std::max(seen.lastReport, line["time"].get<double>());
-        }
-        seen.lastSeqs[sink] = line.contains("seq") && line["seq"].is_number_unsigned()
-                                  ? line["seq"].get<std::uint64_t>()
-                                  : 0;
-    });
+    const Stream stream(fleet);
+    const std::string filter = "qvreporting.*.*";
+    stream.read(
+        filter, js_DeliverLastPerSubject, false, stream.subjects(filter).size(), [&](natsMsg* msg) {
+            std::string device, sink;
+            if (!splitSubject(natsMsg_GetSubject(msg), device, sink)) {
+                return;
+            }
+            auto& seen = devices[device];
+            const Json line =
+                Json::parse(std::string_view(natsMsg_GetData(msg),
+                                             static_cast<std::size_t>(natsMsg_GetDataLength(msg))),
+                            nullptr, false);
+            if (!line.is_object()) {
+                return;
+            }
+            if (line.contains("time") && line["time"].is_number()) {
+                seen.lastReport = std::max(seen.lastReport, line["time"].get<double>());
+            }
+            seen.lastSeqs[sink] = line.contains("seq") && line["seq"].is_number_unsigned()
+                                      ? line["seq"].get<std::uint64_t>()
+                                      : 0;
+        });
     for (const auto& [device, seen] : devices) {
         if (options.json) {
             emit({{"device", device}, {"last_report", seen.lastReport}, {"sinks", seen.lastSeqs}});

@@ -252,6 +252,10 @@ class Exporter:
             self.proc.wait(timeout=30)
         code = self.proc.returncode if self.proc else None
         self.proc = None
+        # Under the sanitizer presets a report fails the test that caused it.
+        log = self.log() if os.path.exists(self.log_path) else ""
+        if "Sanitizer" in log or "runtime error:" in log:
+            raise AssertionError(f"sanitizer report from qvreport-export:\n{log}")
         return code
 
     def log(self):
