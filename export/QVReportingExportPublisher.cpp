@@ -15,6 +15,7 @@ constexpr const char* kMessageIDHeader = "Nats-Msg-Id";
 // Reconnect back-off: doubling from the first delay up to the last, as long as it takes.
 constexpr std::int64_t kFirstReconnectDelayMs = 100;
 constexpr std::int64_t kLongestReconnectDelayMs = 2000;
+constexpr std::int64_t kCloseWaitMs = 5000;
 
 std::int64_t reconnectDelay(natsConnection*, int attempts, void*) {
     const int doublings = std::clamp(attempts - 1, 0, 16);
@@ -108,6 +109,9 @@ QVReportingExportPublisher::~QVReportingExportPublisher() {
         natsConnection_Close(nats_->connection);
     }
     nats_.reset();
+    // The library calls back from its own threads (the connection's last "disconnected" among
+    // them) after the close returns; they are waited for while the callbacks still exist.
+    nats_CloseAndWait(kCloseWaitMs);
 }
 
 std::string QVReportingExportPublisher::start() {

@@ -10,7 +10,8 @@
 // and abandons what is pending.
 //
 // Thread safety: start(), ensureStream(), publish(), abandonPending() and drain() are called from
-// one thread. The callbacks run on the library's threads, never inside publish().
+// one thread. The callbacks run on the library's threads, never inside publish(), and never after
+// the destructor, which closes the library and waits for its threads: one publisher per process.
 #pragma once
 
 #include <chrono>
