@@ -125,6 +125,28 @@ class DefaultsCommands {
 // Prints one sink, or every sink merged by time; with follow, keeps printing new lines.
 int printSinks(const Options& options, const std::string& sink, bool follow);
 
+// --- Fleet (QVReportingCtlFleet.cpp, built with the exporter) ----------------------------------
+
+// Where the stream is: the exporter's options of the same names.
+struct FleetOptions {
+    std::string urls = "nats://127.0.0.1:4222";
+    std::string creds;
+    std::string nkey;
+    std::string tlsCA;
+    std::string stream = "QVREPORTING";
+    std::string device;  // one device, or every one
+    std::string sink;    // one sink, or every one
+    bool follow = false;
+};
+
+// Prints the exporter's counters from export/status.json in the state directory.
+int fleetStatus(const Options& options);
+// Prints the stream's lines as `sinks` does, each with its device first; with follow, keeps
+// printing new ones.
+int fleetTail(const Options& options, const FleetOptions& fleet);
+// Lists the devices in the stream with their last report time and each sink's last seq.
+int fleetDevices(const Options& options, const FleetOptions& fleet);
+
 // --- Captures (QVReportingCtlCaptures.cpp) -----------------------------------------------------
 
 // Lists the issue captures of the state directory with their manifests, oldest first.

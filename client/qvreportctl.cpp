@@ -142,6 +142,34 @@ int run(int argc, char** argv) {
     c->add_flag("-f,--follow", follow, "Keep printing lines as they are appended");
     c->callback([&] { action = [&] { return printSinks(options, sink, follow); }; });
 
+#ifdef QV_WITH_FLEET
+    FleetOptions fleet;
+    auto* fleetGroup =
+        app.add_subcommand("fleet", "The exporter's counters, and the NATS stream it fills");
+    fleetGroup->require_subcommand(1);
+    const auto addServerOptions = [&](CLI::App* command) {
+        command->add_option("--nats-url", fleet.urls, "Servers, comma-separated (tls:// for TLS)")
+            ->capture_default_str();
+        command->add_option("--creds", fleet.creds, "Credentials file");
+        command->add_option("--nkey", fleet.nkey, "NKey file (public key and seed)");
+        command->add_option("--tls-ca", fleet.tlsCA, "CA of the servers' certificates");
+        command->add_option("--stream", fleet.stream, "Stream")->capture_default_str();
+    };
+    c = fleetGroup->add_subcommand("status",
+                                   "Print qvreport-export's counters (lines sent, "
+                                   "acknowledged, retried, expired, lag per sink)");
+    c->callback([&] { action = [&] { return fleetStatus(options); }; });
+    c = fleetGroup->add_subcommand("tail", "Print the stream's lines as `sinks` does");
+    addServerOptions(c);
+    c->add_option("--device", fleet.device, "One device (32 hex digits); default: all");
+    c->add_option("--sink", fleet.sink, "One sink; default: all");
+    c->add_flag("-f,--follow", fleet.follow, "Keep printing lines as they arrive");
+    c->callback([&] { action = [&] { return fleetTail(options, fleet); }; });
+    c = fleetGroup->add_subcommand("devices", "List the devices seen with their last report");
+    addServerOptions(c);
+    c->callback([&] { action = [&] { return fleetDevices(options, fleet); }; });
+#endif
+
     c = app.add_subcommand("captures",
                            "List the issue captures (logs/Audio/Captures) with their manifests");
     c->callback([&] { action = [&] { return printCaptures(options); }; });
