@@ -9,6 +9,7 @@
 #include <set>
 
 #include <pipewire/extensions/profiler.h>
+#include <pipewire/impl-module.h>
 #include <pipewire/pipewire.h>
 #include <spa/param/param.h>
 #include <spa/utils/dict.h>
@@ -29,6 +30,8 @@ using Clock = std::chrono::steady_clock;
 constexpr std::uint64_t kSettleNanoseconds = 20'000'000;
 // Xruns of a stream are reported at most once a second each, with their count.
 constexpr auto kXrunReportInterval = std::chrono::seconds(1);
+// Profiled cycles of a stream on a new driver that are not taken for xruns.
+constexpr std::uint32_t kJoiningCycles = 4;
 
 void mergeProps(QVBridgeProps& into, const spa_dict* dict) {
     if (dict == nullptr) {
@@ -85,6 +88,8 @@ struct QVBridgeGraph::Impl {
         std::uint64_t pendingXruns = 0;
         std::uint32_t quantum = 0;
         std::string driver;
+        std::uint32_t driverID = SPA_ID_INVALID;
+        std::uint32_t cyclesOnDriver = 0;
         Clock::time_point lastXrunReport{};
     };
     struct Client {
@@ -472,6 +477,15 @@ struct QVBridgeGraph::Impl {
                 Node& node = *it->second;
                 node.quantum = cycle.quantum;
                 node.driver = cycle.driverName;
+                if (node.driverID != cycle.driverID) {
+                    node.driverID = cycle.driverID;
+                    node.cyclesOnDriver = 0;
+                }
+                // The first cycles on a new driver (a start, a move) may find the stream not yet
+                // scheduled; that is joining, not overrunning.
+                if (++node.cyclesOnDriver <= kJoiningCycles) {
+                    continue;
+                }
                 if (driverXrun || follower.status != kQVBridgeNodeFinished) {
                     ++node.pendingXruns;
                 }
@@ -506,6 +520,11 @@ QVBridgeGraph::QVBridgeGraph(QVBridgeEventQueue& queue, QVBridgeStats& stats,
     d.mainLoop = pw_main_loop_new(nullptr);
     d.loop = pw_main_loop_get_loop(d.mainLoop);
     d.context = pw_context_new(d.loop, nullptr, 0);
+    // The profiler's protocol marshalling lives in its module: without it the bind fails.
+    if (pw_context_load_module(d.context, PW_EXTENSION_MODULE_PROFILER, nullptr, nullptr) ==
+        nullptr) {
+        QVBridgeLog(QVBridgeLogLevel::kError, "no profiler module here: xruns are not reported");
+    }
     d.settleTimer = pw_loop_add_timer(d.loop, Impl::onSettled, &d);
     d.tickTimer = pw_loop_add_timer(d.loop, Impl::onTick, &d);
     d.teardownTimer = pw_loop_add_timer(d.loop, Impl::onTeardown, &d);
