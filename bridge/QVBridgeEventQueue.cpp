@@ -28,14 +28,13 @@ bool QVBridgeEventQueue::push(QVBridgeEvent event) {
                 // The sender never saw this session: forget it here instead of making it there.
                 if (opens_.erase(event.reporterID) != 0) {
                     const auto id = event.reporterID;
-                    const auto gone = std::remove_if(events_.begin(), events_.end(),
-                                                     [id](const QVBridgeEvent& e) {
-                                                         return e.reporterID == id;
-                                                     });
+                    const auto mine = [id](const QVBridgeEvent& e) { return e.reporterID == id; };
+                    // Counted before removal: remove_if leaves moved-from events behind.
                     messages_ -= static_cast<std::size_t>(
-                        std::count_if(gone, events_.end(), [](const QVBridgeEvent& e) {
-                            return e.kind == QVBridgeEvent::Kind::kMessage;
+                        std::count_if(events_.begin(), events_.end(), [&](const QVBridgeEvent& e) {
+                            return mine(e) && e.kind == QVBridgeEvent::Kind::kMessage;
                         }));
+                    const auto gone = std::remove_if(events_.begin(), events_.end(), mine);
                     events_.erase(gone, events_.end());
                     return true;
                 }
