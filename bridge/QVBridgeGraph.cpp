@@ -264,7 +264,8 @@ struct QVBridgeGraph::Impl {
             mergeProps(self->devices[id], props);
         } else if (std::strcmp(type, PW_TYPE_INTERFACE_Client) == 0) {
             self->addClient(id, props);
-        } else if (std::strcmp(type, PW_TYPE_INTERFACE_Profiler) == 0 && self->profiler == nullptr) {
+        } else if (std::strcmp(type, PW_TYPE_INTERFACE_Profiler) == 0 &&
+                   self->profiler == nullptr) {
             self->profiler = static_cast<pw_proxy*>(
                 pw_registry_bind(self->registry, id, type, PW_VERSION_PROFILER, 0));
             if (self->profiler != nullptr) {
@@ -418,10 +419,9 @@ struct QVBridgeGraph::Impl {
     // What the stream plays to (output) or records from (input): the first link's other end.
     std::string deviceOf(const Node& stream) const {
         for (const auto& [id, link] : links) {
-            const std::uint32_t peer = stream.output ? (link.outputNode == stream.id ? link.inputNode
-                                                                                    : SPA_ID_INVALID)
-                                                     : (link.inputNode == stream.id ? link.outputNode
-                                                                                    : SPA_ID_INVALID);
+            const std::uint32_t peer =
+                stream.output ? (link.outputNode == stream.id ? link.inputNode : SPA_ID_INVALID)
+                              : (link.inputNode == stream.id ? link.outputNode : SPA_ID_INVALID);
             if (peer == SPA_ID_INVALID) {
                 continue;
             }
@@ -444,8 +444,8 @@ struct QVBridgeGraph::Impl {
         s.output = node.output;
         s.role = lookup(node.props, PW_KEY_MEDIA_ROLE);
         const auto client = clients.find(lookupID(node.props, PW_KEY_CLIENT_ID));
-        s.applicationID =
-            QVBridgeApplicationID(node.props, client == clients.end() ? kNone : client->second->props);
+        s.applicationID = QVBridgeApplicationID(
+            node.props, client == clients.end() ? kNone : client->second->props);
         s.nodeName = lookup(node.props, PW_KEY_NODE_NAME);
         s.running = node.state == PW_NODE_STATE_RUNNING;
         if (node.channelVolumes) {
@@ -453,8 +453,8 @@ struct QVBridgeGraph::Impl {
         }
         s.device = deviceOf(node);
         if (node.format) {
-            s.format =
-                QVBridgeFormatText(node.format->sampleFormat, node.format->rate, node.format->channels);
+            s.format = QVBridgeFormatText(node.format->sampleFormat, node.format->rate,
+                                          node.format->channels);
             s.sampleFormat = node.format->sampleFormat;
             s.channels = node.format->channels;
         }
@@ -542,8 +542,8 @@ QVBridgeGraph::~QVBridgeGraph() {
 void QVBridgeGraph::run() {
     Impl& d = *impl_;
     if (!d.connect()) {
-        QVBridgeLog(QVBridgeLogLevel::kError, "cannot connect to PipeWire ({}); trying every second",
-                    std::strerror(errno));
+        QVBridgeLog(QVBridgeLogLevel::kError,
+                    "cannot connect to PipeWire ({}); trying every second", std::strerror(errno));
     }
     setTimer(d.loop, d.tickTimer, 1'000'000'000, true);
     pw_main_loop_run(d.mainLoop);
@@ -552,6 +552,8 @@ void QVBridgeGraph::run() {
     d.push(d.reporter.removeAll());
 }
 
-void QVBridgeGraph::quit() { pw_main_loop_quit(impl_->mainLoop); }
+void QVBridgeGraph::quit() {
+    pw_main_loop_quit(impl_->mainLoop);
+}
 
 }  // namespace qv::bridge

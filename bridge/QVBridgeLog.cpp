@@ -11,9 +11,13 @@ std::atomic<QVBridgeLogLevel> gLevel{QVBridgeLogLevel::kInfo};
 std::mutex gWriteMutex;
 }  // namespace
 
-void QVBridgeSetLogLevel(QVBridgeLogLevel level) { gLevel = level; }
+void QVBridgeSetLogLevel(QVBridgeLogLevel level) {
+    gLevel = level;
+}
 
-bool QVBridgeLogEnabled(QVBridgeLogLevel level) { return level >= gLevel.load(); }
+bool QVBridgeLogEnabled(QVBridgeLogLevel level) {
+    return level >= gLevel.load();
+}
 
 void QVBridgeLogWrite(QVBridgeLogLevel level, std::string_view line) {
     const char* tag = level == QVBridgeLogLevel::kError  ? "error"

@@ -93,7 +93,8 @@ std::string QVBridgeDeviceKind(const QVBridgeProps& node, const QVBridgeProps& d
         }
         return "BluetoothA2DP";
     }
-    if (lower(lookup(device, "device.bus")) == "usb" || lower(lookup(node, "device.bus")) == "usb") {
+    if (lower(lookup(device, "device.bus")) == "usb" ||
+        lower(lookup(node, "device.bus")) == "usb") {
         return "USB";
     }
     // What the port and the descriptions say, most specific first.

@@ -104,8 +104,7 @@ std::vector<QVBridgeProfilerCycle> QVBridgeParseProfile(const spa_pod* pod) {
                                              SPA_POD_String(&name), SPA_POD_Long(&nsec),
                                              SPA_POD_Fraction(&rate), SPA_POD_Long(&position),
                                              SPA_POD_Long(&duration), SPA_POD_Long(&delay),
-                                             SPA_POD_Double(&rateDiff),
-                                             SPA_POD_Long(&next)) >= 0) {
+                                             SPA_POD_Double(&rateDiff), SPA_POD_Long(&next)) >= 0) {
                         cycle.quantum = static_cast<std::uint32_t>(duration);
                     }
                     break;

@@ -34,7 +34,9 @@ QVBridgeSender::~QVBridgeSender() {
     join();
 }
 
-void QVBridgeSender::start() { thread_ = std::thread([this] { run(); }); }
+void QVBridgeSender::start() {
+    thread_ = std::thread([this] { run(); });
+}
 
 void QVBridgeSender::join() {
     if (thread_.joinable()) {
@@ -100,6 +102,12 @@ void QVBridgeSender::checkDaemon(bool force) {
         return;
     }
     if (owner == owner_) {
+        // Sessions whose making failed halfway get another try.
+        for (auto& [id, s] : sessions_) {
+            if (!s.made) {
+                makeSession(id, s);
+            }
+        }
         return;
     }
     const bool restart = everMet_;
@@ -117,8 +125,8 @@ void QVBridgeSender::checkDaemon(bool force) {
                     "the reporting daemon restarted ({}): re-created {} sessions", owner,
                     sessions_.size());
     } else {
-        QVBridgeLog(QVBridgeLogLevel::kInfo, "reporting to the daemon at {} on the bus '{}'",
-                    owner, options_.bus);
+        QVBridgeLog(QVBridgeLogLevel::kInfo, "reporting to the daemon at {} on the bus '{}'", owner,
+                    options_.bus);
     }
 }
 
@@ -162,9 +170,8 @@ void QVBridgeSender::makeSession(std::int64_t reporterID, Session& s) {
     }
 }
 
-void QVBridgeSender::sendMessage(const Session& s, std::int64_t reporterID,
-                                 std::uint32_t category, std::uint16_t type,
-                                 const QVBridgePayload& payload) {
+void QVBridgeSender::sendMessage(const Session& s, std::int64_t reporterID, std::uint32_t category,
+                                 std::uint16_t type, const QVBridgePayload& payload) {
     if (!present() || !s.made) {
         stats_.noteMessageUndelivered();
         return;

@@ -71,7 +71,7 @@ class QVBridgeSender {
 
     // Everything below belongs to thread_.
     std::unique_ptr<client::QVReportingClient> client_;
-    std::string owner_;    // the daemon our sessions were made in; empty: none now
+    std::string owner_;     // the daemon our sessions were made in; empty: none now
     bool everMet_ = false;  // a daemon was met once: a new one is a restart
     bool failing_ = false;
     bool absenceLogged_ = false;

@@ -7,8 +7,8 @@
 #include <cstdio>
 #include <string>
 
-#include <CLI/CLI.hpp>
 #include <pipewire/pipewire.h>
+#include <CLI/CLI.hpp>
 
 #include "QVBridgeEventQueue.h"
 #include "QVBridgeGraph.h"

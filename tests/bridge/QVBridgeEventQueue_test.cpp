@@ -54,8 +54,8 @@ TEST(QVBridgeEventQueue, AStreamGoneBeforeTheSenderSawItLeavesNothingBehind) {
     q.push(event(Kind::kMessage, 2));
     q.push(event(Kind::kClose, 1));
     EXPECT_EQ(q.messages(), 1u);
-    EXPECT_EQ(drain(q), (std::vector<std::pair<Kind, std::int64_t>>{{Kind::kOpen, 2},
-                                                                     {Kind::kMessage, 2}}));
+    EXPECT_EQ(drain(q),
+              (std::vector<std::pair<Kind, std::int64_t>>{{Kind::kOpen, 2}, {Kind::kMessage, 2}}));
     // Once the sender took the open, the close must reach it.
     q.push(event(Kind::kClose, 2));
     EXPECT_EQ(drain(q), (std::vector<std::pair<Kind, std::int64_t>>{{Kind::kClose, 2}}));

@@ -7,10 +7,20 @@ namespace {
 
 TEST(QVBridgeMapping, ServiceTypeFollowsTheMediaRole) {
     const std::pair<const char*, std::uint16_t> table[] = {
-        {"Music", 7},         {"Movie", 7},   {"Communication", 2}, {"Phone", 2},
-        {"Notification", 13}, {"Event", 13},  {"Alarm", 4},         {"Game", 8},
-        {"Assistant", 1},     {"Accessibility", 1}, {"", 0},        {"Production", 0},
-        {"music", 7},         {"Musics", 0},
+        {"Music", 7},
+        {"Movie", 7},
+        {"Communication", 2},
+        {"Phone", 2},
+        {"Notification", 13},
+        {"Event", 13},
+        {"Alarm", 4},
+        {"Game", 8},
+        {"Assistant", 1},
+        {"Accessibility", 1},
+        {"", 0},
+        {"Production", 0},
+        {"music", 7},
+        {"Musics", 0},
     };
     for (const auto& [role, expected] : table) {
         EXPECT_EQ(QVBridgeServiceTypeForRole(role), expected) << role;
@@ -61,15 +71,16 @@ TEST(QVBridgeMapping, DeviceKindFromProfileBusPortAndDescription) {
     };
     const Case table[] = {
         {{{"api.bluez5.profile", "a2dp-sink"}}, {{"device.api", "bluez5"}}, "BluetoothA2DP"},
-        {{{"api.bluez5.profile", "headset-head-unit"}}, {{"device.api", "bluez5"}},
-         "BluetoothHFP"},
+        {{{"api.bluez5.profile", "headset-head-unit"}}, {{"device.api", "bluez5"}}, "BluetoothHFP"},
         {{{"node.description", "Speakers"}}, {{"device.bus", "usb"}}, "USB"},
         {{{"node.description", "HDA Intel PCH HDMI 0"}}, {}, "HDMI"},
         {{{"node.description", "Built-in Speakers"}}, {}, "Speaker"},
         {{{"node.description", "Wired Headphones"}}, {}, "Headphones"},
-        {{{"node.description", "Analog Output"}}, {{"device.form-factor", "headset"}},
+        {{{"node.description", "Analog Output"}},
+         {{"device.form-factor", "headset"}},
          "Headphones"},
-        {{{"node.description", "Line Out"}}, {{"device.description", "Built-in Audio"}},
+        {{{"node.description", "Line Out"}},
+         {{"device.description", "Built-in Audio"}},
          "Built-in Audio"},
         {{{"node.description", "Null Microphone"}}, {}, "Null Microphone"},
         {{}, {}, "unknown"},

@@ -60,19 +60,18 @@ TEST(QVBridgePods, ProfileCyclesWithTheirDriverAndFollowers) {
                                SPA_POD_Float(0.1f), SPA_POD_Int(3));
     spa_pod_builder_prop(&b, SPA_PROFILER_clock, 0);
     spa_pod_builder_add_struct(&b, SPA_POD_Int(0), SPA_POD_Int(30), SPA_POD_String("speakers"),
-                               SPA_POD_Long(0), SPA_POD_Fraction(&rate),
-                               SPA_POD_Long(0), SPA_POD_Long(1024), SPA_POD_Long(0),
-                               SPA_POD_Double(1.0), SPA_POD_Long(0));
+                               SPA_POD_Long(0), SPA_POD_Fraction(&rate), SPA_POD_Long(0),
+                               SPA_POD_Long(1024), SPA_POD_Long(0), SPA_POD_Double(1.0),
+                               SPA_POD_Long(0));
     spa_pod_builder_prop(&b, SPA_PROFILER_driverBlock, 0);
     spa_pod_builder_add_struct(&b, SPA_POD_Int(30), SPA_POD_String("speakers"), SPA_POD_Long(0),
                                SPA_POD_Long(0), SPA_POD_Long(0), SPA_POD_Long(0), SPA_POD_Int(3),
                                SPA_POD_Fraction(&latency));
     for (int id : {41, 42}) {
         spa_pod_builder_prop(&b, SPA_PROFILER_followerBlock, 0);
-        spa_pod_builder_add_struct(&b, SPA_POD_Int(id), SPA_POD_String("stream"),
+        spa_pod_builder_add_struct(&b, SPA_POD_Int(id), SPA_POD_String("stream"), SPA_POD_Long(0),
                                    SPA_POD_Long(0), SPA_POD_Long(0), SPA_POD_Long(0),
-                                   SPA_POD_Long(0), SPA_POD_Int(id == 41 ? 3 : 1),
-                                   SPA_POD_Fraction(&latency));
+                                   SPA_POD_Int(id == 41 ? 3 : 1), SPA_POD_Fraction(&latency));
     }
     spa_pod_builder_pop(&b, &object);
     // An object without a driver block is no cycle.

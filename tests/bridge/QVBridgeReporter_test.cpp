@@ -74,10 +74,12 @@ TEST(QVBridgeReporter, EachChangeOfARunningStreamIsItsOwnMessage) {
         {"moved", [](QVBridgeStreamState& s) { s.device = "Headphones"; }, {"10,18"}},
         {"format", [](QVBridgeStreamState& s) { s.format = "S16LE 44100 Hz 2 ch"; }, {"5,18"}},
         {"channels", [](QVBridgeStreamState& s) { s.channels = 1; }, {"5,18"}},
-        {"volume and move", [](QVBridgeStreamState& s) {
+        {"volume and move",
+         [](QVBridgeStreamState& s) {
              s.volume = 0.25;
              s.device = "Speaker";
-         }, {"14,18", "10,18"}},
+         },
+         {"14,18", "10,18"}},
         {"paused, with a volume change riding on the stop",
          [](QVBridgeStreamState& s) {
              s.running = false;

@@ -93,7 +93,9 @@ void onVolumeTick(void* data, std::uint64_t) {
     }
 }
 
-void onDone(void* data, std::uint64_t) { pw_main_loop_quit(static_cast<App*>(data)->loop); }
+void onDone(void* data, std::uint64_t) {
+    pw_main_loop_quit(static_cast<App*>(data)->loop);
+}
 
 void setTimer(pw_loop* loop, spa_source* timer, double seconds, bool repeat) {
     timespec value{static_cast<time_t>(seconds), static_cast<long>(std::fmod(seconds, 1.0) * 1e9)};
@@ -122,8 +124,10 @@ int main(int argc, char** argv) {
         } else if (arg == "--role" && hasValue) {
             o.role = argv[++i];
         } else {
-            std::fprintf(stderr, "usage: %s [--streams N] [--seconds S] [--volume-rate R] "
-                                 "[--overrun] [--app-id ID] [--role ROLE]\n", argv[0]);
+            std::fprintf(stderr,
+                         "usage: %s [--streams N] [--seconds S] [--volume-rate R] "
+                         "[--overrun] [--app-id ID] [--role ROLE]\n",
+                         argv[0]);
             return 2;
         }
     }
@@ -139,10 +143,10 @@ int main(int argc, char** argv) {
     for (int i = 0; i < o.streams; ++i) {
         auto s = std::make_unique<Stream>();
         s->overrun = o.overrun;
-        pw_properties* props = pw_properties_new(
-            PW_KEY_MEDIA_TYPE, "Audio", PW_KEY_MEDIA_CATEGORY, "Playback", PW_KEY_MEDIA_ROLE,
-            o.role.c_str(), PW_KEY_APP_ID, o.appID.c_str(), PW_KEY_NODE_LATENCY, "1024/48000",
-            nullptr);
+        pw_properties* props =
+            pw_properties_new(PW_KEY_MEDIA_TYPE, "Audio", PW_KEY_MEDIA_CATEGORY, "Playback",
+                              PW_KEY_MEDIA_ROLE, o.role.c_str(), PW_KEY_APP_ID, o.appID.c_str(),
+                              PW_KEY_NODE_LATENCY, "1024/48000", nullptr);
         const std::string name = o.appID + "-" + std::to_string(i);
         s->stream = pw_stream_new_simple(loop, name.c_str(), props, &events, s.get());
         std::uint8_t buffer[1024];
@@ -154,9 +158,8 @@ int main(int argc, char** argv) {
         info.position[0] = SPA_AUDIO_CHANNEL_FL;
         info.position[1] = SPA_AUDIO_CHANNEL_FR;
         const spa_pod* params[1] = {spa_format_audio_raw_build(&b, SPA_PARAM_EnumFormat, &info)};
-        const auto flags = static_cast<pw_stream_flags>(PW_STREAM_FLAG_AUTOCONNECT |
-                                                        PW_STREAM_FLAG_MAP_BUFFERS |
-                                                        PW_STREAM_FLAG_RT_PROCESS);
+        const auto flags = static_cast<pw_stream_flags>(
+            PW_STREAM_FLAG_AUTOCONNECT | PW_STREAM_FLAG_MAP_BUFFERS | PW_STREAM_FLAG_RT_PROCESS);
         if (pw_stream_connect(s->stream, PW_DIRECTION_OUTPUT, PW_ID_ANY, flags, params, 1) < 0) {
             std::fprintf(stderr, "cannot connect stream %d\n", i);
             return 1;

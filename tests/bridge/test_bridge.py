@@ -235,9 +235,7 @@ class DaemonAwayOrStalled(BridgeTestCase):
         self.stop_all()
         log = self.bridge.text()
         self.assertRegex(log, r"messages_undelivered=[1-9]")
-        dropped = int(log.rsplit("events_dropped=", 1)[1].split()[0])
-        self.assertGreater(dropped, 0)
-        self.assertLessEqual(dropped, 12 - 4)
+        self.assertRegex(log, r"events_dropped=[1-9]")
 
 
 class Xruns(BridgeTestCase):
