@@ -81,6 +81,9 @@ struct QVBridgeGraph::Impl {
         pw_proxy* proxy = nullptr;
         spa_hook objectListener{};
         pw_node_state state = PW_NODE_STATE_SUSPENDED;
+        // The registry's properties of a node leave out application.id and others: a stream is
+        // reported only once its info has come.
+        bool infoKnown = false;
         std::optional<std::vector<float>> channelVolumes;
         bool mute = false;
         std::optional<QVBridgeFormatParam> format;
@@ -96,6 +99,7 @@ struct QVBridgeGraph::Impl {
         Impl* impl = nullptr;
         std::uint32_t id = 0;
         QVBridgeProps props;
+        bool infoKnown = false;  // the process binary comes with the info
         pw_proxy* proxy = nullptr;
         spa_hook objectListener{};
     };
@@ -350,6 +354,7 @@ struct QVBridgeGraph::Impl {
     static void onClientInfo(void* data, const pw_client_info* info) {
         auto* client = static_cast<Client*>(data);
         mergeProps(client->props, info->props);
+        client->infoKnown = true;
         // Streams of this client may now find their application's ID.
         for (auto& [id, node] : client->impl->nodes) {
             if (node->stream && lookupID(node->props, PW_KEY_CLIENT_ID) == client->id) {
@@ -362,6 +367,7 @@ struct QVBridgeGraph::Impl {
         auto* node = static_cast<Node*>(data);
         if ((info->change_mask & PW_NODE_CHANGE_MASK_PROPS) != 0) {
             mergeProps(node->props, info->props);
+            node->infoKnown = true;
         }
         if ((info->change_mask & PW_NODE_CHANGE_MASK_STATE) != 0) {
             node->state = info->state;
@@ -410,10 +416,18 @@ struct QVBridgeGraph::Impl {
         const std::set<std::uint32_t> ready = std::move(self->dirty);
         self->dirty.clear();
         for (std::uint32_t id : ready) {
-            if (auto it = self->nodes.find(id); it != self->nodes.end()) {
+            if (auto it = self->nodes.find(id);
+                it != self->nodes.end() && self->ready(*it->second)) {
                 self->push(self->reporter.update(self->snapshot(*it->second)));
             }
         }
+    }
+
+    // Its properties and its client's are complete (a client not bound is not waited for).
+    bool ready(const Node& node) const {
+        const auto client = clients.find(lookupID(node.props, PW_KEY_CLIENT_ID));
+        return node.infoKnown && (client == clients.end() || client->second->proxy == nullptr ||
+                                  client->second->infoKnown);
     }
 
     // What the stream plays to (output) or records from (input): the first link's other end.

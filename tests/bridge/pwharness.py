@@ -198,9 +198,14 @@ class Bridge:
         if self.process.poll() is None:
             self.process.send_signal(signal.SIGTERM)
         try:
-            return self.process.wait(timeout=30)
+            status = self.process.wait(timeout=30)
         finally:
             self.log.close()
+        # Under the sanitizer presets a report fails the test, whatever else passed.
+        text = self.text()
+        if "Sanitizer" in text or "runtime error:" in text:
+            raise AssertionError("sanitizer report in the bridge's log:\n" + text[-6000:])
+        return status
 
 
 def payloads(daemon, event):

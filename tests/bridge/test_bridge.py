@@ -6,6 +6,7 @@ import os
 import shutil
 import signal
 import subprocess
+import sys
 import tempfile
 import time
 import unittest
@@ -43,6 +44,13 @@ class BridgeTestCase(unittest.TestCase):
         self.addCleanup(self.daemon.stop)
         self.bridge = Bridge(self.pw, self.bus.address, self.workdir)
         self.addCleanup(self.bridge.stop)
+        self.addCleanup(self.show_logs_on_failure)
+
+    def show_logs_on_failure(self):
+        result = self._outcome.result
+        if any(test is self for test, _ in result.failures + result.errors):
+            lines = [l for l in self.bridge.text().splitlines() if "debug: event" not in l]
+            print("--- bridge log (events left out):\n" + "\n".join(lines[-40:]), file=sys.stderr)
 
     def tone(self, seconds, name=None, **kw):
         path = os.path.join(self.workdir, name or f"tone-{seconds}.wav")
