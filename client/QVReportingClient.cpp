@@ -180,7 +180,7 @@ void QVReportingClient::sendAsync(const sdbus::MethodCall& call,
     });
 }
 
-std::string QVReportingClient::nameOwner() {
+std::string QVReportingClient::daemonOwner() {
     try {
         auto request = bus_->createMethodCall(kBusDaemonInterface, "GetNameOwner");
         request << std::string(dbus::kBusName);
@@ -289,7 +289,7 @@ std::vector<std::int64_t> QVReportingClient::getAllReporters() {
 void QVReportingClient::killService() {
     // Asking first keeps a bus that can start the daemon on demand from starting it only to
     // kill it, and tells the daemon's exit apart from a call that merely timed out.
-    const std::string owner = nameOwner();
+    const std::string owner = daemonOwner();
     if (owner.empty()) {
         throw notRunningError();
     }
@@ -297,7 +297,7 @@ void QVReportingClient::killService() {
         invoke<bool>(dbus::kKillService);
     } catch (const QVReportingClientError& e) {
         // The daemon never answers; the bus answers NoReply for it when it leaves.
-        if (e.name() != kErrorNoReply || nameOwner() == owner) {
+        if (e.name() != kErrorNoReply || daemonOwner() == owner) {
             throw;
         }
     }

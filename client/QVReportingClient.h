@@ -77,6 +77,9 @@ class QVReportingClient {
 
     // This connection's unique bus name (":1.42").
     std::string uniqueName() const;
+    // The unique bus name of the daemon's process, empty while nobody owns its name: a change
+    // tells a long-lived client that the daemon restarted and its sessions are gone.
+    std::string daemonOwner();
 
     // --- Blocking operations, in the interface's order. Each throws QVReportingClientError. ---
     bool createReportingSession(std::int64_t reporterID);
@@ -137,7 +140,6 @@ class QVReportingClient {
     void sendAsync(const sdbus::MethodCall& call, std::function<void(sdbus::MethodReply&)> handle,
                    std::function<void(const QVReportingClientError&)> fail,
                    std::uint64_t timeoutMicroseconds = 0);
-    std::string nameOwner();
 
     std::unique_ptr<sdbus::IConnection> connection_;
     std::unique_ptr<sdbus::IProxy> reporting_;
