@@ -105,8 +105,9 @@ def run(soak):
             flooder.first_line()
             wait_until(lambda: probe_done(watch), timeout=120, what="the probe")
             stats = daemon.stats()
-            refused = stats["limit_exceeded_call_bytes_per_client"]
-            c.check(refused > 0, "sends flood: no call was refused past the client's budget")
+            refused = (stats["limit_exceeded_call_bytes_per_client"]
+                       + stats["limit_exceeded_payload_rate_per_client"])
+            c.check(refused > 0, "sends flood: no call was refused past the client's budgets")
             # One call may pass the budget by its own size: it is checked before decoding.
             bound = CALL_BYTES_PER_CLIENT + 3 * SEND_BYTES
             c.check(stats["call_bytes_max"] <= bound,
