@@ -18,10 +18,10 @@
 
 #include "platform/Clock.h"
 #include "platform/SafeFileName.h"
-#include "platform/linux/ThreadPriority.h"
 #include "platform/SinkSegments.h"
 #include "platform/linux/DiskBudget.h"
 #include "platform/linux/RegularFile.h"
+#include "platform/linux/ThreadPriority.h"
 #include "values/ValueJson.h"
 
 namespace qv {
