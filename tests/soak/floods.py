@@ -21,6 +21,9 @@ SHORT_SIZES = {"sessions": 2000, "held": 20000, "sends": 300}
 SEND_BYTES = 600 * 1024
 # The daemon's default budget of one client's calls not yet answered (--max-call-bytes-per-client).
 CALL_BYTES_PER_CLIENT = 16 << 20
+# A payload rate the sends flood must pass however fast the daemon reads: at the default rate a
+# slow daemon (a sanitizer build) reads the flood slower than the budget and refuses nothing.
+PAYLOAD_BYTES_PER_SECOND = 2 << 20
 
 
 class Flooder:
@@ -66,7 +69,9 @@ def run(soak):
     log(f"== floods: {sizes}")
     bus = Bus(soak.new_dir("floods-bus"))
     try:
-        daemon = soak.start_daemon(bus, soak.new_dir("floods"), "floods")
+        daemon = soak.start_daemon(bus, soak.new_dir("floods"), "floods",
+                                   "--max-payload-bytes-per-second",
+                                   str(PAYLOAD_BYTES_PER_SECOND))
         try:
             rss_idle = daemon.rss_kib()
             soak.figure(f"floods: idle daemon RSS {rss_idle} KiB")
