@@ -14,10 +14,6 @@ namespace qv {
 
 namespace {
 
-const QVReportingLogCategory& logCategory() {
-    return QVReportingDriverUtilityCategory();
-}
-
 std::string_view textOf(const std::optional<std::string>& name) {
     return name ? std::string_view(*name) : std::string_view("(null)");
 }
@@ -71,34 +67,35 @@ std::vector<QVReportingDriver> QVReportingDriverUtility::driverList() {
 }
 
 QVReportingDriverUtility::QVReportingDriverUtility(StatFeed& feed) : feed_(feed) {
-    QVLOG_INFO(logCategory(), "creating channelstats driver utility");
+    QVLOG_INFO(QVReportingDriverUtilityCategory(), "creating channelstats driver utility");
     for (QVReportingDriver& driver : driverList()) {
         const auto channels = feed_.channelsInGroup(driver.groupName(), driver.subGroupName());
         if (!channels.ok()) {
-            QVLOG_ERROR(logCategory(), "error {} getting channels for driver {}-{}",
-                        channels.error(), textOf(driver.groupName()),
-                        textOf(driver.subGroupName()));
+            QVLOG_ERROR(QVReportingDriverUtilityCategory(),
+                        "error {} getting channels for driver {}-{}", channels.error(),
+                        textOf(driver.groupName()), textOf(driver.subGroupName()));
             continue;
         }
         if (!channels.value() || feed_.channelCount(*channels.value()) < 1) {
-            QVLOG_INFO(logCategory(), "couldn't find any channels for driver group {}-{}",
+            QVLOG_INFO(QVReportingDriverUtilityCategory(),
+                       "couldn't find any channels for driver group {}-{}",
                        textOf(driver.groupName()), textOf(driver.subGroupName()));
             continue;
         }
         auto subscription = QVReportingIOChannelSubscription::initWithDriver(driver);
         const auto subscribed = feed_.createSubscription(*channels.value());
         if (!subscribed.ok() || !subscribed.value().subscription || !subscribed.value().channels) {
-            QVLOG_ERROR(logCategory(), "error {} creating subscription for {}-{}",
-                        subscribed.error(), textOf(driver.groupName()),
-                        textOf(driver.subGroupName()));
+            QVLOG_ERROR(QVReportingDriverUtilityCategory(),
+                        "error {} creating subscription for {}-{}", subscribed.error(),
+                        textOf(driver.groupName()), textOf(driver.subGroupName()));
             continue;
         }
         subscription.setSubscription(subscribed.value().subscription);
         // The channel set is immutable: holding it is holding a copy.
         subscription.setSubscribedChannels(subscribed.value().channels);
         ioChannelSubscriptions_.push_back(std::move(subscription));
-        QVLOG_INFO(logCategory(), "subscribed to group group {}-{}", textOf(driver.groupName()),
-                   textOf(driver.subGroupName()));
+        QVLOG_INFO(QVReportingDriverUtilityCategory(), "subscribed to group group {}-{}",
+                   textOf(driver.groupName()), textOf(driver.subGroupName()));
     }
 }
 
@@ -106,10 +103,11 @@ QVReportingDriverUtility::Snapshot QVReportingDriverUtility::getSnapShot() const
     Snapshot snapshot;
     for (const auto& s : ioChannelSubscriptions_) {
         const std::string description = s.driver().description();
-        QVLOG_INFO(logCategory(), "sampling driver {}", description);
+        QVLOG_INFO(QVReportingDriverUtilityCategory(), "sampling driver {}", description);
         auto samples = feed_.createSamples(*s.subscription(), *s.subscribedChannels());
         if (!samples.ok()) {
-            QVLOG_ERROR(logCategory(), "StatFeedCreateSamples error {}", samples.error());
+            QVLOG_ERROR(QVReportingDriverUtilityCategory(), "StatFeedCreateSamples error {}",
+                        samples.error());
             continue;
         }
         snapshot[description] = std::move(samples.value());
@@ -121,11 +119,12 @@ QVReportingDriverUtility::DriverStats QVReportingDriverUtility::computeDriverSta
     const Snapshot* driverSnapShot) const {
     DriverStats stats;
     for (const auto& s : ioChannelSubscriptions_) {
-        QVLOG_INFO(logCategory(), "getting latest samples");
+        QVLOG_INFO(QVReportingDriverUtilityCategory(), "getting latest samples");
         const auto current = feed_.createSamples(*s.subscription(), *s.subscribedChannels());
-        QVLOG_INFO(logCategory(), "done getting latest samples");
+        QVLOG_INFO(QVReportingDriverUtilityCategory(), "done getting latest samples");
         if (!current.ok()) {
-            QVLOG_ERROR(logCategory(), "StatFeedCreateSamples error {}", current.error());
+            QVLOG_ERROR(QVReportingDriverUtilityCategory(), "StatFeedCreateSamples error {}",
+                        current.error());
             continue;
         }
         if (driverSnapShot == nullptr) {
@@ -134,12 +133,14 @@ QVReportingDriverUtility::DriverStats QVReportingDriverUtility::computeDriverSta
         const auto start = driverSnapShot->find(s.driver().description());
         if (start == driverSnapShot->end() || !start->second) {
             // No start samples (their sampling failed): the library refuses a null argument.
-            QVLOG_ERROR(logCategory(), "StatFeedCreateSamples error {}", EINVAL);
+            QVLOG_ERROR(QVReportingDriverUtilityCategory(), "StatFeedCreateSamples error {}",
+                        EINVAL);
             continue;
         }
         const auto delta = feed_.createSamplesDelta(*start->second, *current.value());
         if (!delta.ok()) {
-            QVLOG_ERROR(logCategory(), "StatFeedCreateSamples error {}", delta.error());
+            QVLOG_ERROR(QVReportingDriverUtilityCategory(), "StatFeedCreateSamples error {}",
+                        delta.error());
             continue;
         }
         feed_.iterate(*delta.value(), [&](const StatFeedChannel& channel) {
@@ -156,14 +157,14 @@ QVReportingDriverUtility::DriverStats QVReportingDriverUtility::computeDriverSta
                     break;
                 case ChannelStatsFormat::Invalid:
                 case ChannelStatsFormat::SimpleArray:
-                    QVLOG_INFO(logCategory(),
+                    QVLOG_INFO(QVReportingDriverUtilityCategory(),
                                "Dropping sample of type : {} for group : {} "
                                "subgroup : {}",
                                static_cast<unsigned>(format), textOf(feed_.channelGroup(channel)),
                                textOf(feed_.channelSubgroup(channel)));
                     break;
                 default:
-                    QVLOG_ERROR(logCategory(),
+                    QVLOG_ERROR(QVReportingDriverUtilityCategory(),
                                 "The ChannelStatsFormat {} is not supported "
                                 "group : {} subgroup : {}",
                                 static_cast<unsigned>(format), textOf(feed_.channelGroup(channel)),
@@ -218,7 +219,8 @@ void QVReportingDriverUtility::processHistogramData(const StatFeedChannel& chann
     for (std::size_t i = 0; i < count; ++i) {
         const auto bounds = feed_.bucketBounds(channel, i);
         if (!bounds.ok()) {
-            QVLOG_ERROR(logCategory(), "Error in getting the bucket bounds : {}",
+            QVLOG_ERROR(QVReportingDriverUtilityCategory(),
+                        "Error in getting the bucket bounds : {}",
                         static_cast<int>(bounds.error()));
             continue;
         }
@@ -261,7 +263,7 @@ void QVReportingDriverUtility::processStateData(const StatFeedChannel& channel,
     if (data.empty()) {
         return;
     }
-    QVLOG_DEBUG(logCategory(), "the current reported data is : {}", data);
+    QVLOG_DEBUG(QVReportingDriverUtilityCategory(), "the current reported data is : {}", data);
     driverStats.set(getDriverStatsKey(channel, "State"), Value(std::move(data)));
 }
 

@@ -18,10 +18,6 @@ namespace {
 constexpr std::uint64_t kSecondsPerWeek = 604800;
 constexpr std::uint64_t kSecondsPerDay = 86400;
 
-const QVReportingLogCategory& logCategory() {
-    return QVReportingAudioRegistrationCategory();
-}
-
 std::mutex gSleeperMutex;
 BaseUnit::Sleeper gSleeper;  // guarded by gSleeperMutex; empty: really sleep
 
@@ -85,7 +81,7 @@ bool qualifies(const BluetoothPairedDevice& device) {
 
 BaseUnit::BaseUnit(const Platform& platform, Dictionary& registrationInfoParams)
     : platform_(platform), registrationInfoParams_(registrationInfoParams) {
-    QVLOG_DEBUG(logCategory(), "BaseUnit initialize");
+    QVLOG_DEBUG(QVReportingAudioRegistrationCategory(), "BaseUnit initialize");
 }
 
 void BaseUnit::TEST_setSleeper(Sleeper sleeper) {
@@ -106,7 +102,7 @@ std::string_view BaseUnit::sideName(int side) {
 }
 
 void BaseUnit::enumerateBluetoothDevices() {
-    QVLOG_DEBUG(logCategory(), "Enumerate Bluetooth!\n");
+    QVLOG_DEBUG(QVReportingAudioRegistrationCategory(), "Enumerate Bluetooth!\n");
     BluetoothFacility& facility = platform_.bluetooth;
     if (!facility.available()) {
         bool available = false;
@@ -115,7 +111,8 @@ void BaseUnit::enumerateBluetoothDevices() {
             available = facility.available();
         }
         if (!available) {
-            QVLOG_DEBUG(logCategory(), "Timed Out waiting for BT Manager init");
+            QVLOG_DEBUG(QVReportingAudioRegistrationCategory(),
+                        "Timed Out waiting for BT Manager init");
             return;
         }
     }
@@ -131,8 +128,8 @@ void BaseUnit::enumerateBluetoothDevices() {
         for (const auto& d : devices_) {
             listed.emplace_back(d.identifier);
         }
-        QVLOG_DEBUG(logCategory(), "bluetoothPairedDeviceArray: {} - {}", devices_.size(),
-                    Value(std::move(listed)).description());
+        QVLOG_DEBUG(QVReportingAudioRegistrationCategory(), "bluetoothPairedDeviceArray: {} - {}",
+                    devices_.size(), Value(std::move(listed)).description());
     }
 }
 

@@ -26,10 +26,6 @@ constexpr double kSecondsPerDay = 86400;
 constexpr const char* kSetupTaskName =
     "-[QVReportingSessionAudioRegistrationWorker setupConvoReporterInterface:]";
 
-const QVReportingLogCategory& logCategory() {
-    return QVReportingAudioRegistrationCategory();
-}
-
 // What every session of the process shares.
 struct SharedState {
     // The process-wide lock of the gathering: one BTAccess serves every session.
@@ -90,7 +86,8 @@ std::shared_ptr<Worker> Worker::initWithSession(
     if (!session) {
         return nullptr;
     }
-    QVLOG_DEBUG(logCategory(), "QVReportingService Audio Registration initWithSession");
+    QVLOG_DEBUG(QVReportingAudioRegistrationCategory(),
+                "QVReportingService Audio Registration initWithSession");
     auto worker = std::make_shared<Worker>(session->platform());
     worker->setSession(session);
     worker->setStarted(false);
@@ -111,7 +108,7 @@ void Worker::loadSharedState() {
         s.registrationInfo = *stored->asDictionary();
         return;
     }
-    QVLOG_DEBUG(logCategory(), "Set RegistrationInfo Defaults");
+    QVLOG_DEBUG(QVReportingAudioRegistrationCategory(), "Set RegistrationInfo Defaults");
     s.registrationInfo.clear();
     defaults.setValue(kSuite, kRegistrationInfoKey, Dictionary{});
 }
@@ -136,7 +133,8 @@ void Worker::TEST_setRandomSource(RandomSource source) {
 }
 
 bool Worker::start() {
-    QVLOG_DEFAULT(logCategory(), "Starting QVReportingSessionAudioRegistrationWorker");
+    QVLOG_DEFAULT(QVReportingAudioRegistrationCategory(),
+                  "Starting QVReportingSessionAudioRegistrationWorker");
     setStarted(true);
     return true;
 }
@@ -165,8 +163,9 @@ void Worker::handleMessage(const std::shared_ptr<QVReportingSessionMessage>& mes
             }
             next = s.nextEnumerationEpoch;
         }
-        QVLOG_DEBUG(logCategory(), "Time to next BT Enumeration: {:f} seconds / {:f} days",
-                    next - now, (next - now) / kSecondsPerDay);
+        QVLOG_DEBUG(QVReportingAudioRegistrationCategory(),
+                    "Time to next BT Enumeration: {:f} seconds / {:f} days", next - now,
+                    (next - now) / kSecondsPerDay);
         if (now < next) {
             return;
         }
@@ -184,7 +183,8 @@ void Worker::handleMessage(const std::shared_ptr<QVReportingSessionMessage>& mes
         platform_.preferences.setValue(kSuite, kEnumerationCheckEpochKey, newNext);
         platform_.preferences.setValue(kSuite, kRegistrationInfoKey, std::move(result));
     } catch (const std::exception& e) {
-        QVLOG_DEBUG(logCategory(), "Exception in BT gatherData : {}", e.what());
+        QVLOG_DEBUG(QVReportingAudioRegistrationCategory(), "Exception in BT gatherData : {}",
+                    e.what());
     }
 }
 
@@ -198,7 +198,8 @@ void Worker::storeNextInvocation(double epoch) {
 }
 
 void Worker::stop() {
-    QVLOG_DEFAULT(logCategory(), "Stopping QVReportingSessionAudioRegistrationWorker");
+    QVLOG_DEFAULT(QVReportingAudioRegistrationCategory(),
+                  "Stopping QVReportingSessionAudioRegistrationWorker");
     SharedState& s = shared();
     try {
         Dictionary info;
@@ -211,7 +212,7 @@ void Worker::stop() {
         const Value* splunk = info.find(BaseUnit::kSplunkKey);
         const Array* entries = splunk ? splunk->asArray() : nullptr;
         if (!entries) {
-            QVLOG_DEFAULT(logCategory(),
+            QVLOG_DEFAULT(QVReportingAudioRegistrationCategory(),
                           "There have been no BT enumerations. Skip further processing");
             return;
         }
@@ -234,16 +235,17 @@ void Worker::stop() {
             }
             next = now + offset;
             storeNextInvocation(next);
-            QVLOG_DEFAULT(logCategory(), "Current Epoch: {:f}; nextInvocationEpoch is {:f}", now,
-                          next);
+            QVLOG_DEFAULT(QVReportingAudioRegistrationCategory(),
+                          "Current Epoch: {:f}; nextInvocationEpoch is {:f}", now, next);
             return;
         }
-        QVLOG_DEFAULT(logCategory(), "Time to next Invocation: {:f} seconds / {:f} days",
-                      next - now, (next - now) / kSecondsPerDay);
+        QVLOG_DEFAULT(QVReportingAudioRegistrationCategory(),
+                      "Time to next Invocation: {:f} seconds / {:f} days", next - now,
+                      (next - now) / kSecondsPerDay);
         if (now <= next) {
             return;
         }
-        QVLOG_DEFAULT(logCategory(), "We could publish");
+        QVLOG_DEFAULT(QVReportingAudioRegistrationCategory(), "We could publish");
         storeNextInvocation(now + kRetryInterval);
 
         Array active;
@@ -262,24 +264,25 @@ void Worker::stop() {
             }
         }
         if (!active.empty()) {
-            QVLOG_DEFAULT(logCategory(),
+            QVLOG_DEFAULT(QVReportingAudioRegistrationCategory(),
                           "At least one active Bud connection detected since last "
                           "publish. Let's publish to Convo!");
             setupConvoReporterInterface(active);
         } else {
-            QVLOG_DEFAULT(logCategory(),
+            QVLOG_DEFAULT(QVReportingAudioRegistrationCategory(),
                           "No active Bud connections detected since last publish. Skip publishing "
                           "anything; check again after SamplingPeriod");
             storeNextInvocation(platform_.clock.now() + kPublicationInterval);
         }
     } catch (const std::exception& e) {
-        QVLOG_DEFAULT(logCategory(), "Exception while trying to process registration info : {}",
-                      e.what());
+        QVLOG_DEFAULT(QVReportingAudioRegistrationCategory(),
+                      "Exception while trying to process registration info : {}", e.what());
     }
 }
 
 void Worker::setupConvoReporterInterface(const Array& devices) {
-    QVLOG_DEBUG(logCategory(), "entering convoreporting {}", kSetupTaskName);
+    QVLOG_DEBUG(QVReportingAudioRegistrationCategory(), "entering convoreporting {}",
+                kSetupTaskName);
     ConvoService& convo = platform_.convo;
     auto token = convo.newHierarchyTokenFromParentToken(std::nullopt);
     {
@@ -287,7 +290,7 @@ void Worker::setupConvoReporterInterface(const Array& devices) {
         convoReportingAgentToken_ = token;
     }
     if (!token) {
-        QVLOG_ERROR(logCategory(),
+        QVLOG_ERROR(QVReportingAudioRegistrationCategory(),
                     "newHierarchyTokenFromParentToken returned nil. Will skip convo for this "
                     "session. {}",
                     kSetupTaskName);
@@ -322,7 +325,7 @@ void Worker::setupConvoReporterInterface(const Array& devices) {
     convoSession->startConfiguration([self = shared_from_this(), devices](
                                          const std::optional<std::vector<std::string>>& backends) {
         if (!backends) {
-            QVLOG_ERROR(logCategory(),
+            QVLOG_ERROR(QVReportingAudioRegistrationCategory(),
                         "no backends found, this session won't get sent to the server");
             self->convoReportingSessionStarted_ = false;
             return;
@@ -336,7 +339,7 @@ void Worker::setupConvoReporterInterface(const Array& devices) {
             QVReportingSessionMessage message(*payload, kPublishedCategory, kPublishedType);
             self->_sendMessage(message);
         }
-        QVLOG_DEBUG(logCategory(), "Message Sent->");
+        QVLOG_DEBUG(QVReportingAudioRegistrationCategory(), "Message Sent->");
     });
 }
 
@@ -353,10 +356,11 @@ void Worker::_sendMessage(const QVReportingSessionMessage& message) {
         convoSession->sendMessage(retrieveConvoReportingCategoryFromCategory(message.category()),
                                   message.type(), message.message());
     if (error) {
-        QVLOG_ERROR(logCategory(), "error sending message {}", *error);
+        QVLOG_ERROR(QVReportingAudioRegistrationCategory(), "error sending message {}", *error);
         return;
     }
-    QVLOG_DEBUG(logCategory(), "ConvoReportingAgent {} : message {} : category {} : type {}",
+    QVLOG_DEBUG(QVReportingAudioRegistrationCategory(),
+                "ConvoReportingAgent {} : message {} : category {} : type {}",
                 convoSession->description(), message.message().description(), message.category(),
                 message.type());
     storeNextInvocation(platform_.clock.now() + kPublicationInterval);

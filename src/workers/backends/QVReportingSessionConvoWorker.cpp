@@ -17,10 +17,6 @@ namespace qv {
 
 namespace {
 
-const QVReportingLogCategory& logCategory() {
-    return QVReportingSessionConvoReportingCategory();
-}
-
 // The task names the log lines carry.
 constexpr std::string_view kStartTask = "-[QVReportingSessionConvoWorker start]_block_invoke";
 constexpr std::string_view kForwardTask =
@@ -181,7 +177,7 @@ void QVReportingSessionConvoWorker::stop() {
 // ---- on the Convo queue ----
 
 void QVReportingSessionConvoWorker::startTask(const StartArguments& arguments) {
-    const auto& log = logCategory();
+    const auto& log = QVReportingSessionConvoReportingCategory();
     QVLOG_DEBUG(log, "entering convoreporting {}", kStartTask);
     convoReportingAgentToken_ = convo_.newHierarchyTokenFromParentToken(std::nullopt);
     if (!convoReportingAgentToken_) {
@@ -228,13 +224,14 @@ void QVReportingSessionConvoWorker::startTask(const StartArguments& arguments) {
         [backend = backend_,
          weakSelf = weak_from_this()](const std::optional<std::vector<std::string>>& backends) {
             if (backends) {
-                QVLOG_DEFAULT(logCategory(), "list of backends {}", describeBackends(*backends));
+                QVLOG_DEFAULT(QVReportingSessionConvoReportingCategory(), "list of backends {}",
+                              describeBackends(*backends));
                 backend->convoReportingSessionStarted.store(true);
                 if (const auto self = weakSelf.lock()) {
                     self->setStarted(true);
                 }
             } else {
-                QVLOG_ERROR(logCategory(),
+                QVLOG_ERROR(QVReportingSessionConvoReportingCategory(),
                             "no backends found, this session won't get sent to the server");
                 backend->convoReportingSessionStarted.store(false);
             }
@@ -247,7 +244,7 @@ void QVReportingSessionConvoWorker::startTask(const StartArguments& arguments) {
 }
 
 void QVReportingSessionConvoWorker::finishBackendWait(bool signalled) {
-    const auto& log = logCategory();
+    const auto& log = QVReportingSessionConvoReportingCategory();
     if (!signalled) {
         QVLOG_ERROR(log, "timed out waiting for backends");
     } else if (backend_->convoReportingSessionStarted.load()) {
@@ -276,13 +273,14 @@ void QVReportingSessionConvoWorker::forwardTask(Outbox& outbox) {
                                               kinds[i].second);
             _sendMessage(message);
         } else {
-            QVLOG_DEFAULT(logCategory(), "Session never started. {}", kForwardTask);
+            QVLOG_DEFAULT(QVReportingSessionConvoReportingCategory(), "Session never started. {}",
+                          kForwardTask);
         }
     }
 }
 
 void QVReportingSessionConvoWorker::_sendMessage(QVReportingSessionMessage& message) {
-    const auto& log = logCategory();
+    const auto& log = QVReportingSessionConvoReportingCategory();
     QVLOG_DEBUG(log, "entering convoreporting {}", kSendMessage);
     const std::uint16_t category = retrieveConvoReportingCategoryFromCategory(message.category());
     if (!internalBuild_) {
@@ -305,7 +303,7 @@ void QVReportingSessionConvoWorker::_sendMessage(QVReportingSessionMessage& mess
 
 void QVReportingSessionConvoWorker::stopTask(const QVReportingConvoSessionSummary& summary,
                                              bool listWasEmpty, ReporterID reporterID) {
-    const auto& log = logCategory();
+    const auto& log = QVReportingSessionConvoReportingCategory();
     if (!backend_->convoReportingSessionStarted.load()) {
         QVLOG_DEFAULT(log, "Session never started. {}", kStopTask);
         return;

@@ -29,10 +29,6 @@ namespace {
 // Each message is written as a pretty-printed object, this many blanks a level.
 constexpr int kJsonIndent = 2;
 
-const QVReportingLogCategory& logCategory() {
-    return QVReportingSummaryLogCategory();
-}
-
 }  // namespace
 
 std::filesystem::path QVReportingLogsDirectory(const Platform& platform) {
@@ -68,8 +64,8 @@ void QVReportingSessionSummaryJsonFileWorker::openFile() {
     std::error_code ec;
     std::filesystem::create_directories(directory, ec);
     if (ec) {
-        QVLOG_ERROR(logCategory(), "can't create logging directory at {}: {}", directory.string(),
-                    ec.message());
+        QVLOG_ERROR(QVReportingSummaryLogCategory(), "can't create logging directory at {}: {}",
+                    directory.string(), ec.message());
     }
     // Whatever the client named its application, the name stays one file in this directory.
     const std::string name = fmt::format(
@@ -83,14 +79,14 @@ void QVReportingSessionSummaryJsonFileWorker::openFile() {
     reportFileHandle_ =
         ::open(tempPath_.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_NOFOLLOW | O_CLOEXEC, 0666);
     if (reportFileHandle_ < 0) {
-        QVLOG_ERROR(logCategory(),
+        QVLOG_ERROR(QVReportingSummaryLogCategory(),
                     "SummaryJsonFileWorker failed to open file. action=open file={} error=\"{}\"",
                     reportPath_, std::strerror(errno));
         setStarted(false);
         return;
     }
-    QVLOG_INFO(logCategory(), "SummaryJsonFileWorker opened file. action=open file={}",
-               reportPath_);
+    QVLOG_INFO(QVReportingSummaryLogCategory(),
+               "SummaryJsonFileWorker opened file. action=open file={}", reportPath_);
     setStarted(true);
     writeLine("[");
 }
@@ -112,7 +108,7 @@ void QVReportingSessionSummaryJsonFileWorker::writePending() {
     if (!written && !writeFailed_) {
         writeFailed_ = reportFileHandle_ >= 0;
         QVLOG_ERROR(
-            logCategory(),
+            QVReportingSummaryLogCategory(),
             "SummaryJsonFileWorker failed to write line. action=writeline file={} error=\"{}\"",
             reportPath_, std::strerror(errno));
     }
@@ -134,13 +130,13 @@ void QVReportingSessionSummaryJsonFileWorker::closeFile() {
     }
     if (error != 0) {
         ::unlink(tempPath_.c_str());
-        QVLOG_ERROR(logCategory(),
+        QVLOG_ERROR(QVReportingSummaryLogCategory(),
                     "SummaryJsonFileWorker failed to closed file. action=close file={} "
                     "error=\"{}\" (no file left)",
                     reportPath_, writeFailed_ ? "a write failed" : std::strerror(error));
     } else {
-        QVLOG_INFO(logCategory(), "SummaryJsonFileWorker closed file. action=close file={}",
-                   reportPath_);
+        QVLOG_INFO(QVReportingSummaryLogCategory(),
+                   "SummaryJsonFileWorker closed file. action=close file={}", reportPath_);
     }
 }
 
@@ -172,7 +168,7 @@ void QVReportingSessionSummaryJsonFileWorker::stop() {
         if (QVReportingAppendJsonText(text, member, kJsonIndent)) {
             writeLine(text);
         } else {
-            QVLOG_ERROR(logCategory(), "dataWithJSONObject: {}",
+            QVLOG_ERROR(QVReportingSummaryLogCategory(), "dataWithJSONObject: {}",
                         "a string of the message is not valid UTF-8");
         }
     }

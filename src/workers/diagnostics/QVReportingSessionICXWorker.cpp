@@ -17,10 +17,6 @@ namespace qv {
 
 namespace {
 
-const QVReportingLogCategory& logCategory() {
-    return QVReportingICXLogCategory();
-}
-
 constexpr std::string_view kTestModeLine = "Skipping actual fire, as we are running in test mode.";
 
 }  // namespace
@@ -94,8 +90,8 @@ void QVReportingSessionICXWorker::handleMessage(
         if (!instance->interestedInMessage(*message)) {
             continue;
         }
-        QVLOG_DEBUG(logCategory(), "Interested in message. instance={}, {}", instance->className(),
-                    message->description());
+        QVLOG_DEBUG(QVReportingICXLogCategory(), "Interested in message. instance={}, {}",
+                    instance->className(), message->description());
         ++state.interestedCount;
         if (!state.interestFirstSeen) {
             state.interestFirstSeen = clock.now();
@@ -121,7 +117,7 @@ void QVReportingSessionICXWorker::handleMessage(
         state.issueReporter = owner->platform().issueCapture.createReporter();
         ++state.firedCount;
         if (owner->serviceType() == service::kTest) {
-            QVLOG_INFO(logCategory(), "{}", kTestModeLine);
+            QVLOG_INFO(QVReportingICXLogCategory(), "{}", kTestModeLine);
         } else {
             instance->fire(message);
         }
@@ -137,24 +133,25 @@ std::string QVReportingSessionICXWorker::getSessionIdentifierFromResponse(
     if (success && *success == Value(true)) {
         if (const Value* identifier = response.find(kIssueCaptureReplySessionID)) {
             std::string text = QVReportingValueText(identifier);
-            QVLOG_INFO(logCategory(), "Started ICX session. sessionId={}", text);
+            QVLOG_INFO(QVReportingICXLogCategory(), "Started ICX session. sessionId={}", text);
             return text;
         }
-        QVLOG_ERROR(logCategory(), "Started ICX session, but no sessionId found!");
+        QVLOG_ERROR(QVReportingICXLogCategory(), "Started ICX session, but no sessionId found!");
         return std::string(kNoneReturned);
     }
     std::int64_t reason = 0;
     if (const Value* given = response.find(kIssueCaptureReplyReason)) {
         reason = given->asInt64().value_or(0);
     } else {
-        QVLOG_ERROR(logCategory(), "Failed starting icx session. Unknown reason.");
+        QVLOG_ERROR(QVReportingICXLogCategory(), "Failed starting icx session. Unknown reason.");
     }
     if (reason == kIssueCaptureErrorNone) {
-        QVLOG_ERROR(logCategory(), "Failed starting icx session. reason=kIssueCaptureErrorNone");
+        QVLOG_ERROR(QVReportingICXLogCategory(),
+                    "Failed starting icx session. reason=kIssueCaptureErrorNone");
     } else if (const auto name = IssueCaptureErrorName(reason)) {
-        QVLOG_INFO(logCategory(), "Failed starting icx session. reason={}", *name);
+        QVLOG_INFO(QVReportingICXLogCategory(), "Failed starting icx session. reason={}", *name);
     } else {
-        QVLOG_INFO(logCategory(), "Failed starting icx session. reason={}", reason);
+        QVLOG_INFO(QVReportingICXLogCategory(), "Failed starting icx session. reason={}", reason);
     }
     return std::string(kNoneReturned);
 }

@@ -11,10 +11,6 @@ namespace qv {
 
 namespace {
 
-const QVReportingLogCategory& logCategory() {
-    return QVReportingSessionCategory();
-}
-
 // Where Vidcall spatial-audio reports go in the tracker.
 constexpr std::string_view kComponentName = "Vidcall Core - Callwire";
 constexpr std::string_view kComponentVersion = "All";
@@ -36,8 +32,9 @@ QVReportingSessionIssueFilerWorker::initWithSession(
     const Platform& platform = session->platform();
     const auto backOff = platform.preferences.value(kDefaultsSuite, kBackOffSecondsKey);
     if (!backOff) {
-        QVLOG_DEBUG(logCategory(), "{} default not set. Skipping worker. reporterID={}",
-                    kBackOffSecondsKey, session->reporterID());
+        QVLOG_DEBUG(QVReportingSessionCategory(),
+                    "{} default not set. Skipping worker. reporterID={}", kBackOffSecondsKey,
+                    session->reporterID());
         return nullptr;
     }
     auto worker = std::make_shared<QVReportingSessionIssueFilerWorker>(
@@ -66,12 +63,12 @@ bool QVReportingSessionIssueFilerWorker::hasRunInTimeframe(double backOffSeconds
     const double now = clock_.now();
     const auto last = defaults_.value(kDefaultsSuite, key);
     if (last && last->doubleValue() > now - backOffSeconds) {
-        QVLOG_DEBUG(logCategory(), "Issue filer has run. key={} lastRun={}", key,
+        QVLOG_DEBUG(QVReportingSessionCategory(), "Issue filer has run. key={} lastRun={}", key,
                     QVReportingValueText(&*last));
         return true;
     }
-    QVLOG_DEBUG(logCategory(), "Issue filer has not run. key={} backoffSeconds={:f}", key,
-                backOffSeconds);
+    QVLOG_DEBUG(QVReportingSessionCategory(), "Issue filer has not run. key={} backoffSeconds={:f}",
+                key, backOffSeconds);
     // The store writes the whole suite back to its file; a failed write is the store's to report,
     // and the answer stands: this session prompts at most once anyway.
     defaults_.setValue(kDefaultsSuite, key, now);
@@ -86,28 +83,29 @@ void QVReportingSessionIssueFilerWorker::handleMessage(
     const auto owner = session();
     const ReporterID reporterID = owner ? owner->reporterID() : 0;
     if (hasRun_) {
-        QVLOG_DEBUG(logCategory(),
+        QVLOG_DEBUG(QVReportingSessionCategory(),
                     "Issue filer has already run for VidcallXYerrorMessage reporterID={}",
                     reporterID);
         return;
     }
     hasRun_ = true;
-    QVLOG_DEFAULT(logCategory(), "Starting issue filer for VidcallXYerrorMessage reporterID={}",
-                  reporterID);
+    QVLOG_DEFAULT(QVReportingSessionCategory(),
+                  "Starting issue filer for VidcallXYerrorMessage reporterID={}", reporterID);
     const std::string processName = owner ? owner->clientProcessName() : std::string();
-    issueFiler_.createDraft(issueDraftForVidcallXYerror(), processName, kDisplayReason,
-                            [](const std::optional<std::string>& error) {
-                                if (error) {
-                                    QVLOG_ERROR(logCategory(), "Error creating draft - {}", *error);
-                                } else {
-                                    QVLOG_INFO(logCategory(), "Successfully created draft");
-                                }
-                            });
+    issueFiler_.createDraft(
+        issueDraftForVidcallXYerror(), processName, kDisplayReason,
+        [](const std::optional<std::string>& error) {
+            if (error) {
+                QVLOG_ERROR(QVReportingSessionCategory(), "Error creating draft - {}", *error);
+            } else {
+                QVLOG_INFO(QVReportingSessionCategory(), "Successfully created draft");
+            }
+        });
 }
 
 void QVReportingSessionIssueFilerWorker::stop() {
     const auto owner = session();
-    QVLOG_DEBUG(logCategory(), "Resetting hasRun to false. reporterID={}",
+    QVLOG_DEBUG(QVReportingSessionCategory(), "Resetting hasRun to false. reporterID={}",
                 owner ? owner->reporterID() : 0);
     hasRun_ = false;
 }

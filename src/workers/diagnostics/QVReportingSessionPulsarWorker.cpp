@@ -22,10 +22,6 @@ std::int64_t integerValue(const Value* value) {
     return value ? value->longLongValue() : 0;
 }
 
-const QVReportingLogCategory& logCategory() {
-    return QVReportingPulsarLogCategory();
-}
-
 constexpr std::string_view kSmallestBufferFrameSizeKey = "smallest_buffer_frame_size";
 constexpr std::string_view kPayloadIOCycleKey = "io_cycle";
 constexpr std::string_view kRequestDomain = "com.korvane.qvsound";
@@ -98,7 +94,7 @@ void QVReportingSessionPulsarWorker::readSettings(const PreferenceStore& default
     s.waitTime = getDoubleRunTimeDefaults(defaults, kWaitTimeKey);
     s.waitMicroseconds = waitMicroseconds(s.waitTime);
     if (s.waitMicroseconds == kMaximumWaitMicroseconds && s.waitTime != kMaximumWaitMicroseconds) {
-        QVLOG_DEFAULT(logCategory(),
+        QVLOG_DEFAULT(QVReportingPulsarLogCategory(),
                       "{} of {} microseconds capped at {}: a longer pause would hold up every "
                       "session's messages",
                       kWaitTimeKey, s.waitTime, kMaximumWaitMicroseconds);
@@ -113,7 +109,8 @@ bool QVReportingSessionPulsarWorker::getEnableFlag(const PreferenceStore& defaul
     if (!value) {
         return false;
     }
-    QVLOG_DEBUG(logCategory(), "Value of {} is {}", key, QVReportingValueText(&*value));
+    QVLOG_DEBUG(QVReportingPulsarLogCategory(), "Value of {} is {}", key,
+                QVReportingValueText(&*value));
     return value->boolValue();
 }
 
@@ -123,7 +120,8 @@ std::int32_t QVReportingSessionPulsarWorker::getRunTimeDefaults(const Preference
     if (!value) {
         return 0;
     }
-    QVLOG_DEBUG(logCategory(), "Value of {} is {}", key, QVReportingValueText(&*value));
+    QVLOG_DEBUG(QVReportingPulsarLogCategory(), "Value of {} is {}", key,
+                QVReportingValueText(&*value));
     return value->intValue();
 }
 
@@ -133,7 +131,8 @@ double QVReportingSessionPulsarWorker::getDoubleRunTimeDefaults(const Preference
     if (!value) {
         return 0.0;
     }
-    QVLOG_DEBUG(logCategory(), "Value of {} is {}", key, QVReportingValueText(&*value));
+    QVLOG_DEBUG(QVReportingPulsarLogCategory(), "Value of {} is {}", key,
+                QVReportingValueText(&*value));
     return value->doubleValue();
 }
 
@@ -145,7 +144,7 @@ QVReportingSessionPulsarWorker::Settings QVReportingSessionPulsarWorker::setting
 bool QVReportingSessionPulsarWorker::interestedInMessage(
     const QVReportingSessionMessage& message) const {
     if (message.type() == type::kError && message.category() == category::kIO) {
-        QVLOG_INFO(logCategory(), "Interested in overload");
+        QVLOG_INFO(QVReportingPulsarLogCategory(), "Interested in overload");
         return true;
     }
     return false;
@@ -173,13 +172,13 @@ void QVReportingSessionPulsarWorker::handleMessage(
     // Deep, so that nothing the service keeps shares a container with the session's message.
     Value copied = Value(payload).deepCopy();
     const Dictionary& copy = *copied.asDictionary();
-    QVLOG_INFO(logCategory(), "Dropping spinlog {}", copy.description());
+    QVLOG_INFO(QVReportingPulsarLogCategory(), "Dropping spinlog {}", copy.description());
     const std::string description = QVReportingValueText(payload.find(QVReportingApplicationName));
     diagnostics_.request(kRequestDomain, kRequestKind, description, copy, kRequestOptions);
     // A plain post: the name's state stays what it was; observers hear of the drop.
     notifications_.post(kDroppedSpinlogNotification,
                         notifications_.stateOf(kDroppedSpinlogNotification));
-    QVLOG_INFO(logCategory(), "Dropped spinlog");
+    QVLOG_INFO(QVReportingPulsarLogCategory(), "Dropped spinlog");
     lastMessageTime_ = now;
 }
 

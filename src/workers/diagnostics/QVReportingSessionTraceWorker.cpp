@@ -22,10 +22,6 @@ namespace {
 
 namespace fs = std::filesystem;
 
-const QVReportingLogCategory& logCategory() {
-    return QVReportingTraceCategory();
-}
-
 std::optional<std::string> configuredString(const Dictionary& configuration, std::string_view key) {
     const Value* value = configuration.find(key);
     if (value && value->isString()) {
@@ -114,7 +110,7 @@ bool QVReportingSessionTraceWorker::start() {
     const auto probeList = configuredString(configuration, QVReportingThreadlinePlistFilePath);
     std::error_code ec;
     if (!probeList || probeList->empty() || !fs::exists(*probeList, ec)) {
-        QVLOG_ERROR(logCategory(),
+        QVLOG_ERROR(QVReportingTraceCategory(),
                     "Could not start SpanTrace. QVReportingThreadlinePlistFilePath: {} is not a "
                     "valid path",
                     QVReportingValueText(configuration.find(QVReportingThreadlinePlistFilePath)));
@@ -126,8 +122,8 @@ bool QVReportingSessionTraceWorker::start() {
     SpanTraceRecorder& recorder = owner->platform().spanTrace;
     auto config = recorder.configurationFromTemplate(templateNumber);
     if (!config) {
-        QVLOG_ERROR(logCategory(), "Could not start SpanTrace. No recording template {}",
-                    templateNumber);
+        QVLOG_ERROR(QVReportingTraceCategory(),
+                    "Could not start SpanTrace. No recording template {}", templateNumber);
         return started();
     }
     config->compressWhenFinished = false;
@@ -144,7 +140,8 @@ bool QVReportingSessionTraceWorker::start() {
     if (mTraceDispatchSemaphore_->wait(kStartTimeoutSeconds)) {
         setStarted(true);
     } else {
-        QVLOG_DEFAULT(logCategory(), "timed out waiting for performance trace to start");
+        QVLOG_DEFAULT(QVReportingTraceCategory(),
+                      "timed out waiting for performance trace to start");
         std::shared_ptr<SpanTraceSession> current;
         {
             std::lock_guard lock(mutex_);
@@ -165,9 +162,9 @@ void QVReportingSessionTraceWorker::spanTraceDidStart(const std::optional<std::s
             dropped = std::move(traceSession_);
             traceConfig_.reset();
         }
-        QVLOG_ERROR(logCategory(), "spanTraceDidStart {}", *error);
+        QVLOG_ERROR(QVReportingTraceCategory(), "spanTraceDidStart {}", *error);
     } else {
-        QVLOG_INFO(logCategory(), "Performance Trace Started");
+        QVLOG_INFO(QVReportingTraceCategory(), "Performance Trace Started");
     }
     mTraceDispatchSemaphore_->signal();
 }
@@ -179,9 +176,9 @@ void QVReportingSessionTraceWorker::spanTraceDidStop(const std::optional<std::st
             std::lock_guard lock(mutex_);
             dropped = std::move(traceSession_);
         }
-        QVLOG_ERROR(logCategory(), "spanTraceDidStop {}", *error);
+        QVLOG_ERROR(QVReportingTraceCategory(), "spanTraceDidStop {}", *error);
     } else {
-        QVLOG_INFO(logCategory(), "Performance Trace Stopped");
+        QVLOG_INFO(QVReportingTraceCategory(), "Performance Trace Stopped");
     }
 }
 
@@ -202,9 +199,9 @@ void QVReportingSessionTraceWorker::spanTraceDidComplete(
         finished.reset();
     }
     if (error) {
-        QVLOG_ERROR(logCategory(), "spanTraceDidComplete {}", *error);
+        QVLOG_ERROR(QVReportingTraceCategory(), "spanTraceDidComplete {}", *error);
     } else {
-        QVLOG_INFO(logCategory(), "Performance Trace Completed: {}",
+        QVLOG_INFO(QVReportingTraceCategory(), "Performance Trace Completed: {}",
                    location ? location->string() : "(null)");
     }
     mTraceDispatchSemaphore_->signal();
@@ -223,7 +220,7 @@ void QVReportingSessionTraceWorker::stop() {
         }
     }
     if (!mTraceDispatchSemaphore_->wait(kStopTimeoutSeconds)) {
-        QVLOG_DEFAULT(logCategory(),
+        QVLOG_DEFAULT(QVReportingTraceCategory(),
                       "timed out waiting for performance trace to stop.  No gdj file wil be "
                       "generated. ");
         return;
@@ -239,10 +236,11 @@ void QVReportingSessionTraceWorker::stop() {
 void QVReportingSessionTraceWorker::processTraceThreadline(
     const std::optional<std::filesystem::path>& location) {
     const std::string locationText = location ? location->string() : "(null)";
-    QVLOG_DEBUG(logCategory(), "Starting Threadline Process Trace. Path: {}", locationText);
+    QVLOG_DEBUG(QVReportingTraceCategory(), "Starting Threadline Process Trace. Path: {}",
+                locationText);
     std::error_code ec;
     if (!location || !fs::exists(*location, ec)) {
-        QVLOG_ERROR(logCategory(), "No traceResults at path: {}", locationText);
+        QVLOG_ERROR(QVReportingTraceCategory(), "No traceResults at path: {}", locationText);
         return;
     }
     const auto owner = session();
@@ -258,23 +256,24 @@ void QVReportingSessionTraceWorker::processTraceThreadline(
                           ? QVReportingReadXMLPropertyListFile(probeListPath)
                           : QVReportingPropertyList{std::nullopt, "no path"};
     if (!list.root) {
-        QVLOG_ERROR(logCategory(), "{} failed to get ThreadlineProbes from {}", list.error,
-                    probeListPath);
+        QVLOG_ERROR(QVReportingTraceCategory(), "{} failed to get ThreadlineProbes from {}",
+                    list.error, probeListPath);
     } else if (const Array* array = list.root->asArray()) {
         std::size_t index = 0;
         for (const Value& element : *array) {
             if (const Dictionary* dictionary = element.asDictionary()) {
                 probeDictionaries.push_back(*dictionary);
             } else {
-                QVLOG_ERROR(logCategory(), "Threadline probe {} skipped: a {}, not a dictionary",
-                            index, kindName(element));
+                QVLOG_ERROR(QVReportingTraceCategory(),
+                            "Threadline probe {} skipped: a {}, not a dictionary", index,
+                            kindName(element));
             }
             ++index;
         }
     } else if (const Dictionary* dictionary = list.root->asDictionary()) {
         probeDictionaries.push_back(*dictionary);
     } else {
-        QVLOG_ERROR(logCategory(), "unsupported root class {}", kindName(*list.root));
+        QVLOG_ERROR(QVReportingTraceCategory(), "unsupported root class {}", kindName(*list.root));
     }
     if (probeDictionaries.empty()) {
         return;
@@ -282,10 +281,12 @@ void QVReportingSessionTraceWorker::processTraceThreadline(
 
     auto built = owner->platform().threadline.modelFromTraceFile(*location);
     if (!built.model) {
-        QVLOG_ERROR(logCategory(), "failed to create Threadline model: {}", built.error);
+        QVLOG_ERROR(QVReportingTraceCategory(), "failed to create Threadline model: {}",
+                    built.error);
         return;
     }
-    QVLOG_INFO(logCategory(), "Threadline model of {}: {}", locationText, built.model->summary());
+    QVLOG_INFO(QVReportingTraceCategory(), "Threadline model of {}: {}", locationText,
+               built.model->summary());
     threadlineModel_ = built.model;
 
     createGaugeWriter();
@@ -293,7 +294,7 @@ void QVReportingSessionTraceWorker::processTraceThreadline(
     std::vector<std::string> problems;
     const auto probes = threadlineModel_->probesFromDictionaries(probeDictionaries, &problems);
     for (const std::string& problem : problems) {
-        QVLOG_ERROR(logCategory(), "Threadline probe skipped: {}", problem);
+        QVLOG_ERROR(QVReportingTraceCategory(), "Threadline probe skipped: {}", problem);
     }
     for (const ThreadlineProbe& probe : probes) {
         processProbe(probe);
@@ -305,16 +306,16 @@ void QVReportingSessionTraceWorker::processTraceThreadline(
         mWriter_.reset();
         if (error != 0) {
             // Half a results file is worse than none: a reader would take it for the results.
-            QVLOG_ERROR(logCategory(), "Failed to write gaugedata. errno: {}", error);
+            QVLOG_ERROR(QVReportingTraceCategory(), "Failed to write gaugedata. errno: {}", error);
             fs::remove(tempWriterPath_, ec);
             return;
         }
     }
-    QVLOG_DEBUG(logCategory(), "Moving file from tempWriterPath: {} to {}", tempWriterPath_,
-                fullWriterPath_);
+    QVLOG_DEBUG(QVReportingTraceCategory(), "Moving file from tempWriterPath: {} to {}",
+                tempWriterPath_, fullWriterPath_);
     fs::rename(tempWriterPath_, fullWriterPath_, ec);
     if (ec) {
-        QVLOG_ERROR(logCategory(), "Failed to move file");
+        QVLOG_ERROR(QVReportingTraceCategory(), "Failed to move file");
     }
 }
 
@@ -359,15 +360,15 @@ void QVReportingSessionTraceWorker::createGaugeWriter() {
         outputDirectory(platform.device.diagnosticLogsDirectory(),
                         configuration.find(QVReportingThreadlineOutputFileDirectory), &refusal);
     if (!refusal.empty()) {
-        QVLOG_ERROR(logCategory(),
+        QVLOG_ERROR(QVReportingTraceCategory(),
                     "refusing QVReportingThreadlineOutputFileDirectory: {}; using {}", refusal,
                     directory.string());
     }
     std::error_code ec;
     fs::create_directories(directory, ec);
     if (ec) {
-        QVLOG_ERROR(logCategory(), "can't create logging directory at {}: {}", directory.string(),
-                    ec.message());
+        QVLOG_ERROR(QVReportingTraceCategory(), "can't create logging directory at {}: {}",
+                    directory.string(), ec.message());
     }
 
     const Value* configuredName = configuration.find(QVReportingThreadlineOutputFileName);
@@ -382,18 +383,19 @@ void QVReportingSessionTraceWorker::createGaugeWriter() {
     }
     fullWriterPath_ = (directory / mOutputFile_).string();
     tempWriterPath_ = (directory / kTemporaryFileName).string();
-    QVLOG_DEBUG(logCategory(), "tempWriterPath: {}", tempWriterPath_);
+    QVLOG_DEBUG(QVReportingTraceCategory(), "tempWriterPath: {}", tempWriterPath_);
     pathToGDJ_ = tempWriterPath_;
 
     auto opened = platform.gaugeData.open(pathToGDJ_, mGaugeDataName_, mResultsVersion_, 0);
     mWriter_ = std::move(opened.file);
     if (!mWriter_) {
-        QVLOG_ERROR(logCategory(), "Failed to open gaugedata writer. errno: {}", opened.error);
+        QVLOG_ERROR(QVReportingTraceCategory(), "Failed to open gaugedata writer. errno: {}",
+                    opened.error);
     }
 }
 
 void QVReportingSessionTraceWorker::processProbe(const ThreadlineProbe& probe) {
-    QVLOG_DEBUG(logCategory(), "{}, {}", probe.name, probe.description);
+    QVLOG_DEBUG(QVReportingTraceCategory(), "{}, {}", probe.name, probe.description);
     if (!probe.children.empty()) {
         for (const ThreadlineProbe& child : probe.children) {
             processProbe(child);
@@ -406,7 +408,7 @@ void QVReportingSessionTraceWorker::processProbe(const ThreadlineProbe& probe) {
     for (const ThreadlineEvent& event : probe.events) {
         const double seconds = threadlineModel_->secondsFromTimebase(event.duration);
         const double milliseconds = seconds * 1000.0;
-        QVLOG_DEBUG(logCategory(), "name:{} time:{:f} ms", event.name, milliseconds);
+        QVLOG_DEBUG(QVReportingTraceCategory(), "name:{} time:{:f} ms", event.name, milliseconds);
         if (mWriter_) {
             mWriter_->addValue(event.name, "milliseconds", milliseconds);
         }
