@@ -151,7 +151,7 @@ Plot usagePlot(const std::string& id, const std::string& by,
                     "set style data histograms\nset style histogram clustered gap 1\n"
                     "set style fill solid 0.85 border -1\nset boxwidth 0.9 relative\n"
                     "set ylabel 'seconds'\nset yrange [0:*]\nset xtics rotate by -20 nomirror\n"
-                    "set grid ytics\nset key top right\n"
+                    "set grid ytics\nset key below\n"
                     "plot $u using 2:xtic(1) title 'playback' " +
                     color(0) + ", $u using 3 title 'record' " + color(1) + "\n";
     return plot;
