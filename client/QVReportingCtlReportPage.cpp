@@ -270,6 +270,7 @@ figure.plot.empty p { color: #777; font-style: italic; padding: 2em; background:
 table { border-collapse: collapse; font-size: 0.85em; width: 100%; }
 th, td { text-align: left; padding: 0.2em 0.6em; border-bottom: 1px solid #eee; }
 td.n { text-align: right; font-variant-numeric: tabular-nums; }
+td.n, td.t { white-space: nowrap; }
 tr.warn td { background: #fde8e8; }
 )";
 
@@ -378,7 +379,7 @@ std::string QVReportingCtlRenderReportPage(const ReportData& data, const std::st
     for (std::size_t i = from; i < data.sessions.size(); ++i) {
         const auto& s = data.sessions[i];
         page += fmt::format(
-            "<tr><td class=\"n\">{}</td><td>{}</td><td>{}</td><td>{}</td><td class=\"n\">{}</td>"
+            "<tr><td class=\"n\">{}</td><td>{}</td><td>{}</td><td class=\"t\">{}</td><td class=\"n\">{}</td>"
             "<td class=\"n\">{}</td><td>{}</td><td>{}</td></tr>\n",
             s.reporterID, h(application(s.application)), h(s.service),
             QVReportingCtlShortUTC(s.start),
