@@ -33,8 +33,8 @@ class TemporaryDirectory {
         const char* base = std::getenv("TMPDIR");
         std::string pattern = std::string(base && *base ? base : "/tmp") + "/qvreportctl.XXXXXX";
         if (!::mkdtemp(pattern.data())) {
-            throw GnuplotError(fmt::format("cannot make a temporary directory {}: {}", pattern,
-                                           std::strerror(errno)));
+            throw QVReportingCtlGnuplotError(fmt::format("cannot make a temporary directory {}: {}",
+                                                         pattern, std::strerror(errno)));
         }
         path_ = pattern;
     }
@@ -53,12 +53,12 @@ class TemporaryDirectory {
 
 }  // namespace
 
-std::size_t Gnuplot::add(std::string commands) {
+std::size_t QVReportingCtlGnuplot::add(std::string commands) {
     plots_.push_back(std::move(commands));
     return plots_.size() - 1;
 }
 
-std::string Gnuplot::quote(const std::string& text) {
+std::string QVReportingCtlGnuplot::quote(const std::string& text) {
     std::string out = "'";
     for (const char c : text) {
         if (c == '\'') {
@@ -72,7 +72,7 @@ std::string Gnuplot::quote(const std::string& text) {
     return out + "'";
 }
 
-std::vector<std::string> Gnuplot::run(int width, int height) const {
+std::vector<std::string> QVReportingCtlGnuplot::run(int width, int height) const {
     if (plots_.empty()) {
         return {};
     }
@@ -89,7 +89,8 @@ std::vector<std::string> Gnuplot::run(int width, int height) const {
                    << plots_[i] << "\nunset output\n";
         }
         if (!script) {
-            throw GnuplotError("cannot write the plot script in " + dir.path().string());
+            throw QVReportingCtlGnuplotError("cannot write the plot script in " +
+                                             dir.path().string());
         }
     }
     const std::string scriptPath = (dir.path() / "plots.gp").string();
@@ -107,29 +108,31 @@ std::vector<std::string> Gnuplot::run(int width, int height) const {
         posix_spawnp(&pid, program_.c_str(), &actions, nullptr, argv.data(), environ);
     posix_spawn_file_actions_destroy(&actions);
     if (spawned == ENOENT) {
-        throw GnuplotError(
+        throw QVReportingCtlGnuplotError(
             "gnuplot is not installed; the report draws its plots with it: install the Debian "
             "package gnuplot-nox (apt-get install gnuplot-nox)");
     }
     if (spawned != 0) {
-        throw GnuplotError(fmt::format("cannot run {}: {}", program_, std::strerror(spawned)));
+        throw QVReportingCtlGnuplotError(
+            fmt::format("cannot run {}: {}", program_, std::strerror(spawned)));
     }
     int status = 0;
     while (::waitpid(pid, &status, 0) < 0 && errno == EINTR) {
     }
     const std::string errors = readFile(errorPath);
     if (!WIFEXITED(status) || WEXITSTATUS(status) != 0) {
-        throw GnuplotError(fmt::format("{} failed ({}): {}", program_,
-                                       WIFEXITED(status)
-                                           ? fmt::format("exit {}", WEXITSTATUS(status))
-                                           : fmt::format("signal {}", WTERMSIG(status)),
-                                       errors));
+        throw QVReportingCtlGnuplotError(
+            fmt::format("{} failed ({}): {}", program_,
+                        WIFEXITED(status) ? fmt::format("exit {}", WEXITSTATUS(status))
+                                          : fmt::format("signal {}", WTERMSIG(status)),
+                        errors));
     }
     std::vector<std::string> svgs;
     for (std::size_t i = 0; i < plots_.size(); ++i) {
         std::string svg = readFile(plotPath(i));
         if (svg.find("<svg") == std::string::npos) {
-            throw GnuplotError(fmt::format("{} drew no plot {}: {}", program_, i, errors));
+            throw QVReportingCtlGnuplotError(
+                fmt::format("{} drew no plot {}: {}", program_, i, errors));
         }
         svgs.push_back(std::move(svg));
     }

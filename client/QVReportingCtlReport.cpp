@@ -21,7 +21,7 @@ namespace {
 
 using client::ReportData;
 
-std::optional<double> time(const std::string& text, const char* option) {
+std::optional<double> parseTime(const std::string& text, const char* option) {
     if (text.empty()) {
         return std::nullopt;
     }
@@ -133,8 +133,8 @@ void writeAtomically(const std::filesystem::path& path, const std::string& text)
 
 int report(const Options& options, const ReportOptions& report) {
     client::ReportFilter filter;
-    filter.since = time(report.since, "--since");
-    filter.until = time(report.until, "--until");
+    filter.since = parseTime(report.since, "--since");
+    filter.until = parseTime(report.until, "--until");
     filter.application = report.application;
     if (filter.since && filter.until && *filter.since >= *filter.until) {
         throw UsageError{"--since must come before --until"};
@@ -152,7 +152,7 @@ int report(const Options& options, const ReportOptions& report) {
     try {
         page = client::QVReportingCtlRenderReportPage(data, options.stateDir, counters(options),
                                                       now());
-    } catch (const client::GnuplotError& e) {
+    } catch (const client::QVReportingCtlGnuplotError& e) {
         throw Failure{e.what()};
     }
     const std::filesystem::path path =

@@ -119,8 +119,9 @@ Plot sessionsPlot(const ReportData& data) {
             bars += fmt::format("{:.6f} {} {:.6f} 0.3\n", s->start + half, i + 1, half);
         }
         plot.commands += datablock(fmt::format("s{}", i), bars);
-        ytics += fmt::format("{}{} {}", i == 0 ? "" : ", ",
-                             Gnuplot::quote(fmt::format("{} ({})", name, sessions.size())), i + 1);
+        ytics += fmt::format(
+            "{}{} {}", i == 0 ? "" : ", ",
+            QVReportingCtlGnuplot::quote(fmt::format("{} ({})", name, sessions.size())), i + 1);
         plots +=
             fmt::format("{}$s{} using 1:2:3:4 with boxxyerror {} fs solid 0.7 noborder notitle",
                         plots.empty() ? "" : ", ", i, color(i));
@@ -190,7 +191,7 @@ Plot volumePlot(const ReportData& data) {
         plots += fmt::format(
             "{}$v{} using 1:2 with steps lw 2 {} title {}, $v{} using 1:2 with "
             "points pt 7 ps 0.6 {} notitle",
-            plots.empty() ? "" : ", ", i, color(i - from), Gnuplot::quote(title), i,
+            plots.empty() ? "" : ", ", i, color(i - from), QVReportingCtlGnuplot::quote(title), i,
             color(i - from));
         plot.points += p.stretches.size();
     }
@@ -213,8 +214,9 @@ Plot issuesPlot(const ReportData& data) {
     std::string ytics, plots;
     for (int k = 0; k < kReportIssueKinds; ++k) {
         const auto kind = static_cast<ReportIssue::Kind>(k);
-        ytics += fmt::format("{}{} {}", k == 0 ? "" : ", ",
-                             Gnuplot::quote(std::string(QVReportingCtlIssueKindName(kind))), k + 1);
+        ytics += fmt::format(
+            "{}{} {}", k == 0 ? "" : ", ",
+            QVReportingCtlGnuplot::quote(std::string(QVReportingCtlIssueKindName(kind))), k + 1);
         std::string rows;
         std::size_t n = 0;
         for (const auto& issue : data.issues) {
@@ -227,9 +229,10 @@ Plot issuesPlot(const ReportData& data) {
             continue;
         }
         plot.commands += datablock(fmt::format("i{}", k), rows);
-        plots += fmt::format(
-            "{}$i{} using 1:2 with points pt 7 ps 1.4 {} title {}", plots.empty() ? "" : ", ", k,
-            color(k), Gnuplot::quote(fmt::format("{} ({})", QVReportingCtlIssueKindName(kind), n)));
+        plots += fmt::format("{}$i{} using 1:2 with points pt 7 ps 1.4 {} title {}",
+                             plots.empty() ? "" : ", ", k, color(k),
+                             QVReportingCtlGnuplot::quote(
+                                 fmt::format("{} ({})", QVReportingCtlIssueKindName(kind), n)));
         plot.points += n;
     }
     plot.commands += timeAxis(data.first, data.last);
@@ -320,7 +323,7 @@ std::string QVReportingCtlRenderReportPage(const ReportData& data, const std::st
     plots.push_back(volumePlot(data));
     plots.push_back(issuesPlot(data));
 
-    Gnuplot gnuplot(gnuplotProgram);
+    QVReportingCtlGnuplot gnuplot(gnuplotProgram);
     std::vector<std::size_t> drawn(plots.size());
     for (std::size_t i = 0; i < plots.size(); ++i) {
         if (plots[i].points > 0) {
@@ -379,7 +382,8 @@ std::string QVReportingCtlRenderReportPage(const ReportData& data, const std::st
     for (std::size_t i = from; i < data.sessions.size(); ++i) {
         const auto& s = data.sessions[i];
         page += fmt::format(
-            "<tr><td class=\"n\">{}</td><td>{}</td><td>{}</td><td class=\"t\">{}</td><td class=\"n\">{}</td>"
+            "<tr><td class=\"n\">{}</td><td>{}</td><td>{}</td><td class=\"t\">{}</td><td "
+            "class=\"n\">{}</td>"
             "<td class=\"n\">{}</td><td>{}</td><td>{}</td></tr>\n",
             s.reporterID, h(application(s.application)), h(s.service),
             QVReportingCtlShortUTC(s.start),

@@ -28,7 +28,7 @@ struct ReportCounters {
 };
 
 // The page. stateDir and generated (the time the report is made) are shown in its heading; the
-// plots are drawn by gnuplotProgram, found on PATH. Throws GnuplotError.
+// plots are drawn by gnuplotProgram, found on PATH. Throws QVReportingCtlGnuplotError.
 std::string QVReportingCtlRenderReportPage(const ReportData& data, const std::string& stateDir,
                                            const ReportCounters& counters, double generated,
                                            const std::string& gnuplotProgram = "gnuplot");

@@ -2,7 +2,6 @@
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
-#include <regex>
 #include <set>
 #include <string>
 
@@ -229,14 +228,20 @@ TEST_F(TheReportData, KeepsWhatLiesFromSinceUpToUntilAndOneApplication) {
     EXPECT_THROW(QVReportingCtlGatherReport((root_ / "sinks").string(), {}), std::runtime_error);
 }
 
+// The value of an attribute of the element that starts at `at`.
+std::string attribute(const std::string& page, std::size_t at, const std::string& name) {
+    const std::string key = " " + name + "=\"";
+    const auto begin = page.find(key, at) + key.size();
+    return page.substr(begin, page.find('"', begin) - begin);
+}
+
 TEST_F(TheReportData, MakesAPageWhosePlotsCarryTheirPointsOrSayTheyHaveNone) {
     const ReportCounters counters{nullptr, "no daemon runs on the system bus"};
     const std::string page = QVReportingCtlRenderReportPage(gather(), root_.string(), counters, 0);
-    const std::regex figure(R"re(<figure class="plot[^"]*" id="([a-z-]+)" data-points="(\d+)")re");
     std::map<std::string, int> points;
-    for (auto it = std::sregex_iterator(page.begin(), page.end(), figure);
-         it != std::sregex_iterator(); ++it) {
-        points[(*it)[1]] = std::stoi((*it)[2]);
+    for (auto at = page.find("<figure class=\"plot"); at != std::string::npos;
+         at = page.find("<figure class=\"plot", at + 1)) {
+        points[attribute(page, at, "id")] = std::stoi(attribute(page, at, "data-points"));
     }
     EXPECT_EQ(points, (std::map<std::string, int>{{"plot-sessions", 3},
                                                   {"plot-usage-application", 2},
@@ -245,10 +250,13 @@ TEST_F(TheReportData, MakesAPageWhosePlotsCarryTheirPointsOrSayTheyHaveNone) {
                                                   {"plot-issues", 3}}));
     // Five inline SVGs whose ids do not collide, and nothing fetched from elsewhere.
     std::set<std::string> ids;
-    const std::regex id(R"re(id=['"]([^'"]+)['"])re");
-    for (auto it = std::sregex_iterator(page.begin(), page.end(), id); it != std::sregex_iterator();
-         ++it) {
-        EXPECT_TRUE(ids.insert((*it)[1]).second) << "id used twice: " << (*it)[1];
+    for (const char quote : {'\'', '"'}) {
+        const std::string key = std::string("id=") + quote;
+        for (auto at = page.find(key); at != std::string::npos; at = page.find(key, at + 1)) {
+            const auto begin = at + key.size();
+            const std::string id = page.substr(begin, page.find(quote, begin) - begin);
+            EXPECT_TRUE(ids.insert(id).second) << "id used twice: " << id;
+        }
     }
     EXPECT_NE(page.find("plot-volume-gnuplot_plot_1"), std::string::npos);
     EXPECT_EQ(page.find("<?xml"), std::string::npos);
@@ -271,7 +279,7 @@ TEST_F(TheReportData, MakesAPageWhosePlotsCarryTheirPointsOrSayTheyHaveNone) {
     try {
         QVReportingCtlRenderReportPage(gather(), root_.string(), counters, 0, "qv-no-such-gnuplot");
         ADD_FAILURE() << "no error without gnuplot";
-    } catch (const GnuplotError& e) {
+    } catch (const QVReportingCtlGnuplotError& e) {
         EXPECT_NE(std::string(e.what()).find("gnuplot-nox"), std::string::npos) << e.what();
     }
 }
