@@ -50,6 +50,17 @@ double number(const Json& object, const char* key, double otherwise = 0) {
     return it != object.end() && it->is_number() ? it->get<double>() : otherwise;
 }
 
+// Lines are read as they are: a member of an unexpected type reads as missing, never throws.
+std::int64_t integer(const Json& object, const char* key, std::int64_t otherwise = 0) {
+    const auto it = object.find(key);
+    return it != object.end() && it->is_number_integer() ? it->get<std::int64_t>() : otherwise;
+}
+
+bool flag(const Json& object, const char* key) {
+    const auto it = object.find(key);
+    return it != object.end() && it->is_boolean() && it->get<bool>();
+}
+
 // Each whole line of one sink, parsed, with its time; counts the sink's files as it goes.
 void readSink(const std::filesystem::path& sinksDir, const std::string& sink,
               ReportSinkFiles& files, const std::function<void(double, const Json&)>& take) {
@@ -139,12 +150,12 @@ class Gatherer {
 
     void convo(double time, const Json& line) {
         const std::string op = text(line, "op");
-        const auto number = line.value("session", std::int64_t{-1});
+        const auto number = integer(line, "session", -1);
         if (op == "session") {
             ReportSession s;
             const Json& info = line.value("sessionInfo", Json::object());
             const Json& user = line.value("userInfo", Json::object());
-            s.reporterID = info.value("SessionID", std::int64_t{0});
+            s.reporterID = integer(info, "SessionID");
             s.application = text(info, "ClientBundleID");
             s.service = text(user, "ServiceName");
             if (s.service.ends_with(kSessionSuffix)) {
@@ -170,8 +181,8 @@ class Gatherer {
         if (op != "message") {
             return;
         }
-        const auto category = line.value("category", std::int64_t{0});
-        const auto type = line.value("type", std::int64_t{0});
+        const auto category = integer(line, "category");
+        const auto type = integer(line, "type");
         if (category == kConvoSummary && type == kConvoSummary) {
             return;
         }
@@ -258,8 +269,7 @@ class Gatherer {
             captureServices_.push_back(text(signature, "type"));
         } else if (sink == "diagnostics" && op == "request") {
             addIssue(ReportIssue::Kind::kStackSample, time, text(line, "description"),
-                     text(line, "kind") +
-                         (line.value("sampled", false) ? ", sampled" : ", not sampled"));
+                     text(line, "kind") + (flag(line, "sampled") ? ", sampled" : ", not sampled"));
         } else if (sink == "issuefiler" && op == "draft") {
             addIssue(ReportIssue::Kind::kBugReport, time, text(line, "processName"),
                      text(line, "title"));

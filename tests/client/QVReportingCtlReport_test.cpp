@@ -99,6 +99,9 @@ class TheReportData : public ::testing::Test {
         convo(
             201,
             R"("op":"message","session":1,"sessionID":9,"category":7,"type":7,"payload":{"issue_type":"silence"})");
+        // Members of the wrong type are passed over, not thrown at.
+        convo(203, R"("op":"message","session":"1","category":"Volume","type":null)");
+        convo(204, R"("op":"message","session":1,"category":"Volume","type":null,"payload":[])");
         write(
             "issuecapture.jsonl", 1, 202,
             R"("op":"snapshot","signature":{"type":"haptics","subtype":"Playback","subtypeContext":"EnergyLog"})");
@@ -164,6 +167,7 @@ TEST_F(TheReportData, GroupsEachSessionsMessagesAcrossDaemonRunsAndSegments) {
     EXPECT_EQ(QVReportingCtlCountsText(data.sessions[1].derived), "input stretch");
     const auto& haptics = data.sessions[2];
     EXPECT_EQ(haptics.service, "haptics");
+    EXPECT_EQ(haptics.messages, 2u);
     EXPECT_FALSE(haptics.stopped);
     EXPECT_EQ(QVReportingCtlSessionIssuesText(haptics), "capture, silence");
 
@@ -194,11 +198,11 @@ TEST_F(TheReportData, GroupsEachSessionsMessagesAcrossDaemonRunsAndSegments) {
     EXPECT_EQ(analytics.firstSeq, 3u);
     EXPECT_EQ(analytics.lastSeq, 9u);
     EXPECT_EQ(analytics.linesMissing, 2u);  // 1 and 2
-    EXPECT_EQ(data.sinks.at("convo").lines, 13u);
+    EXPECT_EQ(data.sinks.at("convo").lines, 15u);
     EXPECT_EQ(data.sinks.at("convo").linesUnreadable, 0u);
     EXPECT_EQ(analytics.linesUnreadable, 1u);
     EXPECT_DOUBLE_EQ(data.first, 100);
-    EXPECT_DOUBLE_EQ(data.last, 202);
+    EXPECT_DOUBLE_EQ(data.last, 204);  // the unflushed session's last message
 }
 
 TEST_F(TheReportData, KeepsWhatLiesFromSinceUpToUntilAndOneApplication) {
