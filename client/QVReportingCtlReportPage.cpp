@@ -303,6 +303,77 @@ std::string QVReportingCtlEscapeHTML(const std::string& text) {
     return out;
 }
 
+namespace {
+
+// The sessions, the latest last.
+std::string sessionsSection(const ReportData& data) {
+    const auto h = QVReportingCtlEscapeHTML;
+    std::string page = "<section>\n<h2>Sessions</h2>\n";
+    const std::size_t from =
+        data.sessions.size() > kMaxTableSessions ? data.sessions.size() - kMaxTableSessions : 0;
+    page += fmt::format(
+        "<p class=\"note\">{} sessions{}; <code>qvreportctl report --summary</code> "
+        "prints them too.</p>\n",
+        data.sessions.size(),
+        from > 0 ? fmt::format(", the latest {} shown", kMaxTableSessions) : "");
+    page +=
+        "<table id=\"sessions\">\n<tr><th>reporter ID</th><th>application</th><th>service</th>"
+        "<th>started</th><th>seconds</th><th>messages</th><th>derived</th><th>issues</th></tr>\n";
+    for (std::size_t i = from; i < data.sessions.size(); ++i) {
+        const auto& s = data.sessions[i];
+        page += fmt::format(
+            "<tr><td class=\"n\">{}</td><td>{}</td><td>{}</td><td class=\"t\">{}</td>"
+            "<td class=\"n\">{}</td><td class=\"n\">{}</td><td>{}</td><td>{}</td></tr>\n",
+            s.reporterID, h(application(s.application)), h(s.service),
+            QVReportingCtlShortUTC(s.start),
+            s.stopped ? fmt::format("{:.1f}", s.end - s.start) : "running", s.messages,
+            h(QVReportingCtlCountsText(s.derived)), h(QVReportingCtlSessionIssuesText(s)));
+    }
+    page += "</table>\n</section>\n";
+    return page;
+}
+
+// The guardrail counters, and what the sink files hold.
+std::string countersSection(const ReportData& data, const ReportCounters& counters) {
+    const auto h = QVReportingCtlEscapeHTML;
+    std::string page = "<section>\n<h2>Guardrail counters</h2>\n";
+    if (counters.stats.is_object()) {
+        page += fmt::format(
+            "<p class=\"note\" id=\"counters-source\">From {}, when this report "
+            "was made. Rows in red: something was refused, dropped or lost.</p>\n"
+            "<table id=\"counters\">\n<tr><th>counter</th><th>value</th></tr>\n",
+            h(counters.source));
+        for (const auto& [key, value] : counters.stats.items()) {
+            const bool warn = isLossCounter(key) && value.is_number() && value.get<double>() > 0;
+            page += fmt::format("<tr{}><td>{}</td><td class=\"n\">{}</td></tr>\n",
+                                warn ? " class=\"warn\"" : "", h(key),
+                                h(value.dump(-1, ' ', false, Json::error_handler_t::replace)));
+        }
+        page += "</table>\n";
+    } else {
+        page += fmt::format(
+            "<p class=\"note\" id=\"counters-source\">From the files on disk: {}. Lines missing "
+            "were removed by the sinks' disk budget before they were read; unreadable lines are "
+            "not JSON objects with a time.</p>\n",
+            h(counters.source));
+    }
+    page +=
+        "<table id=\"sink-files\">\n<tr><th>sink</th><th>files</th><th>bytes</th><th>lines</th>"
+        "<th>seq</th><th>lines missing</th><th>lines unreadable</th></tr>\n";
+    for (const auto& [sink, files] : data.sinks) {
+        page += fmt::format(
+            "<tr{}><td>{}</td><td class=\"n\">{}</td><td class=\"n\">{}</td><td class=\"n\">{}</td>"
+            "<td class=\"n\">{} to {}</td><td class=\"n\">{}</td><td class=\"n\">{}</td></tr>\n",
+            files.linesMissing + files.linesUnreadable > 0 ? " class=\"warn\"" : "", h(sink),
+            files.segments, files.bytes, files.lines, files.firstSeq, files.lastSeq,
+            files.linesMissing, files.linesUnreadable);
+    }
+    page += "</table>\n</section>\n";
+    return page;
+}
+
+}  // namespace
+
 std::string QVReportingCtlRenderReportPage(const ReportData& data, const std::string& stateDir,
                                            const ReportCounters& counters, double generated,
                                            const std::string& gnuplotProgram) {
@@ -367,65 +438,8 @@ std::string QVReportingCtlRenderReportPage(const ReportData& data, const std::st
         page += "</section>\n";
     }
 
-    // The sessions, the latest last.
-    page += "<section>\n<h2>Sessions</h2>\n";
-    const std::size_t from =
-        data.sessions.size() > kMaxTableSessions ? data.sessions.size() - kMaxTableSessions : 0;
-    page += fmt::format(
-        "<p class=\"note\">{} sessions{}; <code>qvreportctl report --summary</code> "
-        "prints them too.</p>\n",
-        data.sessions.size(),
-        from > 0 ? fmt::format(", the latest {} shown", kMaxTableSessions) : "");
-    page +=
-        "<table id=\"sessions\">\n<tr><th>reporter ID</th><th>application</th><th>service</th>"
-        "<th>started</th><th>seconds</th><th>messages</th><th>derived</th><th>issues</th></tr>\n";
-    for (std::size_t i = from; i < data.sessions.size(); ++i) {
-        const auto& s = data.sessions[i];
-        page += fmt::format(
-            "<tr><td class=\"n\">{}</td><td>{}</td><td>{}</td><td class=\"t\">{}</td><td "
-            "class=\"n\">{}</td>"
-            "<td class=\"n\">{}</td><td>{}</td><td>{}</td></tr>\n",
-            s.reporterID, h(application(s.application)), h(s.service),
-            QVReportingCtlShortUTC(s.start),
-            s.stopped ? fmt::format("{:.1f}", s.end - s.start) : "running", s.messages,
-            h(QVReportingCtlCountsText(s.derived)), h(QVReportingCtlSessionIssuesText(s)));
-    }
-    page += "</table>\n</section>\n";
-
-    // The guardrail counters, and what the sink files hold.
-    page += "<section>\n<h2>Guardrail counters</h2>\n";
-    if (counters.stats.is_object()) {
-        page += fmt::format(
-            "<p class=\"note\" id=\"counters-source\">From {}, when this report "
-            "was made. Rows in red: something was refused, dropped or lost.</p>\n"
-            "<table id=\"counters\">\n<tr><th>counter</th><th>value</th></tr>\n",
-            h(counters.source));
-        for (const auto& [key, value] : counters.stats.items()) {
-            const bool warn = isLossCounter(key) && value.is_number() && value.get<double>() > 0;
-            page += fmt::format("<tr{}><td>{}</td><td class=\"n\">{}</td></tr>\n",
-                                warn ? " class=\"warn\"" : "", h(key),
-                                h(value.dump(-1, ' ', false, Json::error_handler_t::replace)));
-        }
-        page += "</table>\n";
-    } else {
-        page += fmt::format(
-            "<p class=\"note\" id=\"counters-source\">From the files on disk: {}. Lines missing "
-            "were removed by the sinks' disk budget before they were read; unreadable lines are "
-            "not JSON objects with a time.</p>\n",
-            h(counters.source));
-    }
-    page +=
-        "<table id=\"sink-files\">\n<tr><th>sink</th><th>files</th><th>bytes</th><th>lines</th>"
-        "<th>seq</th><th>lines missing</th><th>lines unreadable</th></tr>\n";
-    for (const auto& [sink, files] : data.sinks) {
-        page += fmt::format(
-            "<tr{}><td>{}</td><td class=\"n\">{}</td><td class=\"n\">{}</td><td class=\"n\">{}</td>"
-            "<td class=\"n\">{} to {}</td><td class=\"n\">{}</td><td class=\"n\">{}</td></tr>\n",
-            files.linesMissing + files.linesUnreadable > 0 ? " class=\"warn\"" : "", h(sink),
-            files.segments, files.bytes, files.lines, files.firstSeq, files.lastSeq,
-            files.linesMissing, files.linesUnreadable);
-    }
-    page += "</table>\n</section>\n</body>\n</html>\n";
+    page += sessionsSection(data) + countersSection(data, counters);
+    page += "</body>\n</html>\n";
     return page;
 }
 
