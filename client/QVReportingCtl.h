@@ -125,6 +125,20 @@ class DefaultsCommands {
 // Prints one sink, or every sink merged by time; with follow, keeps printing new lines.
 int printSinks(const Options& options, const std::string& sink, bool follow);
 
+// --- Report (QVReportingCtlReport.cpp; data and page in QVReportingCtlReport*.cpp) ---------------
+
+struct ReportOptions {
+    std::string since;  // seconds since 1970 or ISO 8601; empty: from the first line
+    std::string until;  // the same, exclusive; empty: to the last line
+    std::string application;
+    std::string output;  // empty: report.html in the current directory
+    bool summary = false;
+};
+
+// Writes the HTML report of the state directory's sinks, or with summary prints one line per
+// session in aligned columns (one JSON document per session with --json).
+int report(const Options& options, const ReportOptions& report);
+
 // --- Fleet (QVReportingCtlFleet.cpp, built with the exporter) ----------------------------------
 
 // Where the stream is: the exporter's options of the same names.

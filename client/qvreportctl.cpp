@@ -170,6 +170,22 @@ int run(int argc, char** argv) {
     c->callback([&] { action = [&] { return fleetDevices(options, fleet); }; });
 #endif
 
+    ReportOptions reportOptions;
+    c = app.add_subcommand("report",
+                           "Write an HTML page with plots of what the sinks hold (sessions, "
+                           "playback, volume, issues, guardrail counters)");
+    c->add_option("--since", reportOptions.since,
+                  "From this time: seconds since 1970, or ISO 8601 (2026-11-26, "
+                  "2026-11-26T09:30, ...Z or +01:00; local time without a zone)");
+    c->add_option("--until", reportOptions.until, "Up to this time (left out), as --since");
+    c->add_option("--app", reportOptions.application, "One application only");
+    c->add_option("-o,--output", reportOptions.output,
+                  "The page to write (default: report.html here); its path is printed");
+    c->add_flag("--summary", reportOptions.summary,
+                "Print one line per session instead (application, service, what was derived, "
+                "issues)");
+    c->callback([&] { action = [&] { return report(options, reportOptions); }; });
+
     c = app.add_subcommand("captures",
                            "List the issue captures (logs/Audio/Captures) with their manifests");
     c->callback([&] { action = [&] { return printCaptures(options); }; });

@@ -1,0 +1,292 @@
+#include <algorithm>
+#include <cstdlib>
+#include <filesystem>
+#include <fstream>
+#include <set>
+#include <string>
+
+#include <fmt/format.h>
+#include <gtest/gtest.h>
+
+#include "QVReportingCtlReportData.h"
+#include "QVReportingCtlReportPage.h"
+
+namespace qv::client {
+namespace {
+
+namespace fs = std::filesystem;
+
+TEST(TheReportTimes, ReadSinkSecondsAndISODatesWithTheirZonesAndNothingElse) {
+    ::setenv("TZ", "UTC", 1);
+    ::tzset();
+    constexpr double kDay = 1795651200;  // 2026-11-26T00:00:00Z
+    const std::pair<const char*, std::optional<double>> cases[] = {
+        {"1795686753.25", 1795686753.25},
+        {"0", 0.0},
+        {"2026-11-26", kDay},
+        {"2026-11-26T09:52", kDay + 9 * 3600 + 52 * 60},
+        {"2026-11-26 09:52:33", kDay + 9 * 3600 + 52 * 60 + 33},
+        {"2026-11-26T09:52:33.25Z", kDay + 9 * 3600 + 52 * 60 + 33.25},
+        {"2026-11-26T09:52:33+01:00", kDay + 8 * 3600 + 52 * 60 + 33},
+        {"2026-11-26T09:52-0230", kDay + 12 * 3600 + 22 * 60},
+        {"2026-11-26T23:59:60Z", kDay + 86400},  // a leap second runs on into the next day
+        {"", std::nullopt},
+        {"yesterday", std::nullopt},
+        {"-5", std::nullopt},
+        {"1e9", std::nullopt},
+        {"1.2.3", std::nullopt},
+        {"2026-13-01", std::nullopt},
+        {"2026-11-00", std::nullopt},
+        {"2026-11-26T24:00", std::nullopt},
+        {"2026-11-26T09", std::nullopt},
+        {"2026-11-26T09:60", std::nullopt},
+        {"2026-11-26T09:52:33.", std::nullopt},
+        {"2026-11-26T09:52:33.5Q", std::nullopt},
+        {"2026-11-26T09:52+1", std::nullopt},
+        {"2026-11-26T09:52+24:00", std::nullopt},
+        {"26-11-2026", std::nullopt},
+    };
+    for (const auto& [text, expected] : cases) {
+        const auto parsed = QVReportingCtlParseReportTime(text);
+        ASSERT_EQ(parsed.has_value(), expected.has_value()) << '"' << text << '"';
+        if (expected) {
+            EXPECT_DOUBLE_EQ(*parsed, *expected) << '"' << text << '"';
+        }
+    }
+}
+
+// A state directory written by hand as the daemon writes it: two runs of the daemon (convo session
+// numbers start again), a rotated analytics sink with lines removed by the budget, a torn line.
+class TheReportData : public ::testing::Test {
+  protected:
+    void SetUp() override {
+        root_ = fs::temp_directory_path() /
+                fmt::format("qv-report-test-{}-{}", ::getpid(),
+                            ::testing::UnitTest::GetInstance()->current_test_info()->name());
+        fs::remove_all(root_);
+        fs::create_directories(root_ / "sinks");
+
+        // First run: a music session (5) and a recorder session (7), both stopped.
+        convo(
+            100,
+            R"("op":"session","session":1,"sessionInfo":{"SessionID":5,"ClientBundleID":"music"},"userInfo":{"ServiceName":"longformaudio_session"})");
+        convo(101,
+              R"("op":"message","session":1,"sessionID":5,"category":4,"type":1,"payload":{})");
+        convo(
+            102,
+            R"("op":"session","session":2,"sessionInfo":{"SessionID":7,"ClientBundleID":"rec"},"userInfo":{"ServiceName":"telephony_session"})");
+        convo(
+            103,
+            R"("op":"message","session":1,"sessionID":5,"category":7,"type":6,"payload":{"issue_type":"overload"})");
+        convo(110,
+              R"("op":"message","session":1,"sessionID":5,"category":14,"type":11,"payload":{})");
+        convo(110,
+              R"("op":"message","session":1,"sessionID":5,"category":14,"type":11,"payload":{})");
+        convo(110,
+              R"("op":"message","session":1,"sessionID":5,"category":1,"type":11,"payload":{})");
+        convo(
+            110,
+            R"("op":"message","session":1,"sessionID":5,"category":65535,"type":65535,"payload":{})");
+        convo(110, R"("op":"flush","session":1,"sessionID":5)");
+        convo(120,
+              R"("op":"message","session":2,"sessionID":7,"category":3,"type":11,"payload":{})");
+        convo(121, R"("op":"flush","session":2,"sessionID":7)");
+        // Second run: session number 1 again, a haptics session that asked for a capture and was
+        // never flushed (the daemon was killed).
+        convo(
+            200,
+            R"("op":"session","session":1,"sessionInfo":{"SessionID":9},"userInfo":{"ServiceName":"haptics_session"})");
+        convo(
+            201,
+            R"("op":"message","session":1,"sessionID":9,"category":7,"type":7,"payload":{"issue_type":"silence"})");
+        // Members of the wrong type are passed over, not thrown at.
+        convo(203, R"("op":"message","session":"1","category":"Volume","type":null)");
+        convo(204, R"("op":"message","session":1,"category":"Volume","type":null,"payload":[])");
+        write(
+            "issuecapture.jsonl", 1, 202,
+            R"("op":"snapshot","signature":{"type":"haptics","subtype":"Playback","subtypeContext":"EnergyLog"})");
+        write("mtx.jsonl", 1, 201,
+              R"("metric":5963779,"record":"EAMaB3NpbGVuY2UiAjEyKhFjb20uZXhhbXBsZS5yYWNlcg==")");
+
+        // Analytics: seq 1-2 went with a closed segment the budget removed; 3-6 are closed, then
+        // the current segment, where line 8 is not JSON.
+        const char* kClosed = "analytics.000000000003.jsonl";
+        volume(kClosed, 3, 110, "music", 1, 0.5, 6, "Speaker");
+        volume(kClosed, 4, 110, "music", 2, 0.75, 4, "Headphones");
+        write(
+            kClosed, 5, 110,
+            R"("event":"com.korvane.longformaudio.Volume.Summary","payload":{"HostApplicationDisplayID":"music","msgidx":1,"play_seconds":99,"KXSessionVolume":0.1})");
+        write(
+            kClosed, 6, 103,
+            R"("event":"com.korvane.qvsound.IO.Error","payload":{"HostApplicationDisplayID":"music","issue_type":"overload","smallest_buffer_frame_size":512})");
+        write(
+            "analytics.jsonl", 7, 120,
+            R"("event":"com.korvane.qvsound.Input.Summary","payload":{"HostApplicationDisplayID":"rec","inputrunning_seconds":3.5,"active_devices":"BuiltInMic"})");
+        append("analytics.jsonl", "{\"time\":125,\"seq\":8,not json}\n");
+        volume("analytics.jsonl", 9, 130, "music", 1, 1.0, 2, "Speaker");
+    }
+    void TearDown() override { fs::remove_all(root_); }
+
+    void append(const std::string& file, const std::string& text) {
+        std::ofstream(root_ / "sinks" / file, std::ios::app) << text;
+    }
+    void write(const std::string& file, std::uint64_t seq, double time, const std::string& rest) {
+        append(file, fmt::format("{{\"time\":{},\"seq\":{},{}}}\n", time, seq, rest));
+    }
+    void convo(double time, const std::string& rest) {
+        write("convo.jsonl", ++convoSeq_, time, rest);
+    }
+    void volume(const std::string& file, std::uint64_t seq, double time, const std::string& app,
+                int index, double volume, double seconds, const std::string& device) {
+        write(
+            file, seq, time,
+            fmt::format(
+                R"("event":"com.korvane.qvsound.Volume.Summary","payload":{{"HostApplicationDisplayID":"{}","msgidx":{},"KXSessionVolume":{},"play_seconds":{},"active_devices":"{}"}})",
+                app, index, volume, seconds, device));
+    }
+    ReportData gather(ReportFilter filter = {}) {
+        return QVReportingCtlGatherReport(root_.string(), filter);
+    }
+
+    fs::path root_;
+    std::uint64_t convoSeq_ = 0;
+};
+
+TEST_F(TheReportData, GroupsEachSessionsMessagesAcrossDaemonRunsAndSegments) {
+    const ReportData data = gather();
+    ASSERT_EQ(data.sessions.size(), 3u);
+    const auto& music = data.sessions[0];
+    EXPECT_EQ(music.reporterID, 5);
+    EXPECT_EQ(music.application, "music");
+    EXPECT_EQ(music.service, "longformaudio");
+    EXPECT_TRUE(music.stopped);
+    EXPECT_DOUBLE_EQ(music.end - music.start, 10);
+    EXPECT_EQ(music.messages, 2u);  // the mirror's folded summary is not a message
+    EXPECT_EQ(QVReportingCtlCountsText(music.derived), "summary, volume stretch x2");
+    EXPECT_EQ(QVReportingCtlSessionIssuesText(music), "overload");
+    EXPECT_EQ(QVReportingCtlCountsText(data.sessions[1].derived), "input stretch");
+    const auto& haptics = data.sessions[2];
+    EXPECT_EQ(haptics.service, "haptics");
+    EXPECT_EQ(haptics.messages, 2u);
+    EXPECT_FALSE(haptics.stopped);
+    EXPECT_EQ(QVReportingCtlSessionIssuesText(haptics), "capture, silence");
+
+    // Playback time counts each stretch once (the service-named event is the same message).
+    EXPECT_DOUBLE_EQ(data.usage.at("music").at("Speaker").playSeconds, 8);
+    EXPECT_DOUBLE_EQ(data.usage.at("music").at("Headphones").playSeconds, 4);
+    EXPECT_DOUBLE_EQ(data.usage.at("rec").at("BuiltInMic").recordSeconds, 3.5);
+    ASSERT_EQ(data.playbacks.size(), 2u);
+    EXPECT_EQ(data.playbacks[0].stretches.size(), 2u);
+    EXPECT_DOUBLE_EQ(data.playbacks[0].stretches[1].volume, 0.75);
+    EXPECT_EQ(data.playbacks[1].stretches.size(), 1u);
+
+    std::vector<std::string> issues;
+    for (const auto& issue : data.issues) {
+        issues.push_back(fmt::format("{} {} {} {}", issue.time,
+                                     QVReportingCtlIssueKindName(issue.kind), issue.application,
+                                     issue.detail));
+    }
+    EXPECT_EQ(issues, (std::vector<std::string>{
+                          "103 overload music IO.Error, 512 frames",
+                          "201 MTX record com.example.racer silence on node 12, 3 s",
+                          "202 capture  haptics / Playback / EnergyLog",
+                      }));
+
+    const auto& analytics = data.sinks.at("analytics");
+    EXPECT_EQ(analytics.segments, 2u);
+    EXPECT_EQ(analytics.lines, 7u);
+    EXPECT_EQ(analytics.firstSeq, 3u);
+    EXPECT_EQ(analytics.lastSeq, 9u);
+    EXPECT_EQ(analytics.linesMissing, 2u);  // 1 and 2
+    EXPECT_EQ(data.sinks.at("convo").lines, 15u);
+    EXPECT_EQ(data.sinks.at("convo").linesUnreadable, 0u);
+    EXPECT_EQ(analytics.linesUnreadable, 1u);
+    EXPECT_DOUBLE_EQ(data.first, 100);
+    EXPECT_DOUBLE_EQ(data.last, 204);  // the unflushed session's last message
+}
+
+TEST_F(TheReportData, KeepsWhatLiesFromSinceUpToUntilAndOneApplication) {
+    struct Case {
+        std::optional<double> since, until;
+        std::string app;
+        std::size_t sessions, playbacks, issues;
+    };
+    const Case cases[] = {
+        {100, 102, "", 1, 0, 0},           // the session at 102 is left out
+        {102, 200.5, "", 2, 2, 1},         // since is kept, until is not
+        {110, std::nullopt, "", 1, 2, 2},  // stretches from 110, issues at 201 and 202
+        {std::nullopt, std::nullopt, "music", 1, 2, 1},
+        {std::nullopt, std::nullopt, "nobody", 0, 0, 0},
+        {300, std::nullopt, "", 0, 0, 0},
+    };
+    for (const auto& c : cases) {
+        const ReportData data = gather({c.since, c.until, c.app});
+        const std::string what =
+            fmt::format("[{}, {}) {}", c.since.value_or(-1), c.until.value_or(-1), c.app);
+        EXPECT_EQ(data.sessions.size(), c.sessions) << what;
+        EXPECT_EQ(data.playbacks.size(), c.playbacks) << what;
+        EXPECT_EQ(data.issues.size(), c.issues) << what;
+        EXPECT_EQ(data.empty(), c.sessions + c.playbacks + c.issues == 0) << what;
+    }
+    EXPECT_THROW(QVReportingCtlGatherReport((root_ / "missing").string(), {}), std::runtime_error);
+    EXPECT_THROW(QVReportingCtlGatherReport((root_ / "sinks").string(), {}), std::runtime_error);
+}
+
+// The value of an attribute of the element that starts at `at`.
+std::string attribute(const std::string& page, std::size_t at, const std::string& name) {
+    const std::string key = " " + name + "=\"";
+    const auto begin = page.find(key, at) + key.size();
+    return page.substr(begin, page.find('"', begin) - begin);
+}
+
+TEST_F(TheReportData, MakesAPageWhosePlotsCarryTheirPointsOrSayTheyHaveNone) {
+    const ReportCounters counters{nullptr, "no daemon runs on the system bus"};
+    const std::string page = QVReportingCtlRenderReportPage(gather(), root_.string(), counters, 0);
+    std::map<std::string, int> points;
+    for (auto at = page.find("<figure class=\"plot"); at != std::string::npos;
+         at = page.find("<figure class=\"plot", at + 1)) {
+        points[attribute(page, at, "id")] = std::stoi(attribute(page, at, "data-points"));
+    }
+    EXPECT_EQ(points, (std::map<std::string, int>{{"plot-sessions", 3},
+                                                  {"plot-usage-application", 2},
+                                                  {"plot-usage-device", 3},
+                                                  {"plot-volume", 3},
+                                                  {"plot-issues", 3}}));
+    // Five inline SVGs whose ids do not collide, and nothing fetched from elsewhere.
+    std::set<std::string> ids;
+    for (const char quote : {'\'', '"'}) {
+        const std::string key = std::string("id=") + quote;
+        for (auto at = page.find(key); at != std::string::npos; at = page.find(key, at + 1)) {
+            const auto begin = at + key.size();
+            const std::string id = page.substr(begin, page.find(quote, begin) - begin);
+            EXPECT_TRUE(ids.insert(id).second) << "id used twice: " << id;
+        }
+    }
+    EXPECT_NE(page.find("plot-volume-gnuplot_plot_1"), std::string::npos);
+    EXPECT_EQ(page.find("<?xml"), std::string::npos);
+    EXPECT_EQ(page.find("src="), std::string::npos);
+    EXPECT_EQ(page.find("href=\"http"), std::string::npos);
+    EXPECT_NE(page.find("From the files on disk: no daemon runs on the system bus"),
+              std::string::npos);
+
+    const std::string empty =
+        QVReportingCtlRenderReportPage(gather({300, 400, ""}), root_.string(), counters, 0);
+    EXPECT_NE(empty.find("id=\"no-data\""), std::string::npos);
+    EXPECT_EQ(empty.find("<svg"), std::string::npos);
+    std::size_t emptyPlots = 0;
+    for (auto at = empty.find("data-points=\"0\""); at != std::string::npos;
+         at = empty.find("data-points=\"0\"", at + 1)) {
+        ++emptyPlots;
+    }
+    EXPECT_EQ(emptyPlots, 5u);
+
+    try {
+        QVReportingCtlRenderReportPage(gather(), root_.string(), counters, 0, "qv-no-such-gnuplot");
+        ADD_FAILURE() << "no error without gnuplot";
+    } catch (const QVReportingCtlGnuplotError& e) {
+        EXPECT_NE(std::string(e.what()).find("gnuplot-nox"), std::string::npos) << e.what();
+    }
+}
+
+}  // namespace
+}  // namespace qv::client
