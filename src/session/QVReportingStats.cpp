@@ -170,6 +170,10 @@ void QVReportingStats::noteBusReadsPaused() {
     busReadsPaused_.fetch_add(1, std::memory_order_relaxed);
 }
 
+void QVReportingStats::noteDirectConnection() {
+    directConnectionsAccepted_.fetch_add(1, std::memory_order_relaxed);
+}
+
 Dictionary QVReportingStats::dump() const {
     Dictionary out;
     std::uint64_t limitsTotal = 0;
@@ -215,6 +219,7 @@ Dictionary QVReportingStats::dump() const {
     out.set("held_calls", heldCalls_.load());
     out.set("held_calls_max", heldCallsMax_.load());
     out.set("bus_reads_paused", busReadsPaused_.load());
+    out.set("direct_connections_accepted", directConnectionsAccepted_.load());
     // Files on disk.
     out.set("files_refused", filesRefused_.load());
     {
@@ -246,6 +251,7 @@ void QVReportingStats::TEST_reset() {
     heldCalls_.store(0);
     heldCallsMax_.store(0);
     busReadsPaused_.store(0);
+    directConnectionsAccepted_.store(0);
     std::lock_guard lock(mutex_);
     sinkLinesLost_.clear();
     issueCaptureRefused_.clear();
