@@ -244,6 +244,8 @@ bool QVReportingDBusServer::processConnections() {
     bool busy = false;
     // Reads one connection for a turn; false once it has closed.
     auto turn = [&](Connection& c) {
+        // The work of the turn's calls wakes the server queue once, when the turn ends.
+        SerialQueue::WakeBatch batch(service_.queue());
         for (int i = 0; i < kCallsPerTurn && callBytes_ < limits_.maxCallBytes && !stopping_; ++i) {
             const int r = sd_bus_process(c.bus, nullptr);
             if (r < 0 || (c.direct && sd_bus_is_open(c.bus) <= 0)) {
