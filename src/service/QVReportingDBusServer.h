@@ -148,7 +148,7 @@ class QVReportingDBusServer {
     static int onNameOwnerChanged(sd_bus_message* signal, void* userdata, sd_bus_error* error);
     void emitPosted(const std::string& name, std::uint64_t state);
 
-    // ---- budgets and answers (QVReportingDBusServer.cpp) ----
+    // ---- budgets and answers (QVReportingDBusBudgets.cpp) ----
     // On the loop thread: the client of the call's connection, accepted on its first call, when
     // the call fits the client's budgets (held: a call that waits for a later event); null when
     // the call was refused instead (too many clients, or past a budget: answered with an error).

@@ -6,11 +6,17 @@ namespace qv {
 
 namespace {
 
-constexpr std::string_view kLimitNames[] = {
-    "payload_bytes",          "payload_values",        "payload_depth",
-    "reporter_ids",           "sessions_per_client",   "clients",
-    "call_bytes_per_client",  "held_calls_per_client", "held_calls",
-    "payload_rate_per_client"};
+constexpr std::string_view kLimitNames[] = {"payload_bytes",
+                                            "payload_values",
+                                            "payload_depth",
+                                            "reporter_ids",
+                                            "sessions_per_client",
+                                            "clients",
+                                            "call_bytes_per_client",
+                                            "held_calls_per_client",
+                                            "held_calls",
+                                            "payload_rate_per_client",
+                                            "direct_replies_unread"};
 
 void raiseMax(std::atomic<std::uint64_t>& max, std::uint64_t value) {
     std::uint64_t seen = max.load();

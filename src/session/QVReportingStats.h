@@ -73,7 +73,9 @@ class QVReportingStats {
         CallBytesPerClient,
         HeldCallsPerClient,
         HeldCalls,
-        PayloadRatePerClient
+        PayloadRatePerClient,
+        // A direct connection whose client left this many replies unread was closed.
+        DirectRepliesUnread
     };
 
     static QVReportingStats& shared();
@@ -151,7 +153,7 @@ class QVReportingStats {
     void TEST_reset();
 
   private:
-    static constexpr std::size_t kLimitKinds = 10;
+    static constexpr std::size_t kLimitKinds = 11;
     // At most this many distinct sink names are tracked; sinks are few and named by the daemon.
     static constexpr std::size_t kMaxTrackedSinks = 32;
 

@@ -1,7 +1,9 @@
 """qvreportd's direct socket: the bus's interface on peer-to-peer connections, one client each."""
 
 import os
+import socket
 import stat
+import struct
 import subprocess
 import sys
 import time
@@ -15,6 +17,18 @@ from harness import Daemon, DaemonTestCase, DirectClient, OBJECT_PATH, INTERFACE
 PLAYBACK, START, STOP = 4, 1, 2
 TEST_SERVICE = 11
 LIMITS = "org.freedesktop.DBus.Error.LimitsExceeded"
+
+
+def method_call(serial, path, interface, member):
+    """A method call without arguments as it travels (little-endian D-Bus wire format)."""
+    def pad(data, to):
+        return data + b"\0" * (-len(data) % to)
+    fields = b""
+    for code, value in ((1, path), (2, interface), (3, member)):
+        text = value.encode()
+        fields = pad(fields, 8) + bytes([code, 1]) + (b"o" if code == 1 else b"s") + b"\0"
+        fields += struct.pack("<I", len(text)) + text + b"\0"
+    return pad(b"l\x01\x00\x01" + struct.pack("<III", 0, serial, len(fields)) + fields, 8)
 
 
 def outcome(call):
@@ -104,6 +118,26 @@ class DirectSocket(DaemonTestCase):
         self.assertEqual({u["payload"]["processName"] for u in uptimes}, {"python3"})
         wait_until(lambda: self.direct_client().stats.GetStats()["direct_clients"] == 0,
                    what="the direct client to be dropped")
+
+    def test_a_client_that_leaves_its_replies_unread_is_cut_off_and_counted(self):
+        reader = self.direct_client()
+        deaf = socket.socket(socket.AF_UNIX, socket.SOCK_STREAM)
+        self.addCleanup(deaf.close)
+        deaf.settimeout(60)
+        deaf.connect(self.direct_socket)
+        deaf.sendall(b"\0AUTH EXTERNAL " + str(os.getuid()).encode().hex().encode() + b"\r\n")
+        self.assertTrue(deaf.recv(128).startswith(b"OK "))
+        deaf.sendall(b"BEGIN\r\n")
+        calls = b"".join(method_call(serial, OBJECT_PATH, INTERFACE, "GetAllReporters")
+                         for serial in range(1, 120001))
+        try:
+            deaf.sendall(calls)  # its replies are never read
+        except OSError:
+            pass  # cut off before all were sent
+        wait_until(lambda: reader.stats.GetStats()["limit_exceeded_direct_replies_unread"] == 1,
+                   timeout=30, what="the deaf client to be cut off")
+        self.assertEqual(reader.stats.GetStats()["direct_connections"], 1)
+        self.assertEqual(list(reader.reporting.GetAllReporters()), [])
 
     def test_only_root_may_kill_over_the_socket_and_the_socket_goes_with_a_clean_stop(self):
         os.chmod(self.workdir, 0o755)  # so that nobody reaches the socket
