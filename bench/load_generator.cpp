@@ -507,10 +507,11 @@ int main(int argc, char** argv) {
             const double busRatio = b.messagesPerSecond / t.messagesPerSecond;
             const double directRatio = d.messagesPerSecond / b.messagesPerSecond;
             std::printf(
-                "%-7d %-9s | %9.0f %8.0f | %9.0f %8.0f %6.2f | %9.0f %8.0f %6.2f | %9.1f %9.1f%s\n",
+                "%-7d %-9s | %9.0f %8.0f | %9.0f %8.0f %6.2f | %9.0f %8.0f %6.2f | %8.1f %8.1f "
+                "%9.1f%s\n",
                 clients, pipelined ? "pipelined" : "serial", t.messagesPerSecond, t.p99,
                 b.messagesPerSecond, b.p99, busRatio, d.messagesPerSecond, d.p99, directRatio,
-                b.cpuMicrosPerMessage, d.cpuMicrosPerMessage,
+                t.cpuMicrosPerMessage, b.cpuMicrosPerMessage, d.cpuMicrosPerMessage,
                 t.errors + b.errors + d.errors ? "  (errors!)" : "");
             if (pipelined && (busRatio < 0.8 || b.p99 > 2 * t.p99)) {
                 busMet = false;
