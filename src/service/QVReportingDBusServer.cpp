@@ -75,6 +75,8 @@ QVReportingDBusServer::~QVReportingDBusServer() {
         sd_bus_close_unref(c.bus);
     }
     directConnections_.clear();
+    // Each slot holds a reference on its bus.
+    nameOwnerChangedSlot_ = sd_bus_slot_unref(nameOwnerChangedSlot_);
     unregisterObjects(bus_);
     sd_bus_flush_close_unref(bus_.bus);
     ::close(wakeFd_);
