@@ -282,12 +282,17 @@ int main(int argc, char** argv) {
     QVReportingSystemMonitor::initializeWithQueue(queue, platform);
     QVReportingService service(platform, queue, options->limits);
 
-    std::unique_ptr<QVReportingDBusServer> server;
+    std::unique_ptr<QVReportingDirectSocket> direct;
     try {
-        std::unique_ptr<QVReportingDirectSocket> direct;
         if (!options->directSocket.empty()) {
             direct = QVReportingDirectSocket::listen(options->directSocket);
         }
+    } catch (const std::runtime_error& e) {
+        QVLOG_ERROR(logCategory(), "cannot listen for direct connections: {}", e.what());
+        return 1;
+    }
+    std::unique_ptr<QVReportingDBusServer> server;
+    try {
         server = std::make_unique<QVReportingDBusServer>(connectTo(options->bus), service,
                                                          &notifications, std::move(direct));
         server->start();
