@@ -68,16 +68,7 @@ QVReportingDBusServer::~QVReportingDBusServer() {
         lifeline_->server = nullptr;
     }
     stop();
-    pending_.clear();
-    // Left open when the loop ended on its own (the bus was lost).
-    for (Connection& c : directConnections_) {
-        unregisterObjects(c);
-        sd_bus_close_unref(c.bus);
-    }
-    directConnections_.clear();
-    // Each slot holds a reference on its bus.
-    nameOwnerChangedSlot_ = sd_bus_slot_unref(nameOwnerChangedSlot_);
-    unregisterObjects(bus_);
+    closeConnections();  // when the loop never ran
     sd_bus_flush_close_unref(bus_.bus);
     ::close(wakeFd_);
 }
@@ -87,17 +78,8 @@ void QVReportingDBusServer::stop() {
         notifications_->setPostObserver(nullptr);
     }
     if (loopThread_.joinable()) {
-        // Unregister on the loop thread, which alone touches the connections, then end the loop.
-        post([this] {
-            unregisterObjects(bus_);
-            nameOwnerChangedSlot_ = sd_bus_slot_unref(nameOwnerChangedSlot_);
-            while (!directConnections_.empty()) {
-                closeDirectConnection(directConnections_.begin());
-            }
-            direct_.reset();
-            pending_.clear();
-            stopping_ = true;
-        });
+        // The loop ends, and its thread lets go of what it served (closeConnections()).
+        post([this] { stopping_ = true; });
         loopThread_.join();
     }
 }
@@ -131,6 +113,7 @@ void QVReportingDBusServer::start() {
     loopThread_ = std::thread([this] {
         loop();
         drainPosted(true);
+        closeConnections();
     });
 }
 
@@ -148,6 +131,18 @@ bool QVReportingDBusServer::registerObjects(Connection& c) {
            (!notifications_ ||
             add(dbus::kNotifyObjectPath, dbus::kNotifyInterface, kNotifyVtable)) &&
            (!c.direct || add("/org/freedesktop/DBus", "org.freedesktop.DBus", kPeerBusVtable));
+}
+
+void QVReportingDBusServer::closeConnections() {
+    unregisterObjects(bus_);
+    // Each slot holds a reference on its bus.
+    nameOwnerChangedSlot_ = sd_bus_slot_unref(nameOwnerChangedSlot_);
+    // The daemon leaves, not its clients: as on the bus, they are not invalidated.
+    while (!directConnections_.empty()) {
+        closeDirectConnection(directConnections_.begin(), false);
+    }
+    direct_.reset();
+    pending_.clear();
 }
 
 void QVReportingDBusServer::unregisterObjects(Connection& c) {
@@ -399,7 +394,8 @@ void QVReportingDBusServer::acceptDirectConnections() {
     }
 }
 
-void QVReportingDBusServer::closeDirectConnection(std::list<Connection>::iterator it) {
+void QVReportingDBusServer::closeDirectConnection(std::list<Connection>::iterator it,
+                                                  bool clientLeft) {
     const std::string key = it->key;
     unregisterObjects(*it);
     if (it->bus) {
@@ -407,7 +403,9 @@ void QVReportingDBusServer::closeDirectConnection(std::list<Connection>::iterato
     }
     directConnections_.erase(it);
     directCount_ = directConnections_.size();
-    clientGone(key);
+    if (clientLeft) {
+        clientGone(key);
+    }
 }
 
 int QVReportingDBusServer::onNameOwnerChanged(sd_bus_message* signal, void* userdata,

@@ -67,9 +67,10 @@ class QVReportingDBusServer {
     bool post(std::function<void()> fn);
     // Blocks until every reply and signal posted so far has been handed to the connections.
     void flush();
-    // Leaves the bus and closes the direct connections: unregisters the objects first, then ends
-    // the loop. Work still queued elsewhere may answer calls afterwards (the answers are
-    // dropped), so the server must outlive it: stop, drain the queues, then destroy.
+    // Leaves the bus and closes the direct connections: ends the loop, whose thread then
+    // unregisters the objects and closes the connections. Work still queued elsewhere may answer
+    // calls afterwards (the answers are dropped), so the server must outlive it: stop, drain the
+    // queues, then destroy.
     void stop();
 
     // The clients now served over the bus, and the direct connections open (for the stats).
@@ -134,13 +135,17 @@ class QVReportingDBusServer {
     // Registers the objects on a connection; false when sd-bus refused.
     bool registerObjects(Connection& connection);
     void unregisterObjects(Connection& connection);
+    // Once the loop has ended: unregisters everything, closes the direct connections and the
+    // direct socket, and drops the calls still kept.
+    void closeConnections();
     void loop();
     // Reads each connection for a burst of calls; true when any had something.
     bool processConnections();
     // Waits for any connection, the direct socket or a post.
     void waitForWork();
     void acceptDirectConnections();
-    void closeDirectConnection(std::list<Connection>::iterator it);
+    // With clientLeft, the connection's client is gone too (as when its name leaves the bus).
+    void closeDirectConnection(std::list<Connection>::iterator it, bool clientLeft = true);
     // Runs what was posted; with last, also marks the loop as ended so nothing waits on it.
     void drainPosted(bool last = false);
     // A client's connection is gone: its kept calls are dropped and it is invalidated.
