@@ -1,5 +1,7 @@
 #include "QVReportingClient.h"
 
+#include <sys/stat.h>
+
 #include <future>
 #include <limits>
 #include <type_traits>
@@ -16,6 +18,7 @@ constexpr const char* kErrorNameHasNoOwner = "org.freedesktop.DBus.Error.NameHas
 constexpr const char* kErrorAccessDenied = "org.freedesktop.DBus.Error.AccessDenied";
 constexpr const char* kErrorNoReply = "org.freedesktop.DBus.Error.NoReply";
 constexpr const char* kErrorFailed = "org.freedesktop.DBus.Error.Failed";
+constexpr const char* kErrorDisconnected = "org.freedesktop.DBus.Error.Disconnected";
 
 constexpr const char* kBusDaemonName = "org.freedesktop.DBus";
 constexpr const char* kBusDaemonPath = "/org/freedesktop/DBus";
@@ -25,6 +28,10 @@ constexpr const char* kBusDaemonInterface = "org.freedesktop.DBus";
 // UINT64_MAX as "none". A start reply is held for as long as the session runs, so the default
 // would fail every session longer than 25 s with NoReply.
 constexpr std::uint64_t kNoTimeout = std::numeric_limits<std::uint64_t>::max();
+
+// A broken connection's loop is entered again this often, each time failing what was still
+// waiting for a reply, before it is left for good.
+constexpr int kLoopFailuresBeforeGivingUp = 64;
 
 // Runs a blocking call, turning a bus error into ours.
 template <typename F>
@@ -51,6 +58,11 @@ struct Waiter {
     }
     T wait() { return promise.get_future().get(); }
 };
+
+// The call failed because the connection itself ended (the daemon on its far end left).
+bool isConnectionGone(const QVReportingClientError& e) {
+    return e.name() == kErrorNoReply || e.name() == kErrorDisconnected;
+}
 
 QVReportingClientError notRunningError() {
     return {kErrorNameHasNoOwner,
@@ -93,7 +105,8 @@ QVReportingClientError QVReportingClientError::fromDBus(const sdbus::Error& erro
 // --- Connecting -------------------------------------------------------------------------------
 
 std::unique_ptr<QVReportingClient> QVReportingClient::make(
-    const std::function<std::unique_ptr<sdbus::IConnection>()>& open, const std::string& what) {
+    const std::function<std::unique_ptr<sdbus::IConnection>()>& open, const std::string& what,
+    bool direct) {
     std::unique_ptr<sdbus::IConnection> connection;
     try {
         connection = open();
@@ -101,7 +114,7 @@ std::unique_ptr<QVReportingClient> QVReportingClient::make(
         throw QVReportingClientError(e.getName(),
                                      "cannot connect to " + what + ": " + e.getMessage());
     }
-    return std::unique_ptr<QVReportingClient>(new QVReportingClient(std::move(connection)));
+    return std::unique_ptr<QVReportingClient>(new QVReportingClient(std::move(connection), direct));
 }
 
 std::unique_ptr<QVReportingClient> QVReportingClient::connectToSystemBus() {
@@ -131,21 +144,74 @@ std::unique_ptr<QVReportingClient> QVReportingClient::connect(const std::string&
     return connectToAddress(bus);
 }
 
-QVReportingClient::QVReportingClient(std::unique_ptr<sdbus::IConnection> connection)
-    : connection_(std::move(connection)) {
+QVReportingClient::QVReportingClient(std::unique_ptr<sdbus::IConnection> connection, bool direct)
+    : connection_(std::move(connection)), direct_(direct) {
     translated([&] {
         reporting_ = sdbus::createProxy(*connection_, dbus::kBusName, dbus::kObjectPath);
         notify_ = sdbus::createProxy(*connection_, dbus::kBusName, dbus::kNotifyObjectPath);
         bus_ = sdbus::createProxy(*connection_, kBusDaemonName, kBusDaemonPath);
-        connection_->enterEventLoopAsync();
         return 0;
     });
+    // The event loop runs on a thread of the client's own rather than sdbus-c++'s, whose thread
+    // ends the process when its connection breaks: a direct connection breaks whenever the
+    // daemon restarts. Broken, the loop is entered again, so that sd-bus fails every call still
+    // waiting (NoReply) instead of leaving it waiting for ever; then it ends.
+    loopThread_ = std::thread([this] {
+        for (int failures = 0; failures < kLoopFailuresBeforeGivingUp;) {
+            try {
+                connection_->enterEventLoop();
+                return;
+            } catch (const sdbus::Error&) {
+                ++failures;
+            }
+        }
+    });
+}
+
+std::unique_ptr<QVReportingClient> QVReportingClient::connectDirect(const std::string& path) {
+    // The daemon's socket answers Hello as a bus would, so a connection opened as to a bus works
+    // there unchanged.
+    return make([&] { return sdbus::createSessionBusConnectionWithAddress("unix:path=" + path); },
+                "the daemon's direct socket " + path, true);
+}
+
+std::unique_ptr<QVReportingClient> QVReportingClient::connect(const std::string& bus,
+                                                              QVReportingTransport transport,
+                                                              const std::string& directSocket) {
+    const std::string path = !directSocket.empty() ? directSocket
+                             : bus == "system"     ? std::string(kQVReportingDefaultDirectSocket)
+                                                   : std::string();
+    switch (transport) {
+        case QVReportingTransport::Bus:
+            return connect(bus);
+        case QVReportingTransport::Direct:
+            if (path.empty()) {
+                throw QVReportingClientError(kErrorFailed,
+                                             "no direct socket for the bus " + bus + ": name one");
+            }
+            return connectDirect(path);
+        case QVReportingTransport::Auto:
+            break;
+    }
+    struct stat st {};
+    if (!path.empty() && ::stat(path.c_str(), &st) == 0 && S_ISSOCK(st.st_mode)) {
+        try {
+            return connectDirect(path);
+        } catch (const QVReportingClientError&) {
+            // A socket left by a daemon that is gone, or one this user may not open: the bus
+            // still reaches the daemon (and can start it).
+        }
+    }
+    return connect(bus);
 }
 
 QVReportingClient::~QVReportingClient() {
     // Stop the event-loop thread first, so no reply handler runs while the proxies go; the
     // proxies then drop their pending calls without calling them.
     connection_->leaveEventLoop();
+    if (loopThread_.joinable()) {
+        loopThread_.join();
+    }
     bus_.reset();
     notify_.reset();
     reporting_.reset();
@@ -296,8 +362,9 @@ void QVReportingClient::killService() {
     try {
         invoke<bool>(dbus::kKillService);
     } catch (const QVReportingClientError& e) {
-        // The daemon never answers; the bus answers NoReply for it when it leaves.
-        if (e.name() != kErrorNoReply || daemonOwner() == owner) {
+        // The daemon never answers; the bus answers NoReply for it when it leaves, and a direct
+        // connection breaks with it.
+        if (direct_ ? !isConnectionGone(e) : e.name() != kErrorNoReply || daemonOwner() == owner) {
             throw;
         }
     }
@@ -430,7 +497,11 @@ void QVReportingClient::killServiceAsync(Done reply) {
             (*shared)(&notRunning);
             return;
         }
-        auto onKillReply = [shared, askOwner, owner](const QVReportingClientError& e) {
+        auto onKillReply = [this, shared, askOwner, owner](const QVReportingClientError& e) {
+            if (direct_ && isConnectionGone(e)) {
+                (*shared)(nullptr);
+                return;
+            }
             if (e.name() != kErrorNoReply) {
                 (*shared)(&e);
                 return;

@@ -1,6 +1,7 @@
 // The client side of the audio reporting daemon's bus interface: one connection to the system
-// bus, the session bus or a bus address, and the daemon's operations over it, each both blocking
-// and asynchronous.
+// bus, the session bus or a bus address, or straight to the daemon's direct socket (the same
+// interface, peer to peer, without the broker: each call costs less), and the daemon's operations
+// over it, each both blocking and asynchronous.
 //
 // Sessions belong to the connection that created them: when a QVReportingClient goes away, the
 // daemon stops and drops every session it made. Operations on reporter IDs of other connections
@@ -25,6 +26,7 @@
 #include <memory>
 #include <stdexcept>
 #include <string>
+#include <thread>
 #include <vector>
 
 #include <sdbus-c++/IConnection.h>
@@ -57,6 +59,13 @@ class QVReportingClientError : public std::runtime_error {
     std::string message_;
 };
 
+// How a client reaches the daemon. Auto takes the daemon's direct socket when one is there and
+// answers, and the bus otherwise.
+enum class QVReportingTransport { Auto, Bus, Direct };
+
+// The daemon's direct socket when it runs as the system service.
+inline constexpr const char* kQVReportingDefaultDirectSocket = "/run/qvreportd/direct";
+
 class QVReportingClient {
   public:
     // Callbacks of asynchronous calls: error is null on success, and result is then the reply.
@@ -70,6 +79,15 @@ class QVReportingClient {
     static std::unique_ptr<QVReportingClient> connectToAddress(const std::string& address);
     // "system", "session", or anything else taken as a bus address ("unix:path=...").
     static std::unique_ptr<QVReportingClient> connect(const std::string& bus);
+    // Connects to the daemon's direct socket at path.
+    static std::unique_ptr<QVReportingClient> connectDirect(const std::string& path);
+    // The transport chosen: directSocket names the daemon's socket; empty, the system service's
+    // (kQVReportingDefaultDirectSocket) when bus is "system", and none otherwise.
+    static std::unique_ptr<QVReportingClient> connect(const std::string& bus,
+                                                      QVReportingTransport transport,
+                                                      const std::string& directSocket = "");
+    // Whether this client talks to the daemon over its direct socket.
+    bool isDirect() const { return direct_; }
 
     ~QVReportingClient();
     QVReportingClient(const QVReportingClient&) = delete;
@@ -124,9 +142,10 @@ class QVReportingClient {
     void killServiceAsync(Done reply);
 
   private:
-    explicit QVReportingClient(std::unique_ptr<sdbus::IConnection> connection);
+    QVReportingClient(std::unique_ptr<sdbus::IConnection> connection, bool direct);
     static std::unique_ptr<QVReportingClient> make(
-        const std::function<std::unique_ptr<sdbus::IConnection>()>& open, const std::string& what);
+        const std::function<std::unique_ptr<sdbus::IConnection>()>& open, const std::string& what,
+        bool direct = false);
 
     sdbus::MethodCall call(const char* method);
     // A blocking call of a Reporting method with its arguments; T is the reply's type or void.
@@ -145,6 +164,8 @@ class QVReportingClient {
     std::unique_ptr<sdbus::IProxy> reporting_;
     std::unique_ptr<sdbus::IProxy> notify_;
     std::unique_ptr<sdbus::IProxy> bus_;  // the bus daemon itself, for name ownership
+    bool direct_ = false;
+    std::thread loopThread_;  // the connection's event loop
 };
 
 }  // namespace qv::client

@@ -41,6 +41,10 @@ struct Failure {
 
 struct Options {
     std::string bus = "system";
+    // How to reach the daemon, and its direct socket (empty: the system service's, for the
+    // system bus).
+    qv::client::QVReportingTransport transport = qv::client::QVReportingTransport::Auto;
+    std::string directSocket;
     std::string stateDir;
     bool json = false;
 };

@@ -22,7 +22,8 @@ constexpr auto kStartReplyWait = std::chrono::seconds(5);
 
 QVReportingClient& BusCommands::client() {
     if (!client_) {
-        client_ = QVReportingClient::connect(options_.bus);
+        client_ =
+            QVReportingClient::connect(options_.bus, options_.transport, options_.directSocket);
     }
     return *client_;
 }

@@ -4,6 +4,7 @@
 #include <exception>
 #include <functional>
 #include <iostream>
+#include <map>
 #include <string>
 #include <vector>
 
@@ -28,6 +29,17 @@ int run(int argc, char** argv) {
     app.require_subcommand(1);
     app.add_option("--bus", options.bus, "Bus: system, session, or a bus address (unix:path=...)")
         ->capture_default_str();
+    const std::map<std::string, qv::client::QVReportingTransport> transports{
+        {"auto", qv::client::QVReportingTransport::Auto},
+        {"bus", qv::client::QVReportingTransport::Bus},
+        {"direct", qv::client::QVReportingTransport::Direct}};
+    app.add_option("--transport", options.transport,
+                   "How to reach the daemon: auto (its direct socket when there, else the bus), "
+                   "bus, or direct")
+        ->transform(CLI::CheckedTransformer(transports, CLI::ignore_case));
+    app.add_option("--direct-socket", options.directSocket,
+                   "The daemon's direct socket; default: /run/qvreportd/direct with the system "
+                   "bus, none with another");
     app.add_option("--state-dir", options.stateDir,
                    "The daemon's state directory (defaults/, sinks/); default: "
                    "$STATE_DIRECTORY, /var/lib/qvreportd for root, else "

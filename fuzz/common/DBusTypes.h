@@ -13,6 +13,8 @@
 #include <sdbus-c++/Message.h>
 #include <sdbus-c++/Types.h>
 
+typedef struct sd_bus_message sd_bus_message;
+
 #include "common/FuzzSupport.h"
 
 namespace qv::fuzz {
@@ -184,6 +186,14 @@ inline void walk(sdbus::Message& m) {
         }
     }
 }
+
+// The sd_bus_message under an sdbus-c++ message (the daemon's readers take sd-bus's own), which
+// sdbus-c++ keeps protected: a pointer to the member, taken in a derived class, reads it.
+struct RawMessage : sdbus::Message {
+    static sd_bus_message* of(const sdbus::Message& message) {
+        return static_cast<sd_bus_message*>(message.*(&RawMessage::msg_));
+    }
+};
 
 inline bool libraryReads(sdbus::Message& m) {
     m.rewind(true);

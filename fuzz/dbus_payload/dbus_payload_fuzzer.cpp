@@ -56,6 +56,7 @@ using qv::fuzz::kMaxMessageNesting;
 using qv::fuzz::libraryReads;
 using qv::fuzz::makeBoundedType;
 using qv::fuzz::nestingOf;
+using qv::fuzz::RawMessage;
 using qv::fuzz::signatureOf;
 using qv::fuzz::Type;
 
@@ -270,7 +271,7 @@ bool build(FuzzInput& in, int fd, Built& out) {
 
 QVReportingDecodeResult decode(sdbus::Message& message, const QVReportingInputBudget& budget) {
     message.rewind(true);
-    return qv::QVReportingReadDictionary(message, budget);
+    return qv::QVReportingReadDictionary(RawMessage::of(message), budget);
 }
 
 constexpr std::size_t kUnlimited = std::numeric_limits<std::size_t>::max();
@@ -295,7 +296,7 @@ QVReportingInputBudget budgetFrom(FuzzInput& in) {
 // The message read from its bytes; nothing when it cannot be sent (it carries a unix fd).
 std::optional<QVReportingDecodeResult> readWire(const sdbus::Message& message,
                                                 const QVReportingInputBudget& budget) {
-    const auto bytes = qv::QVReportingDBusMessageBytes::forThisThread().of(message);
+    const auto bytes = qv::QVReportingDBusMessageBytes::forThisThread().of(RawMessage::of(message));
     if (!bytes) {
         return std::nullopt;
     }
@@ -354,7 +355,8 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
             std::uint32_t category = 0;
             std::uint16_t type = 0;
             std::vector<std::int64_t> ids;
-            qv::QVReportingReadRest(built.message, *wire, category, type, ids);
+            check(
+                qv::QVReportingReadRest(RawMessage::of(built.message), *wire, category, type, ids));
             check(category == built.category && type == built.type && ids == built.ids);
         }
     } else {
@@ -378,7 +380,7 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
     // Written back and read again (the daemon's own encoding may take more bytes than the
     // client's, never more values or depth).
     sdbus::PlainMessage again = sdbus::createPlainMessage();
-    qv::QVReportingAppendDictionary(again, bounded.dictionary);
+    check(qv::QVReportingAppendDictionary(RawMessage::of(again), bounded.dictionary) >= 0);
     again.seal();
     const QVReportingDecodeResult reread =
         decode(again, {kUnlimited, budget.maxValues, budget.maxDepth});

@@ -1,8 +1,9 @@
 #include "service/QVReportingDBusCodec.h"
 
 #include <fmt/format.h>
-#include <sdbus-c++/Error.h>
-#include <sdbus-c++/Types.h>
+#include <systemd/sd-bus.h>
+
+#include <cstring>
 
 #include "service/QVReportingDBusMessageBytes.h"
 #include "service/QVReportingDBusWireReader.h"
@@ -11,112 +12,118 @@ namespace qv {
 
 namespace {
 
-// Reads values one complete type at a time, keeping count of what the input costs.
+// Reads values one complete type at a time, keeping count of what the input costs. The first
+// failure of sd-bus ends the read: its errno is kept in failed.
 class Reader : public QVReportingPayloadMeter {
   public:
-    Reader(sdbus::Message& message, const QVReportingInputBudget& budget)
+    Reader(sd_bus_message* message, const QVReportingInputBudget& budget)
         : QVReportingPayloadMeter(budget), m_(message) {}
 
-    bool readDictionary(const std::string& entrySignature, std::size_t depth, Value& out,
-                        bool topLevel);
+    bool readDictionary(const char* entrySignature, std::size_t depth, Value& out, bool topLevel);
     bool read(std::size_t depth, Value& out);
 
     Dictionary topLevel;
+    int failed = 0;              // sd-bus's errno, once a call of it failed
     bool stringRefused = false;  // sd-bus would not read a string (a key's or a value's)
 
   private:
-    bool atEnd(std::string& type, std::string& contents) {
-        m_.peekType(type, contents);
-        return type.empty() || type[0] == '\0';
+    bool ok(int r) {
+        if (r < 0) {
+            failed = r;
+            return false;
+        }
+        return true;
+    }
+    // 1 at the end of the current container, 0 before a value, -1 (failed set) on error.
+    int atEnd(char& type, const char*& contents) {
+        const int r = sd_bus_message_peek_type(m_, &type, &contents);
+        return r < 0 ? (ok(r), -1) : r == 0 ? 1 : 0;
     }
     template <typename T>
-    bool readScalar(Value& out) {
+    bool readScalar(char type, Value& out, std::size_t cost) {
         T v{};
-        m_ >> v;
-        out = v;
-        return charge(sizeof(T));
+        if (!ok(sd_bus_message_read_basic(m_, type, &v))) {
+            return false;
+        }
+        if constexpr (std::is_same_v<T, std::uint8_t> || std::is_same_v<T, std::uint16_t> ||
+                      std::is_same_v<T, std::uint32_t>) {
+            out = std::int64_t{v};
+        } else {
+            out = v;
+        }
+        return charge(cost);
     }
     // sd-bus refuses strings D-Bus allows (noncharacters): noted for a second reading.
-    template <typename T>
-    void readText(T& out) {
-        try {
-            m_ >> out;
-        } catch (const sdbus::Error&) {
+    bool readText(char type, const char*& out) {
+        const int r = sd_bus_message_read_basic(m_, type, &out);
+        if (r < 0) {
             stringRefused = true;
-            throw;
         }
+        return ok(r);
     }
-    template <typename T>
-    bool readString(Value& out) {
-        T v;
-        readText(v);
-        const std::size_t size = v.size();
-        out = std::string(std::move(v));
-        return charge(size + 5);
+    bool enter(char type, const char* contents) {
+        return ok(sd_bus_message_enter_container(m_, type, contents));
     }
-    bool readArray(const std::string& contents, std::size_t depth, Value& out);
-    bool readStruct(const std::string& contents, std::size_t depth, Value& out);
+    bool exit() { return ok(sd_bus_message_exit_container(m_)); }
+    bool readArray(const char* contents, std::size_t depth, Value& out);
+    bool readStruct(const char* contents, std::size_t depth, Value& out);
+    bool readItems(std::size_t depth, Array& items);
 
-    sdbus::Message& m_;
+    sd_bus_message* m_;
 };
 
 bool Reader::read(std::size_t depth, Value& out) {
-    std::string type, contents;
-    if (atEnd(type, contents)) {
+    char type = 0;
+    const char* contents = nullptr;
+    if (atEnd(type, contents) != 0) {
         return false;
     }
     // A variant only wraps a value; what it holds is counted instead.
-    if (type[0] != 'v' && !countValue()) {
+    if (type != 'v' && !countValue()) {
         return false;
     }
-    switch (type[0]) {
+    switch (type) {
         case 'b': {
-            bool b = false;
-            m_ >> b;
-            out = b;
-            return charge(4);
-        }
-        case 'y': {
-            std::uint8_t v = 0;
-            m_ >> v;
-            out = std::int64_t{v};
-            return charge(1);
-        }
-        case 'n':
-            return readScalar<std::int16_t>(out);
-        case 'q': {
-            std::uint16_t v = 0;
-            m_ >> v;
-            out = std::int64_t{v};
-            return charge(2);
-        }
-        case 'i':
-            return readScalar<std::int32_t>(out);
-        case 'u': {
-            std::uint32_t v = 0;
-            m_ >> v;
-            out = std::int64_t{v};
-            return charge(4);
-        }
-        case 'x':
-            return readScalar<std::int64_t>(out);
-        case 't':
-            return readScalar<std::uint64_t>(out);
-        case 'd':
-            return readScalar<double>(out);
-        case 's':
-            return readString<std::string>(out);
-        case 'o':
-            return readString<sdbus::ObjectPath>(out);
-        case 'g':
-            return readString<sdbus::Signature>(out);
-        case 'v': {
-            m_.enterVariant(contents);
-            if (!charge(contents.size() + 2) || !read(depth, out)) {
+            int b = 0;
+            if (!ok(sd_bus_message_read_basic(m_, 'b', &b))) {
                 return false;
             }
-            m_.exitVariant();
-            return true;
+            out = b != 0;
+            return charge(4);
+        }
+        case 'y':
+            return readScalar<std::uint8_t>(type, out, 1);
+        case 'n':
+            return readScalar<std::int16_t>(type, out, 2);
+        case 'q':
+            return readScalar<std::uint16_t>(type, out, 2);
+        case 'i':
+            return readScalar<std::int32_t>(type, out, 4);
+        case 'u':
+            return readScalar<std::uint32_t>(type, out, 4);
+        case 'x':
+            return readScalar<std::int64_t>(type, out, 8);
+        case 't':
+            return readScalar<std::uint64_t>(type, out, 8);
+        case 'd':
+            return readScalar<double>(type, out, 8);
+        case 's':
+        case 'o':
+        case 'g': {
+            const char* text = nullptr;
+            if (!readText(type, text)) {
+                return false;
+            }
+            const std::size_t size = std::strlen(text);
+            out = std::string(text, size);
+            return charge(size + 5);
+        }
+        case 'v': {
+            const std::size_t signatureSize = std::strlen(contents);
+            if (!enter('v', contents) || !charge(signatureSize + 2) || !read(depth, out)) {
+                return false;
+            }
+            return exit();
         }
         case 'a':
             return readArray(contents, depth + 1, out);
@@ -133,68 +140,68 @@ bool Reader::read(std::size_t depth, Value& out) {
     }
 }
 
-bool Reader::readArray(const std::string& contents, std::size_t depth, Value& out) {
+bool Reader::readItems(std::size_t depth, Array& items) {
+    char type = 0;
+    const char* inner = nullptr;
+    for (int end; (end = atEnd(type, inner)) == 0;) {
+        Value v;
+        if (!read(depth, v)) {
+            return false;
+        }
+        items.push_back(std::move(v));
+    }
+    return failed == 0;
+}
+
+bool Reader::readArray(const char* contents, std::size_t depth, Value& out) {
     if (!enterDepth(depth)) {
         return false;
     }
     if (!charge(4)) {
         return false;
     }
-    if (!contents.empty() && contents[0] == '{') {
-        return readDictionary(contents.substr(1, contents.size() - 2), depth, out, false);
+    if (contents[0] == '{') {
+        const std::string entry(contents + 1, std::strlen(contents) - 2);
+        return readDictionary(entry.c_str(), depth, out, false);
     }
-    std::string type, inner;
-    m_.enterContainer(contents);
-    if (contents == "y") {
-        Bytes bytes;
-        while (!atEnd(type, inner)) {
-            std::uint8_t b = 0;
-            m_ >> b;
-            bytes.push_back(b);
-            if (!charge(1)) {
-                return false;
-            }
+    if (std::strcmp(contents, "y") == 0) {
+        // Bytes come as one block, charged as the wire reader charges them.
+        const void* data = nullptr;
+        std::size_t size = 0;
+        if (!ok(sd_bus_message_read_array(m_, 'y', &data, &size)) || !charge(size)) {
+            return false;
         }
-        m_.exitContainer();
-        out = std::move(bytes);
+        const auto* begin = static_cast<const std::uint8_t*>(data);
+        out = Bytes(begin, begin + size);
         return true;
     }
     Array items;
-    while (!atEnd(type, inner)) {
-        Value v;
-        if (!read(depth, v)) {
-            return false;
-        }
-        items.push_back(std::move(v));
+    if (!enter('a', contents) || !readItems(depth, items) || !exit()) {
+        return false;
     }
-    m_.exitContainer();
     out = std::move(items);
     return true;
 }
 
-bool Reader::readStruct(const std::string& contents, std::size_t depth, Value& out) {
+bool Reader::readStruct(const char* contents, std::size_t depth, Value& out) {
     if (!enterDepth(depth)) {
         return false;
     }
-    m_.enterStruct(contents);
     Array items;
-    std::string type, inner;
-    while (!atEnd(type, inner)) {
-        Value v;
-        if (!read(depth, v)) {
-            return false;
-        }
-        items.push_back(std::move(v));
+    if (!enter('r', contents) || !readItems(depth, items) || !exit()) {
+        return false;
     }
-    m_.exitStruct();
     out = std::move(items);
     return true;
 }
 
-bool Reader::readDictionary(const std::string& entrySignature, std::size_t depth, Value& out,
+bool Reader::readDictionary(const char* entrySignature, std::size_t depth, Value& out,
                             bool isTopLevel) {
-    m_.enterContainer("{" + entrySignature + "}");
-    const bool stringKeys = !entrySignature.empty() && entrySignature[0] == 's';
+    const std::string arrayContents = fmt::format("{{{}}}", entrySignature);
+    if (!enter('a', arrayContents.c_str())) {
+        return false;
+    }
+    const bool stringKeys = entrySignature[0] == 's';
     // Entries with keys of another type become [key, value] pairs: a value each, one level down.
     const std::size_t entryDepth = stringKeys ? depth : depth + 1;
     if (!stringKeys && !enterDepth(entryDepth)) {
@@ -202,33 +209,41 @@ bool Reader::readDictionary(const std::string& entrySignature, std::size_t depth
     }
     Dictionary dict;
     Array pairs;
-    std::string type, inner;
-    while (!atEnd(type, inner)) {
-        m_.enterDictEntry(entrySignature);
+    char type = 0;
+    const char* inner = nullptr;
+    for (int end; (end = atEnd(type, inner)) == 0;) {
+        if (!enter('e', entrySignature)) {
+            return false;
+        }
         Value k, v;
-        std::string name;
+        const char* name = nullptr;
+        std::size_t nameSize = 0;
         if (stringKeys) {
-            readText(name);
-            if (isTopLevel) {
-                key.assign(name);  // named in errors; its buffer is reused entry after entry
+            if (!readText('s', name)) {
+                return false;
             }
-            if (!charge(name.size() + 5)) {
+            nameSize = std::strlen(name);
+            if (isTopLevel) {
+                key.assign(name, nameSize);  // named in errors; its buffer is reused
+            }
+            if (!charge(nameSize + 5)) {
                 return false;
             }
         } else if (!countValue() || !read(entryDepth, k)) {
             return false;
         }
-        if (!read(entryDepth, v)) {
+        if (!read(entryDepth, v) || !exit()) {
             return false;
         }
-        m_.exitDictEntry();
         if (stringKeys) {
-            dict.set(std::move(name), std::move(v));
+            dict.set(std::string(name, nameSize), std::move(v));
         } else {
             pairs.push_back(Array{std::move(k), std::move(v)});
         }
     }
-    m_.exitContainer();
+    if (failed != 0 || !exit()) {
+        return false;
+    }
     if (isTopLevel) {
         topLevel = std::move(dict);
     } else if (stringKeys) {
@@ -264,7 +279,7 @@ std::string signatureOf(const Value& value) {
 }
 
 // The whole call read again from its bytes; nothing when they cannot be had.
-std::optional<QVReportingDecodeResult> readFromBytes(const sdbus::Message& message,
+std::optional<QVReportingDecodeResult> readFromBytes(sd_bus_message* message,
                                                      const QVReportingInputBudget& budget) {
     const auto bytes = QVReportingDBusMessageBytes::forThisThread().of(message);
     const auto wire = bytes ? QVReportingDBusWireReader::split(*bytes) : std::nullopt;
@@ -281,25 +296,23 @@ const Value& restAt(const QVReportingDecodeResult& decoded, std::size_t i) {
 
 }  // namespace
 
-QVReportingDecodeResult QVReportingReadDictionary(sdbus::Message& message,
+QVReportingDecodeResult QVReportingReadDictionary(sd_bus_message* message,
                                                   const QVReportingInputBudget& budget) {
     QVReportingDecodeResult result;
     Reader reader(message, budget);
     Value unused;
-    try {
-        if (!reader.readDictionary("sv", 1, unused, true) && !reader.error) {
-            reader.error = QVReportingError::invalidArgs("the payload ended early");
-        }
-    } catch (const sdbus::Error& e) {
+    if (!reader.readDictionary("sv", 1, unused, true) && !reader.error) {
         if (reader.stringRefused) {
             if (auto again = readFromBytes(message, budget)) {
                 return std::move(*again);
             }
         }
+        const std::string why =
+            reader.failed ? std::strerror(-reader.failed) : "the payload ended early";
         reader.error = QVReportingError::invalidArgs(
-            reader.key.empty() ? e.getMessage()
-                               : fmt::format("the value under \"{}\" cannot be read: {}",
-                                             reader.key, e.getMessage()));
+            reader.key.empty()
+                ? why
+                : fmt::format("the value under \"{}\" cannot be read: {}", reader.key, why));
     }
     result.error = std::move(reader.error);
     result.limit = reader.limit;
@@ -310,89 +323,120 @@ QVReportingDecodeResult QVReportingReadDictionary(sdbus::Message& message,
     return result;
 }
 
-void QVReportingReadRest(sdbus::Message& message, const QVReportingDecodeResult& decoded,
+bool QVReportingReadRest(sd_bus_message* message, const QVReportingDecodeResult& decoded,
                          std::int64_t& reporterID) {
     if (!decoded.rest) {
-        message >> reporterID;
-        return;
+        return sd_bus_message_read_basic(message, 'x', &reporterID) > 0;
     }
     reporterID = restAt(decoded, 0).asInt64().value_or(0);
+    return true;
 }
 
-void QVReportingReadRest(sdbus::Message& message, const QVReportingDecodeResult& decoded,
+bool QVReportingReadRest(sd_bus_message* message, const QVReportingDecodeResult& decoded,
                          std::uint32_t& category, std::uint16_t& type,
                          std::vector<std::int64_t>& reporterIDs) {
+    reporterIDs.clear();
     if (!decoded.rest) {
-        message >> category >> type >> reporterIDs;
-        return;
+        const void* ids = nullptr;
+        std::size_t size = 0;
+        if (sd_bus_message_read(message, "uq", &category, &type) <= 0 ||
+            sd_bus_message_read_array(message, 'x', &ids, &size) < 0) {
+            return false;
+        }
+        const auto* begin = static_cast<const std::int64_t*>(ids);
+        reporterIDs.assign(begin, begin + size / sizeof(std::int64_t));
+        return true;
     }
     // The wire reader gives unsigned integers that fit as signed ones, as the codec does.
     category = static_cast<std::uint32_t>(restAt(decoded, 0).asInt64().value_or(0));
     type = static_cast<std::uint16_t>(restAt(decoded, 1).asInt64().value_or(0));
-    reporterIDs.clear();
     if (const Array* ids = restAt(decoded, 2).asArray()) {
         for (const Value& id : *ids) {
             reporterIDs.push_back(id.asInt64().value_or(0));
         }
     }
+    return true;
 }
 
-void QVReportingAppendVariant(sdbus::Message& message, const Value& value) {
+int QVReportingAppendVariant(sd_bus_message* message, const Value& value) {
     const std::string signature = signatureOf(value);
-    message.openVariant(signature);
+    int r = sd_bus_message_open_container(message, 'v', signature.c_str());
+    if (r < 0) {
+        return r;
+    }
     switch (value.kind()) {
-        case Value::Kind::Bool:
-            message << value.boolValue();
+        case Value::Kind::Bool: {
+            const int b = value.boolValue() ? 1 : 0;
+            r = sd_bus_message_append_basic(message, 'b', &b);
             break;
-        case Value::Kind::Int:
-            message << *value.asInt64();
+        }
+        case Value::Kind::Int: {
+            const std::int64_t v = *value.asInt64();
+            r = sd_bus_message_append_basic(message, 'x', &v);
             break;
-        case Value::Kind::UInt:
-            message << *value.asUInt64();
+        }
+        case Value::Kind::UInt: {
+            const std::uint64_t v = *value.asUInt64();
+            r = sd_bus_message_append_basic(message, 't', &v);
             break;
+        }
         case Value::Kind::Double:
-            message << *value.asDouble();
+        case Value::Kind::Date: {
+            const double v = value.kind() == Value::Kind::Date ? value.asDate()->secondsSince1970
+                                                               : *value.asDouble();
+            r = sd_bus_message_append_basic(message, 'd', &v);
             break;
-        case Value::Kind::Date:
-            message << value.asDate()->secondsSince1970;
-            break;
+        }
         case Value::Kind::String:
-            message << *value.asString();
+            r = sd_bus_message_append_basic(message, 's', value.asString()->c_str());
             break;
-        case Value::Kind::Bytes:
-            message.openContainer("y");
-            for (std::uint8_t b : *value.asBytes()) {
-                message << b;
-            }
-            message.closeContainer();
+        case Value::Kind::Bytes: {
+            const Bytes& bytes = *value.asBytes();
+            r = sd_bus_message_append_array(message, 'y', bytes.data(), bytes.size());
             break;
+        }
         case Value::Kind::Dictionary:
-            QVReportingAppendDictionary(message, *value.asDictionary());
+            r = QVReportingAppendDictionary(message, *value.asDictionary());
             break;
         case Value::Kind::Array:
-            message.openContainer("v");
+            r = sd_bus_message_open_container(message, 'a', "v");
             for (const Value& v : *value.asArray()) {
-                QVReportingAppendVariant(message, v);
+                if (r >= 0) {
+                    r = QVReportingAppendVariant(message, v);
+                }
             }
-            message.closeContainer();
+            if (r >= 0) {
+                r = sd_bus_message_close_container(message);
+            }
             break;
         case Value::Kind::Null:
-            message.openContainer("v");
-            message.closeContainer();
+            r = sd_bus_message_open_container(message, 'a', "v");
+            if (r >= 0) {
+                r = sd_bus_message_close_container(message);
+            }
             break;
     }
-    message.closeVariant();
+    return r < 0 ? r : sd_bus_message_close_container(message);
 }
 
-void QVReportingAppendDictionary(sdbus::Message& message, const Dictionary& dictionary) {
-    message.openContainer("{sv}");
+int QVReportingAppendDictionary(sd_bus_message* message, const Dictionary& dictionary) {
+    int r = sd_bus_message_open_container(message, 'a', "{sv}");
     for (const auto& [key, value] : dictionary) {
-        message.openDictEntry("sv");
-        message << key.str();
-        QVReportingAppendVariant(message, value);
-        message.closeDictEntry();
+        if (r < 0) {
+            return r;
+        }
+        r = sd_bus_message_open_container(message, 'e', "sv");
+        if (r >= 0) {
+            r = sd_bus_message_append_basic(message, 's', key.str().c_str());
+        }
+        if (r >= 0) {
+            r = QVReportingAppendVariant(message, value);
+        }
+        if (r >= 0) {
+            r = sd_bus_message_close_container(message);
+        }
     }
-    message.closeContainer();
+    return r < 0 ? r : sd_bus_message_close_container(message);
 }
 
 }  // namespace qv

@@ -1,4 +1,5 @@
-// Payload values to and from D-Bus messages.
+// Payload values to and from D-Bus messages, straight through sd-bus's message API: no
+// intermediate variant objects on the way in or out.
 //
 // Reading: b is a bool; y n q i u x signed integers; t an unsigned integer; d a double; s o g
 // strings; ay bytes; other arrays and structs arrays; a{s?} dictionaries (a dictionary with keys
@@ -10,7 +11,8 @@
 // reader take the call's bytes and read them itself (QVReportingDBusWireReader), with the same
 // result, or the same refusal with the key named; the call's other arguments then come with the
 // result, as the message can no longer be read on.
-// Writing: dates go out as doubles.
+// Writing: dates go out as doubles. The append functions return sd-bus's negative errno on
+// failure (a string sd-bus will not write), and the message is then unusable.
 //
 // Thread safety: the functions keep no state (but for the private connection a thread that needed
 // one keeps for the next time); a message must only be touched by one thread.
@@ -20,12 +22,12 @@
 #include <string>
 #include <vector>
 
-#include <sdbus-c++/Message.h>
-
 #include "service/QVReportingError.h"
 #include "service/QVReportingPayloadMeter.h"
 #include "session/QVReportingStats.h"
 #include "values/Value.h"
+
+typedef struct sd_bus_message sd_bus_message;
 
 namespace qv {
 
@@ -42,20 +44,20 @@ struct QVReportingDecodeResult {
 };
 
 // Reads an a{sv} at the message's current position.
-QVReportingDecodeResult QVReportingReadDictionary(sdbus::Message& message,
+QVReportingDecodeResult QVReportingReadDictionary(sd_bus_message* message,
                                                   const QVReportingInputBudget& budget);
 
 // The arguments after the dictionary (SetConfiguration's, SendMessage's): from decoded.rest when
-// it holds them, from the message otherwise.
-void QVReportingReadRest(sdbus::Message& message, const QVReportingDecodeResult& decoded,
+// it holds them, from the message otherwise. False when the message does not hold them.
+bool QVReportingReadRest(sd_bus_message* message, const QVReportingDecodeResult& decoded,
                          std::int64_t& reporterID);
-void QVReportingReadRest(sdbus::Message& message, const QVReportingDecodeResult& decoded,
+bool QVReportingReadRest(sd_bus_message* message, const QVReportingDecodeResult& decoded,
                          std::uint32_t& category, std::uint16_t& type,
                          std::vector<std::int64_t>& reporterIDs);
 
 // Appends a value as a variant.
-void QVReportingAppendVariant(sdbus::Message& message, const Value& value);
+int QVReportingAppendVariant(sd_bus_message* message, const Value& value);
 // Appends an a{sv}.
-void QVReportingAppendDictionary(sdbus::Message& message, const Dictionary& dictionary);
+int QVReportingAppendDictionary(sd_bus_message* message, const Dictionary& dictionary);
 
 }  // namespace qv

@@ -28,14 +28,6 @@ std::uint64_t nowMicros() {
            static_cast<std::uint64_t>(ts.tv_nsec) / 1000u;
 }
 
-// The sd_bus_message under a message, which sdbus-c++ keeps protected: a pointer to the member,
-// taken in a class derived from Message, reads it.
-struct MessageAccess : sdbus::Message {
-    static sd_bus_message* of(const sdbus::Message& message) {
-        return static_cast<sd_bus_message*>(message.*(&MessageAccess::msg_));
-    }
-};
-
 std::uint32_t u32At(const std::vector<std::uint8_t>& b, std::size_t at) {
     const bool big = b[0] == 'B';
     std::uint32_t v = 0;
@@ -146,12 +138,11 @@ bool QVReportingDBusMessageBytes::pump(std::vector<std::uint8_t>& into, std::siz
     return true;
 }
 
-std::optional<std::vector<std::uint8_t>> QVReportingDBusMessageBytes::of(
-    const sdbus::Message& message) {
+std::optional<std::vector<std::uint8_t>> QVReportingDBusMessageBytes::of(sd_bus_message* message) {
     if (!bus_ && !connect()) {
         return std::nullopt;
     }
-    const int sent = sd_bus_send(bus_, MessageAccess::of(message), nullptr);
+    const int sent = sd_bus_send(bus_, message, nullptr);
     if (sent < 0) {
         // Refused before anything was written (unix fds, a message not sealed): the connection
         // is as good as before.

@@ -12,9 +12,8 @@
 #include <optional>
 #include <vector>
 
-#include <sdbus-c++/Message.h>
-
 typedef struct sd_bus sd_bus;
+typedef struct sd_bus_message sd_bus_message;
 
 namespace qv {
 
@@ -29,7 +28,7 @@ class QVReportingDBusMessageBytes {
 
     // The sealed message's bytes; nothing when it cannot go over the connection (it carries unix
     // fds, say) or the connection fails (it is made again on the next call).
-    std::optional<std::vector<std::uint8_t>> of(const sdbus::Message& message);
+    std::optional<std::vector<std::uint8_t>> of(sd_bus_message* message);
 
   private:
     bool connect();

@@ -7,18 +7,27 @@
 #include <time.h>
 #include <unistd.h>
 
+#include <cstring>
 #include <future>
-
-#include <sdbus-c++/sdbus-c++.h>
+#include <stdexcept>
 
 #include "platform/linux/LinuxNotificationCenter.h"
-#include "service/QVReportingDBusCodec.h"
 #include "service/QVReportingDBusNames.h"
+#include "service/QVReportingDirectSocket.h"
 #include "session/QVReportingLog.h"
 
 namespace qv {
 
 namespace {
+
+// Calls read from one connection before the next has its turn: long enough to keep a pipelining
+// client's socket reads large, short enough that no connection waits behind a flood.
+constexpr int kCallsPerTurn = 64;
+
+// Replies a direct connection may leave unread (queued once the socket's own buffer is full)
+// before it is closed: a client that stops reading its replies would otherwise grow the daemon
+// without bound. On the bus, the broker plays this part.
+constexpr std::uint64_t kMaxUnreadReplies = 1024;
 
 const QVReportingLogCategory& logCategory() {
     return QVReportingServiceDelegateCategory();
@@ -31,25 +40,26 @@ std::uint64_t monotonicMicros() {
            static_cast<std::uint64_t>(ts.tv_nsec) / 1000u;
 }
 
-sdbus::Error toBusError(const QVReportingError& e) {
-    return sdbus::Error(e.name, e.message);
-}
-
 }  // namespace
 
-QVReportingDBusServer::QVReportingDBusServer(std::unique_ptr<sdbus::IConnection> connection,
-                                             QVReportingService& service,
-                                             LinuxNotificationCenter* notifications)
-    : connection_(std::move(connection)),
-      service_(service),
+QVReportingDBusServer::QVReportingDBusServer(sd_bus* bus, QVReportingService& service,
+                                             LinuxNotificationCenter* notifications,
+                                             std::unique_ptr<QVReportingDirectSocket> direct)
+    : service_(service),
       notifications_(notifications),
       limits_(service.limits()),
-      lifeline_(std::make_shared<Lifeline>()) {
+      budget_{limits_.maxPayloadBytes, limits_.maxPayloadValues, limits_.maxPayloadDepth},
+      lifeline_(std::make_shared<Lifeline>()),
+      direct_(std::move(direct)) {
     lifeline_->server = this;
+    bus_.server = this;
+    bus_.bus = bus;
     wakeFd_ = eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK);
     if (wakeFd_ < 0) {
-        throw sdbus::Error("org.freedesktop.DBus.Error.Failed", "eventfd failed");
+        sd_bus_flush_close_unref(bus);
+        throw std::runtime_error("eventfd failed");
     }
+    sd_id128_randomize(&serverID_);
 }
 
 QVReportingDBusServer::~QVReportingDBusServer() {
@@ -58,6 +68,8 @@ QVReportingDBusServer::~QVReportingDBusServer() {
         lifeline_->server = nullptr;
     }
     stop();
+    closeConnections();  // when the loop never ran
+    sd_bus_flush_close_unref(bus_.bus);
     ::close(wakeFd_);
 }
 
@@ -66,60 +78,110 @@ void QVReportingDBusServer::stop() {
         notifications_->setPostObserver(nullptr);
     }
     if (loopThread_.joinable()) {
-        // Unregister on the loop thread, which alone touches the bus, then end the loop.
-        post([this] {
-            reporting_.reset();
-            notify_.reset();
-            nameOwnerChangedSlot_.reset();
-            pending_.clear();
-            stopping_ = true;
-        });
+        // The loop ends, and its thread lets go of what it served (closeConnections()).
+        post([this] { stopping_ = true; });
         loopThread_.join();
     }
 }
 
 void QVReportingDBusServer::start() {
-    registerReportingInterface();
-    registerStatsInterface();
-    reporting_->finishRegistration();
+    if (!registerObjects(bus_)) {
+        throw std::runtime_error("cannot register the objects on the bus");
+    }
     if (notifications_) {
-        registerNotifyInterface();
-        notify_->finishRegistration();
         notifications_->setPostObserver([this](const std::string& name, std::uint64_t state) {
-            post([this, name, state] {
-                if (notify_) {
-                    notify_->emitSignal(dbus::kPosted)
-                        .onInterface(dbus::kNotifyInterface)
-                        .withArguments(name, state);
-                }
-            });
+            post([this, name, state] { emitPosted(name, state); });
         });
     }
-    nameOwnerChangedSlot_ = connection_->addMatch(
+    int r = sd_bus_add_match(
+        bus_.bus, &nameOwnerChangedSlot_,
         "type='signal',sender='org.freedesktop.DBus',interface='org.freedesktop.DBus',"
         "member='NameOwnerChanged',path='/org/freedesktop/DBus'",
-        [this](sdbus::Message& signal) { onNameOwnerChanged(signal); });
-    connection_->requestName(dbus::kBusName);
-    QVLOG_DEFAULT(logCategory(), "owning bus name {} as {}", dbus::kBusName,
-                  connection_->getUniqueName());
+        &QVReportingDBusServer::onNameOwnerChanged, this);
+    if (r >= 0) {
+        r = sd_bus_request_name(bus_.bus, dbus::kBusName, 0);
+    }
+    if (r < 0) {
+        throw std::runtime_error(fmt::format("cannot own {}: {}", dbus::kBusName, strerror(-r)));
+    }
+    const char* unique = nullptr;
+    sd_bus_get_unique_name(bus_.bus, &unique);
+    QVLOG_DEFAULT(logCategory(), "owning bus name {} as {}", dbus::kBusName, unique ? unique : "?");
+    if (direct_) {
+        QVLOG_DEFAULT(logCategory(), "listening for direct connections on {}", direct_->path());
+    }
     loopThread_ = std::thread([this] {
         loop();
         drainPosted(true);
+        closeConnections();
     });
 }
 
+bool QVReportingDBusServer::registerObjects(Connection& c) {
+    auto add = [&c](const char* path, const char* interface, const sd_bus_vtable* vtable) {
+        sd_bus_slot* slot = nullptr;
+        if (sd_bus_add_object_vtable(c.bus, &slot, path, interface, vtable, &c) < 0) {
+            return false;
+        }
+        c.slots.push_back(slot);
+        return true;
+    };
+    return add(dbus::kObjectPath, dbus::kInterface, kReportingVtable) &&
+           add(dbus::kObjectPath, dbus::kStatsInterface, kStatsVtable) &&
+           (!notifications_ ||
+            add(dbus::kNotifyObjectPath, dbus::kNotifyInterface, kNotifyVtable)) &&
+           (!c.direct || add("/org/freedesktop/DBus", "org.freedesktop.DBus", kPeerBusVtable));
+}
+
+void QVReportingDBusServer::closeConnections() {
+    unregisterObjects(bus_);
+    // Each slot holds a reference on its bus.
+    nameOwnerChangedSlot_ = sd_bus_slot_unref(nameOwnerChangedSlot_);
+    // The daemon leaves, not its clients: as on the bus, they are not invalidated.
+    while (!directConnections_.empty()) {
+        closeDirectConnection(directConnections_.begin(), false);
+    }
+    direct_.reset();
+    pending_.clear();
+}
+
+void QVReportingDBusServer::unregisterObjects(Connection& c) {
+    for (sd_bus_slot* slot : c.slots) {
+        sd_bus_slot_unref(slot);
+    }
+    c.slots.clear();
+}
+
+void QVReportingDBusServer::emitPosted(const std::string& name, std::uint64_t state) {
+    auto emit = [&](sd_bus* bus) {
+        sd_bus_emit_signal(bus, dbus::kNotifyObjectPath, dbus::kNotifyInterface, dbus::kPosted,
+                           "st", name.c_str(), state);
+    };
+    if (!bus_.slots.empty()) {
+        emit(bus_.bus);
+    }
+    for (Connection& c : directConnections_) {
+        emit(c.bus);
+    }
+}
+
 bool QVReportingDBusServer::post(std::function<void()> fn) {
+    bool wake = false;
     {
         // A loop that ended (the bus was lost) runs nothing more.
         std::lock_guard lock(postMutex_);
         if (loopEnded_) {
             return false;
         }
+        // One wake-up per batch: the loop takes everything posted when it drains.
+        wake = posted_.empty();
         posted_.push_back(std::move(fn));
         postedWaiting_.store(true, std::memory_order_release);
     }
-    const std::uint64_t one = 1;
-    [[maybe_unused]] const auto n = ::write(wakeFd_, &one, sizeof one);
+    if (wake) {
+        const std::uint64_t one = 1;
+        [[maybe_unused]] const auto n = ::write(wakeFd_, &one, sizeof one);
+    }
     return true;
 }
 
@@ -147,8 +209,8 @@ void QVReportingDBusServer::drainPosted(bool last) {
     for (auto& fn : batch) {
         try {
             fn();
-        } catch (const sdbus::Error& e) {
-            QVLOG_ERROR(logCategory(), "bus error: {} {}", e.getName(), e.getMessage());
+        } catch (const std::exception& e) {
+            QVLOG_ERROR(logCategory(), "posted work failed: {}", e.what());
         }
     }
 }
@@ -156,136 +218,215 @@ void QVReportingDBusServer::drainPosted(bool last) {
 void QVReportingDBusServer::loop() {
     pthread_setname_np(pthread_self(), "qvreportd-bus");
     while (!stopping_) {
-        try {
-            if (callBytes_ >= limits_.maxCallBytes) {
-                // Past the budget of all clients: leave what the bus sends where it is until the
-                // work taken in drains; answers reach this thread through post().
-                if (!readsPaused_) {
-                    readsPaused_ = true;
-                    QVReportingStats::shared().noteBusReadsPaused();
-                    QVLOG_ERROR(logCategory(),
-                                "calls not yet answered take {} bytes (at most {}): reading the "
-                                "bus again when they drain",
-                                callBytes_, limits_.maxCallBytes);
-                }
-                pollfd wake{wakeFd_, POLLIN, 0};
-                if (::poll(&wake, 1, -1) < 0 && errno != EINTR) {
-                    QVLOG_ERROR(logCategory(), "poll failed: {}", errno);
-                }
-                drainPosted();
-                continue;
+        if (callBytes_ >= limits_.maxCallBytes) {
+            // Past the budget of all clients: leave what the connections send where it is until
+            // the work taken in drains; answers reach this thread through post().
+            if (!readsPaused_) {
+                readsPaused_ = true;
+                QVReportingStats::shared().noteBusReadsPaused();
+                QVLOG_ERROR(logCategory(),
+                            "calls not yet answered take {} bytes (at most {}): reading the "
+                            "bus again when they drain",
+                            callBytes_, limits_.maxCallBytes);
             }
-            if (readsPaused_) {
-                readsPaused_ = false;
-                QVLOG_DEFAULT(logCategory(), "reading the bus again");
-            }
-            while (callBytes_ < limits_.maxCallBytes && connection_->processPendingRequest()) {
-                if (stopping_) {
-                    return;
-                }
-                // Answers go out between calls: under a steady stream of calls the loop would
-                // otherwise not reach its poll, and every answer would wait for a lull.
-                if (postedWaiting_.load(std::memory_order_acquire)) {
-                    drainPosted();
-                }
-            }
-            if (callBytes_ >= limits_.maxCallBytes) {
-                continue;
-            }
-            const auto data = connection_->getEventLoopPollData();
-            int timeoutMs = -1;
-            if (data.timeout_usec != UINT64_MAX) {
-                const std::uint64_t now = monotonicMicros();
-                timeoutMs = data.timeout_usec <= now
-                                ? 0
-                                : static_cast<int>(std::min<std::uint64_t>(
-                                      (data.timeout_usec - now + 999) / 1000, 60000));
-            }
-            pollfd fds[2] = {{data.fd, data.events, 0}, {wakeFd_, POLLIN, 0}};
-            if (::poll(fds, 2, timeoutMs) < 0 && errno != EINTR) {
+            pollfd wake{wakeFd_, POLLIN, 0};
+            if (::poll(&wake, 1, -1) < 0 && errno != EINTR) {
                 QVLOG_ERROR(logCategory(), "poll failed: {}", errno);
             }
-            if (fds[1].revents & POLLIN) {
+            drainPosted();
+            continue;
+        }
+        if (readsPaused_) {
+            readsPaused_ = false;
+            QVLOG_DEFAULT(logCategory(), "reading the bus again");
+        }
+        const bool busy = processConnections();
+        if (stopping_ || busy) {
+            continue;
+        }
+        waitForWork();
+    }
+}
+
+bool QVReportingDBusServer::processConnections() {
+    bool busy = false;
+    // Reads one connection for a turn; false once it has closed.
+    auto turn = [&](Connection& c) {
+        // The work of the turn's calls wakes the server queue once, when the turn ends.
+        SerialQueue::WakeBatch batch(service_.queue());
+        for (int i = 0; i < kCallsPerTurn && callBytes_ < limits_.maxCallBytes && !stopping_; ++i) {
+            const int r = sd_bus_process(c.bus, nullptr);
+            if (r < 0 || (c.direct && sd_bus_is_open(c.bus) <= 0)) {
+                if (!c.direct) {
+                    // Without a bus there is nothing to serve: stop the daemon the normal way.
+                    QVLOG_ERROR(logCategory(), "lost the bus: {}", strerror(-r));
+                    stopping_ = true;
+                    ::kill(::getpid(), SIGTERM);
+                }
+                return false;
+            }
+            if (r == 0) {
+                break;
+            }
+            busy = true;
+            // Answers go out between calls: under a steady stream of calls the loop would
+            // otherwise not reach its poll, and every answer would wait for a lull.
+            if (postedWaiting_.load(std::memory_order_acquire)) {
                 drainPosted();
             }
-        } catch (const sdbus::Error& e) {
-            // Processing fails only when the connection itself broke: without a bus there is
-            // nothing to serve, so stop the daemon the normal way.
-            QVLOG_ERROR(logCategory(), "lost the bus: {} {}", e.getName(), e.getMessage());
-            ::kill(::getpid(), SIGTERM);
-            return;
         }
+        return true;
+    };
+    turn(bus_);
+    for (auto it = directConnections_.begin(); it != directConnections_.end() && !stopping_;) {
+        auto next = std::next(it);
+        std::uint64_t unread = 0;
+        if (!turn(*it)) {
+            closeDirectConnection(it);
+        } else if (sd_bus_get_n_queued_write(it->bus, &unread) >= 0 && unread > kMaxUnreadReplies) {
+            QVReportingStats::shared().noteLimitExceeded(
+                QVReportingStats::Limit::DirectRepliesUnread);
+            QVLOG_ERROR(logCategory(),
+                        "closing direct connection {} of pid {}: {} replies left unread", it->key,
+                        it->pid, unread);
+            closeDirectConnection(it);
+        }
+        it = next;
+    }
+    if (postedWaiting_.load(std::memory_order_acquire)) {
+        drainPosted();
+    }
+    return busy;
+}
+
+void QVReportingDBusServer::waitForWork() {
+    std::vector<pollfd> fds;
+    fds.reserve(directConnections_.size() + 3);
+    fds.push_back({wakeFd_, POLLIN, 0});
+    if (direct_) {
+        fds.push_back({direct_->fd(), POLLIN, 0});
+    }
+    std::uint64_t deadline = UINT64_MAX;
+    auto watch = [&](const Connection& c) {
+        std::uint64_t until = UINT64_MAX;
+        const int events = sd_bus_get_events(c.bus);
+        fds.push_back({sd_bus_get_fd(c.bus), static_cast<short>(events < 0 ? 0 : events), 0});
+        if (sd_bus_get_timeout(c.bus, &until) > 0) {
+            deadline = std::min(deadline, until);
+        }
+    };
+    watch(bus_);
+    for (const Connection& c : directConnections_) {
+        watch(c);
+    }
+    int timeoutMs = -1;
+    if (deadline != UINT64_MAX) {
+        const std::uint64_t now = monotonicMicros();
+        timeoutMs =
+            deadline <= now
+                ? 0
+                : static_cast<int>(std::min<std::uint64_t>((deadline - now + 999) / 1000, 60000));
+    }
+    if (::poll(fds.data(), fds.size(), timeoutMs) < 0 && errno != EINTR) {
+        QVLOG_ERROR(logCategory(), "poll failed: {}", errno);
+    }
+    if (fds[0].revents & POLLIN) {
+        drainPosted();
+    }
+    if (direct_ && (fds[1].revents & POLLIN)) {
+        acceptDirectConnections();
     }
 }
 
-QVReportingDBusServer::Client* QVReportingDBusServer::admit(sdbus::MethodCall& call, bool held) {
-    std::string sender = call.getSender();
-    auto it = clients_.find(sender);
-    if (it == clients_.end()) {
-        // Asking the bus for the peer's PID is a round trip: done once per connection.
-        std::int64_t pid = 0;
-        try {
-            pid = call.getCredsPid();
-        } catch (const sdbus::Error& e) {
-            QVLOG_ERROR(logCategory(), "no process ID for {}: {}", sender, e.getMessage());
+void QVReportingDBusServer::acceptDirectConnections() {
+    while (auto peer = direct_->accept()) {
+        // Every connection holds a descriptor and a little memory before it makes a call: they
+        // are bounded like the clients.
+        if (directConnections_.size() >= limits_.maxClients) {
+            QVReportingStats::shared().noteLimitExceeded(QVReportingStats::Limit::Clients);
+            QVLOG_ERROR(logCategory(), "refusing a direct connection of pid {}: {} are open",
+                        peer->pid, directConnections_.size());
+            ::close(peer->fd);
+            continue;
         }
-        auto instance = service_.acceptConnection(pid);
-        if (!instance) {
-            refuse(call, QVReportingError::limitsExceeded("too many clients"));
-            return nullptr;
+        sd_bus* bus = nullptr;
+        int r = sd_bus_new(&bus);
+        if (r >= 0 && (r = sd_bus_set_fd(bus, peer->fd, peer->fd)) < 0) {
+            bus = sd_bus_unref(bus);
         }
-        it = clients_
-                 .emplace(
-                     std::move(sender),
-                     Client{std::move(instance), 0, 0,
-                            static_cast<double>(limits_.maxCallBytesPerClient), monotonicMicros()})
-                 .first;
-        clientCount_ = clients_.size();
+        if (r < 0) {
+            QVLOG_ERROR(logCategory(), "cannot serve a direct connection of pid {}: {}", peer->pid,
+                        strerror(-r));
+            ::close(peer->fd);
+            continue;
+        }
+        // The server end: the peer authenticates as itself (EXTERNAL) or as nobody (ANONYMOUS);
+        // either way its credentials are the socket's. Payloads cannot hold unix fds, so none
+        // are taken.
+        if (r >= 0) {
+            r = sd_bus_set_server(bus, 1, serverID_);
+        }
+        if (r >= 0) {
+            r = sd_bus_set_anonymous(bus, 1);
+        }
+        if (r >= 0) {
+            r = sd_bus_negotiate_fds(bus, 0);
+        }
+        if (r >= 0) {
+            r = sd_bus_start(bus);
+        }
+        auto& c = directConnections_.emplace_back();
+        c.server = this;
+        c.bus = bus;
+        c.direct = true;
+        c.key = fmt::format("direct:{}", nextDirectID_++);
+        c.pid = peer->pid;
+        c.uid = peer->uid;
+        if (r < 0 || !registerObjects(c)) {
+            QVLOG_ERROR(logCategory(), "cannot serve a direct connection of pid {}: {}", peer->pid,
+                        strerror(r < 0 ? -r : ENOMEM));
+            closeDirectConnection(std::prev(directConnections_.end()));
+            continue;
+        }
+        QVReportingStats::shared().noteDirectConnection();
+        directCount_ = directConnections_.size();
+        QVLOG_INFO(logCategory(), "direct connection {} from pid {} uid {}", c.key, c.pid, c.uid);
     }
-    Client& client = it->second;
-    const std::uint64_t now = monotonicMicros();
-    client.payloadAllowance = std::min(
-        static_cast<double>(limits_.maxCallBytesPerClient),
-        client.payloadAllowance + static_cast<double>(limits_.maxPayloadBytesPerSecondPerClient) *
-                                      static_cast<double>(now - client.allowanceMicros) / 1e6);
-    client.allowanceMicros = now;
-    // Checked before the arguments are read, so a refusal costs next to nothing.
-    std::optional<QVReportingStats::Limit> over;
-    std::string why;
-    if (held && client.heldCalls >= limits_.maxHeldCallsPerClient) {
-        over = QVReportingStats::Limit::HeldCallsPerClient;
-        why = fmt::format("a client may have at most {} start calls waiting for their sessions",
-                          limits_.maxHeldCallsPerClient);
-    } else if (held && heldCalls_ >= limits_.maxHeldCalls) {
-        over = QVReportingStats::Limit::HeldCalls;
-        why =
-            fmt::format("at most {} start calls may wait for their sessions", limits_.maxHeldCalls);
-    } else if (client.callBytes >= limits_.maxCallBytesPerClient) {
-        over = QVReportingStats::Limit::CallBytesPerClient;
-        why = fmt::format("a client's calls not yet answered may take at most {} bytes",
-                          limits_.maxCallBytesPerClient);
-    } else if (client.payloadAllowance <= 0) {
-        over = QVReportingStats::Limit::PayloadRatePerClient;
-        why = fmt::format("a client may send at most {} payload bytes a second",
-                          limits_.maxPayloadBytesPerSecondPerClient);
-    }
-    if (over) {
-        QVReportingStats::shared().noteLimitExceeded(*over);
-        refuse(call, QVReportingError::limitsExceeded(std::move(why)));
-        return nullptr;
-    }
-    return &client;
 }
 
-void QVReportingDBusServer::onNameOwnerChanged(sdbus::Message& signal) {
-    std::string name, oldOwner, newOwner;
-    signal >> name >> oldOwner >> newOwner;
-    if (!newOwner.empty()) {
-        return;
+void QVReportingDBusServer::closeDirectConnection(std::list<Connection>::iterator it,
+                                                  bool clientLeft) {
+    const std::string key = it->key;
+    unregisterObjects(*it);
+    if (it->bus) {
+        sd_bus_close_unref(it->bus);
     }
-    // Calls still kept for the departed name can never be answered.
+    directConnections_.erase(it);
+    directCount_ = directConnections_.size();
+    if (clientLeft) {
+        clientGone(key);
+    }
+}
+
+int QVReportingDBusServer::onNameOwnerChanged(sd_bus_message* signal, void* userdata,
+                                              sd_bus_error*) {
+    auto* self = static_cast<QVReportingDBusServer*>(userdata);
+    const char *name = nullptr, *oldOwner = nullptr, *newOwner = nullptr;
+    if (sd_bus_message_read(signal, "sss", &name, &oldOwner, &newOwner) < 0 || *newOwner) {
+        return 0;
+    }
+    try {
+        self->clientGone(name);
+    } catch (const std::exception& e) {
+        QVLOG_ERROR(logCategory(), "dropping client {} failed: {}", name, e.what());
+    }
+    return 0;
+}
+
+void QVReportingDBusServer::clientGone(const std::string& key) {
+    // Calls still kept for the departed client can never be answered.
     std::erase_if(pending_, [&](const auto& entry) {
-        if (entry.second.sender != name) {
+        if (entry.second.client != key) {
             return false;
         }
         callBytes_ -= entry.second.bytes;
@@ -293,311 +434,15 @@ void QVReportingDBusServer::onNameOwnerChanged(sdbus::Message& signal) {
         return true;
     });
     noteBudgets();
-    auto it = clients_.find(name);
+    auto it = clients_.find(key);
     if (it == clients_.end()) {
         return;
     }
     auto client = std::move(it->second.instance);
+    busClientCount_ -= it->second.direct ? 0 : 1;
     clients_.erase(it);
-    clientCount_ = clients_.size();
     QVLOG_DEFAULT(logCategory(), "interruptionHandler: connection exited");
     service_.connectionInvalidated(client);
-}
-
-QVReportingDBusServer::Ticket::~Ticket() {
-    if (answered) {
-        return;
-    }
-    // No answer will come (the rules give this call none): let it go.
-    std::lock_guard lock(lifeline->mutex);
-    if (auto* server = lifeline->server) {
-        server->post([server, id = id] { server->release(id); });
-    }
-}
-
-QVReportingDBusServer::TicketPtr QVReportingDBusServer::hold(sdbus::MethodCall call, Client& client,
-                                                             std::size_t argumentBytes, bool held) {
-    const CallID id = nextCallID_++;
-    // A held call waits on its session, not on the queue: it is kept within the count of held
-    // calls instead of the bytes of calls in flight.
-    const std::size_t bytes = held ? 0 : QVReportingStats::kCallOverheadBytes + argumentBytes;
-    client.callBytes += bytes;
-    client.heldCalls += held ? 1 : 0;
-    callBytes_ += bytes;
-    heldCalls_ += held ? 1 : 0;
-    std::string sender = call.getSender();
-    pending_.emplace(id, Pending{std::move(call), std::move(sender), bytes, held});
-    noteBudgets();
-    return std::make_shared<Ticket>(lifeline_, id);
-}
-
-sdbus::MethodCall QVReportingDBusServer::release(CallID id) {
-    auto it = pending_.find(id);
-    if (it == pending_.end()) {
-        return {};  // the caller left the bus
-    }
-    Pending pending = std::move(it->second);
-    pending_.erase(it);
-    callBytes_ -= pending.bytes;
-    heldCalls_ -= pending.held ? 1 : 0;
-    if (auto c = clients_.find(pending.sender); c != clients_.end()) {
-        c->second.callBytes -= pending.bytes;
-        c->second.heldCalls -= pending.held ? 1 : 0;
-    }
-    noteBudgets();
-    return std::move(pending.call);
-}
-
-void QVReportingDBusServer::chargePayload(Client& client, std::size_t bytes) {
-    client.payloadAllowance -= static_cast<double>(bytes);
-}
-
-void QVReportingDBusServer::noteBudgets() const {
-    QVReportingStats::shared().noteCallBudget(callBytes_, heldCalls_);
-}
-
-void QVReportingDBusServer::answer(const TicketPtr& ticket,
-                                   const std::optional<QVReportingError>& error,
-                                   std::function<void(sdbus::MethodReply&)> fill) {
-    ticket->answered = true;
-    post([this, id = ticket->id, error, fill = std::move(fill)] {
-        sdbus::MethodCall call = release(id);
-        if (!call.isValid() || call.doesntExpectReply()) {
-            return;
-        }
-        if (error) {
-            call.createErrorReply(toBusError(*error)).send();
-            return;
-        }
-        auto reply = call.createReply();
-        if (fill) {
-            fill(reply);
-        }
-        reply.send();
-    });
-}
-
-void QVReportingDBusServer::refuse(sdbus::MethodCall& call, const QVReportingError& error) {
-    if (!call.doesntExpectReply()) {
-        call.createErrorReply(toBusError(error)).send();
-    }
-}
-
-void QVReportingDBusServer::registerReportingInterface() {
-    reporting_ = sdbus::createObject(*connection_, dbus::kObjectPath);
-    const std::string iface = dbus::kInterface;
-    const QVReportingInputBudget budget{limits_.maxPayloadBytes, limits_.maxPayloadValues,
-                                        limits_.maxPayloadDepth};
-
-    auto boolReply = [this](TicketPtr ticket) {
-        return [this, ticket](const std::optional<QVReportingError>& error, bool result) {
-            answer(ticket, error, [result](sdbus::MethodReply& r) { r << result; });
-        };
-    };
-    // Reads a payload or configuration; false (the call refused and counted) when it is not one.
-    auto readPayload = [this, budget](sdbus::MethodCall& call, Client& client,
-                                      QVReportingDecodeResult& decoded) {
-        decoded = QVReportingReadDictionary(call, budget);
-        chargePayload(client, decoded.bytes);
-        if (!decoded.error) {
-            return true;
-        }
-        decoded.limit ? QVReportingStats::shared().noteLimitExceeded(*decoded.limit)
-                      : QVReportingStats::shared().noteInputRefused();
-        refuse(call, *decoded.error);
-        return false;
-    };
-    // What a decoded payload costs while its call waits: as received, and as decoded.
-    auto payloadBytes = [](const QVReportingDecodeResult& decoded) {
-        return decoded.bytes + decoded.dictionary.approximateHeapBytes();
-    };
-    // Handlers for the methods that take one reporter ID and answer a bool.
-    using IDCall = void (QVReportingClientServerInstance::*)(
-        ReporterID, QVReportingClientServerInstance::BoolReply);
-    auto registerIDCall = [&](const char* member, IDCall op, bool held) {
-        reporting_->registerMethod(iface, member, "x", {"reporterID"}, "b", {"result"},
-                                   [this, op, held, boolReply](sdbus::MethodCall call) {
-                                       Client* client = admit(call, held);
-                                       if (!client) {
-                                           return;
-                                       }
-                                       ReporterID id = 0;
-                                       call >> id;
-                                       auto instance = client->instance;
-                                       auto ticket = hold(std::move(call), *client, 0, held);
-                                       ((*instance).*op)(id, boolReply(std::move(ticket)));
-                                   });
-    };
-
-    registerIDCall(dbus::kCreateReportingSession,
-                   &QVReportingClientServerInstance::createReportingSession, false);
-
-    reporting_->registerMethod(iface, dbus::kSetServiceType, "qx", {"serviceType", "reporterID"},
-                               "b", {"result"}, [this, boolReply](sdbus::MethodCall call) {
-                                   Client* client = admit(call);
-                                   if (!client) {
-                                       return;
-                                   }
-                                   std::uint16_t type = 0;
-                                   ReporterID id = 0;
-                                   call >> type >> id;
-                                   auto instance = client->instance;
-                                   instance->setServiceType(
-                                       type, id, boolReply(hold(std::move(call), *client, 0)));
-                               });
-
-    reporting_->registerMethod(
-        iface, dbus::kGetServiceNameForReporterID, "x", {"reporterID"}, "q", {"serviceType"},
-        [this](sdbus::MethodCall call) {
-            Client* client = admit(call);
-            if (!client) {
-                return;
-            }
-            ReporterID id = 0;
-            call >> id;
-            auto instance = client->instance;
-            auto ticket = hold(std::move(call), *client, 0);
-            instance->getServiceNameForReporterID(
-                id, [this, ticket](const std::optional<QVReportingError>& e, AudioServiceType t) {
-                    answer(ticket, e, [t](sdbus::MethodReply& r) { r << t; });
-                });
-        });
-
-    reporting_->registerMethod(
-        iface, dbus::kSetConfiguration, "a{sv}x", {"configuration", "reporterID"}, "b", {"result"},
-        [this, boolReply, readPayload, payloadBytes](sdbus::MethodCall call) {
-            Client* client = admit(call);
-            QVReportingDecodeResult decoded;
-            if (!client || !readPayload(call, *client, decoded)) {
-                return;
-            }
-            ReporterID id = 0;
-            QVReportingReadRest(call, decoded, id);
-            auto instance = client->instance;
-            const std::size_t bytes = payloadBytes(decoded);
-            instance->setConfiguration(std::move(decoded.dictionary), id,
-                                       boolReply(hold(std::move(call), *client, bytes)));
-        });
-
-    registerIDCall(dbus::kStartReportingSession,
-                   &QVReportingClientServerInstance::startReportingSessionForID, true);
-
-    reporting_->registerMethod(
-        iface, dbus::kSendMessage, "a{sv}uqax", {"payload", "category", "type", "reporterIDs"}, "",
-        {}, [this, readPayload, payloadBytes](sdbus::MethodCall call) {
-            Client* client = admit(call);
-            QVReportingDecodeResult decoded;
-            if (!client || !readPayload(call, *client, decoded)) {
-                return;
-            }
-            std::uint32_t category = 0;
-            std::uint16_t type = 0;
-            std::vector<std::int64_t> ids;
-            QVReportingReadRest(call, decoded, category, type, ids);
-            if (ids.size() > limits_.maxReporterIDsPerMessage) {
-                QVReportingStats::shared().noteLimitExceeded(QVReportingStats::Limit::ReporterIDs);
-                return refuse(call, QVReportingError::limitsExceeded(
-                                        fmt::format("a message may name at most {} reporter IDs",
-                                                    limits_.maxReporterIDsPerMessage)));
-            }
-            auto instance = client->instance;
-            const std::size_t bytes = payloadBytes(decoded) + ids.size() * sizeof(ReporterID);
-            auto ticket = hold(std::move(call), *client, bytes);
-            instance->sendMessage(std::move(decoded.dictionary), category, type, std::move(ids),
-                                  [this, ticket](const std::optional<QVReportingError>& e) {
-                                      answer(ticket, e, nullptr);
-                                  });
-        });
-
-    registerIDCall(dbus::kStopReportingSession,
-                   &QVReportingClientServerInstance::stopReportingSessionForID, false);
-    registerIDCall(dbus::kDestroyReportingSession,
-                   &QVReportingClientServerInstance::destroyReportingSession, false);
-
-    reporting_->registerMethod(
-        iface, dbus::kReporterIDValid, "x", {"reporterID"}, "a{sv}", {"reporter"},
-        [this](sdbus::MethodCall call) {
-            Client* client = admit(call);
-            if (!client) {
-                return;
-            }
-            ReporterID id = 0;
-            call >> id;
-            auto instance = client->instance;
-            auto ticket = hold(std::move(call), *client, 0);
-            instance->reporterIDValid(
-                id, [this, ticket](const std::optional<QVReportingError>& e, const Dictionary& d) {
-                    // The reply's two members have fixed types: x and q.
-                    const ReporterID rid =
-                        d.find(dbus::kReporterProxyKeyReporterID)->asInt64().value_or(0);
-                    const auto type = static_cast<std::uint16_t>(
-                        d.find(dbus::kReporterProxyKeyServiceType)->asInt64().value_or(0xFFFF));
-                    answer(ticket, e, [rid, type](sdbus::MethodReply& r) {
-                        std::map<std::string, sdbus::Variant> out{
-                            {dbus::kReporterProxyKeyReporterID, sdbus::Variant(rid)},
-                            {dbus::kReporterProxyKeyServiceType, sdbus::Variant(type)}};
-                        r << out;
-                    });
-                });
-        });
-
-    reporting_->registerMethod(
-        iface, dbus::kGetAllReporters, "", {}, "ax", {"reporterIDs"},
-        [this](sdbus::MethodCall call) {
-            Client* client = admit(call);
-            if (!client) {
-                return;
-            }
-            auto instance = client->instance;
-            auto ticket = hold(std::move(call), *client, 0);
-            instance->getAllReporters([this, ticket](const std::optional<QVReportingError>& e,
-                                                     const std::vector<ReporterID>& ids) {
-                answer(ticket, e, [ids](sdbus::MethodReply& r) { r << ids; });
-            });
-        });
-
-    reporting_->registerMethod(iface, dbus::kKillService, "", {}, "b", {"result"},
-                               [this](sdbus::MethodCall call) {
-                                   if (Client* client = admit(call)) {
-                                       client->instance->killService();
-                                   }
-                               });
-}
-
-void QVReportingDBusServer::registerStatsInterface() {
-    reporting_->registerMethod(dbus::kStatsInterface, dbus::kGetStats, "", {}, "a{sv}", {"stats"},
-                               [this](sdbus::MethodCall call) {
-                                   Dictionary stats = QVReportingStats::shared().dump();
-                                   stats.set("bus_clients", std::uint64_t{clientCount_.load()});
-                                   stats.set("calls_awaiting_reply",
-                                             std::uint64_t{pending_.size()});
-                                   stats.set("bus_reads_paused_now", readsPaused_);
-                                   auto reply = call.createReply();
-                                   QVReportingAppendDictionary(reply, stats);
-                                   reply.send();
-                               });
-}
-
-void QVReportingDBusServer::registerNotifyInterface() {
-    notify_ = sdbus::createObject(*connection_, dbus::kNotifyObjectPath);
-    const std::string iface = dbus::kNotifyInterface;
-    notify_->registerMethod(iface, dbus::kPost, "st", {"name", "state"}, "", {},
-                            [this](sdbus::MethodCall call) {
-                                std::string name;
-                                std::uint64_t state = 0;
-                                call >> name >> state;
-                                notifications_->post(name, state);
-                                call.createReply().send();
-                            });
-    notify_->registerMethod(iface, dbus::kGetState, "s", {"name"}, "t", {"state"},
-                            [this](sdbus::MethodCall call) {
-                                std::string name;
-                                call >> name;
-                                auto reply = call.createReply();
-                                reply << notifications_->stateOf(name);
-                                reply.send();
-                            });
-    notify_->registerSignal(iface, dbus::kPosted, "st", {"name", "state"});
 }
 
 }  // namespace qv

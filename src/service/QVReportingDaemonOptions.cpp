@@ -30,6 +30,14 @@ std::string QVReportingDefaultStateDirectory() {
     return std::string(home && *home ? home : "/tmp") + "/.local/state/qvreportd";
 }
 
+std::string QVReportingDefaultDirectSocket() {
+    if (const char* runtime = std::getenv("RUNTIME_DIRECTORY"); runtime && *runtime) {
+        const std::string dirs = runtime;
+        return dirs.substr(0, dirs.find(':')) + "/direct";
+    }
+    return {};
+}
+
 std::optional<QVReportingDaemonOptions> QVReportingParseDaemonOptions(int argc, char** argv,
                                                                       int& exitCode) {
     QVReportingDaemonOptions o;
@@ -41,6 +49,12 @@ std::optional<QVReportingDaemonOptions> QVReportingParseDaemonOptions(int argc, 
     app.add_option("--bus", o.bus,
                    "Bus to serve on: system, session, or a bus address (unix:path=...)")
         ->capture_default_str();
+    // --- The direct socket ---
+    std::optional<std::string> directSocket;
+    app.add_option("--direct-socket", directSocket,
+                   "Socket on which clients may connect without the bus (peer-to-peer D-Bus, the "
+                   "same interface); \"none\" for none; default: $RUNTIME_DIRECTORY/direct under "
+                   "systemd, else none");
     std::string stateDir;
     app.add_option("--state-dir", stateDir,
                    "State directory (defaults/, sinks/, logs/); default: $STATE_DIRECTORY, "
@@ -166,6 +180,9 @@ std::optional<QVReportingDaemonOptions> QVReportingParseDaemonOptions(int argc, 
     if (internalBuild) {
         o.internalBuild = true;
     }
+    o.directSocket = !directSocket             ? QVReportingDefaultDirectSocket()
+                     : *directSocket == "none" ? std::string()
+                                               : *directSocket;
     o.stateDir = stateDir.empty() ? QVReportingDefaultStateDirectory() : stateDir;
     exitCode = 0;
     return o;

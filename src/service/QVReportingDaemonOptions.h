@@ -12,7 +12,11 @@ namespace qv {
 
 struct QVReportingDaemonOptions {
     std::string bus = "system";  // "system", "session" or a bus address
-    std::string stateDir;        // resolved: never empty after parsing
+    // --- The direct socket ---
+    // Where clients may connect without the bus; empty: nowhere. Resolved by parsing: the
+    // option, else $RUNTIME_DIRECTORY/direct under systemd (RuntimeDirectory=), else none.
+    std::string directSocket;
+    std::string stateDir;  // resolved: never empty after parsing
     std::string deviceFile = "/etc/qvreportd/device.json";
     std::optional<bool> internalBuild;
     std::string analyticsEventsFile;
@@ -47,5 +51,9 @@ std::optional<QVReportingDaemonOptions> QVReportingParseDaemonOptions(int argc, 
 // --state-dir, else $STATE_DIRECTORY (the first of its list), else /var/lib/qvreportd for root,
 // else $XDG_STATE_HOME/qvreportd, else ~/.local/state/qvreportd.
 std::string QVReportingDefaultStateDirectory();
+
+// The direct socket when no option names one: $RUNTIME_DIRECTORY/direct (the first of its
+// list), else none (empty): a daemon started by hand serves the bus only unless asked.
+std::string QVReportingDefaultDirectSocket();
 
 }  // namespace qv

@@ -58,6 +58,8 @@ class QVReportingService final : public QVReportingServiceDelegateProtocol {
     void setReportingEnabled(bool enabled) { reportingEnabled_ = enabled; }
     std::shared_ptr<QVReportingSession> singleMessageSession();
     const QVReportingLimits& limits() const { return limits_; }
+    // The queue the clients' work runs on.
+    SerialQueue& queue() const { return queue_; }
     // Stops and drops the single-message session once it has been idle longer than its timeout.
     void reapSingleMessageSession();
 

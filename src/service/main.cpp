@@ -13,7 +13,7 @@
 #include <filesystem>
 #include <memory>
 
-#include <sdbus-c++/sdbus-c++.h>
+#include <systemd/sd-bus.h>
 
 #include "monitoring/QVReportingSystemMonitor.h"
 #include "platform/linux/DiskBudget.h"
@@ -39,6 +39,7 @@
 #include "platform/linux/LinuxThreadlineModelReader.h"
 #include "service/QVReportingDBusServer.h"
 #include "service/QVReportingDaemonOptions.h"
+#include "service/QVReportingDirectSocket.h"
 #include "service/QVReportingService.h"
 #include "session/QVReportingLog.h"
 #include "session/QVReportingStats.h"
@@ -55,14 +56,27 @@ const QVReportingLogCategory& logCategory() {
     return QVReportingServiceDelegateCategory();
 }
 
-std::unique_ptr<sdbus::IConnection> connectTo(const std::string& bus) {
-    if (bus == "system") {
-        return sdbus::createSystemBusConnection();
+// The bus connection, opened but not yet owning a name; throws std::runtime_error.
+sd_bus* connectTo(const std::string& address) {
+    sd_bus* bus = nullptr;
+    int r = 0;
+    if (address == "system") {
+        r = sd_bus_open_system(&bus);
+    } else if (address == "session") {
+        r = sd_bus_open_user(&bus);
+    } else if ((r = sd_bus_new(&bus)) >= 0) {
+        if ((r = sd_bus_set_address(bus, address.c_str())) >= 0 &&
+            (r = sd_bus_set_bus_client(bus, 1)) >= 0) {
+            r = sd_bus_start(bus);
+        }
+        if (r < 0) {
+            bus = sd_bus_unref(bus);
+        }
     }
-    if (bus == "session") {
-        return sdbus::createSessionBusConnection();
+    if (r < 0) {
+        throw std::runtime_error(std::strerror(-r));
     }
-    return sdbus::createSessionBusConnectionWithAddress(bus);
+    return bus;
 }
 
 // Stopped sessions free their messages in bulk, but the allocator keeps freed pages inside its
@@ -268,14 +282,22 @@ int main(int argc, char** argv) {
     QVReportingSystemMonitor::initializeWithQueue(queue, platform);
     QVReportingService service(platform, queue, options->limits);
 
+    std::unique_ptr<QVReportingDirectSocket> direct;
+    try {
+        if (!options->directSocket.empty()) {
+            direct = QVReportingDirectSocket::listen(options->directSocket);
+        }
+    } catch (const std::runtime_error& e) {
+        QVLOG_ERROR(logCategory(), "cannot listen for direct connections: {}", e.what());
+        return 1;
+    }
     std::unique_ptr<QVReportingDBusServer> server;
     try {
         server = std::make_unique<QVReportingDBusServer>(connectTo(options->bus), service,
-                                                         &notifications);
+                                                         &notifications, std::move(direct));
         server->start();
-    } catch (const sdbus::Error& e) {
-        QVLOG_ERROR(logCategory(), "cannot serve on the {} bus: {} {}", options->bus, e.getName(),
-                    e.getMessage());
+    } catch (const std::runtime_error& e) {
+        QVLOG_ERROR(logCategory(), "cannot serve on the {} bus: {}", options->bus, e.what());
         return 1;
     }
 

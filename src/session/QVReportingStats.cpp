@@ -6,11 +6,17 @@ namespace qv {
 
 namespace {
 
-constexpr std::string_view kLimitNames[] = {
-    "payload_bytes",          "payload_values",        "payload_depth",
-    "reporter_ids",           "sessions_per_client",   "clients",
-    "call_bytes_per_client",  "held_calls_per_client", "held_calls",
-    "payload_rate_per_client"};
+constexpr std::string_view kLimitNames[] = {"payload_bytes",
+                                            "payload_values",
+                                            "payload_depth",
+                                            "reporter_ids",
+                                            "sessions_per_client",
+                                            "clients",
+                                            "call_bytes_per_client",
+                                            "held_calls_per_client",
+                                            "held_calls",
+                                            "payload_rate_per_client",
+                                            "direct_replies_unread"};
 
 void raiseMax(std::atomic<std::uint64_t>& max, std::uint64_t value) {
     std::uint64_t seen = max.load();
@@ -170,6 +176,10 @@ void QVReportingStats::noteBusReadsPaused() {
     busReadsPaused_.fetch_add(1, std::memory_order_relaxed);
 }
 
+void QVReportingStats::noteDirectConnection() {
+    directConnectionsAccepted_.fetch_add(1, std::memory_order_relaxed);
+}
+
 Dictionary QVReportingStats::dump() const {
     Dictionary out;
     std::uint64_t limitsTotal = 0;
@@ -215,6 +225,7 @@ Dictionary QVReportingStats::dump() const {
     out.set("held_calls", heldCalls_.load());
     out.set("held_calls_max", heldCallsMax_.load());
     out.set("bus_reads_paused", busReadsPaused_.load());
+    out.set("direct_connections_accepted", directConnectionsAccepted_.load());
     // Files on disk.
     out.set("files_refused", filesRefused_.load());
     {
@@ -246,6 +257,7 @@ void QVReportingStats::TEST_reset() {
     heldCalls_.store(0);
     heldCallsMax_.store(0);
     busReadsPaused_.store(0);
+    directConnectionsAccepted_.store(0);
     std::lock_guard lock(mutex_);
     sinkLinesLost_.clear();
     issueCaptureRefused_.clear();

@@ -73,7 +73,9 @@ class QVReportingStats {
         CallBytesPerClient,
         HeldCallsPerClient,
         HeldCalls,
-        PayloadRatePerClient
+        PayloadRatePerClient,
+        // A direct connection whose client left this many replies unread was closed.
+        DirectRepliesUnread
     };
 
     static QVReportingStats& shared();
@@ -118,6 +120,10 @@ class QVReportingStats {
     // The daemon stopped reading the bus for want of call budget.
     void noteBusReadsPaused();
 
+    // --- Direct connections (the daemon's own socket beside the bus) ---
+    // A connection was accepted on the direct socket.
+    void noteDirectConnection();
+
     // The store budgets sessions keep to (QVReportingLimits' two store limits).
     void setStoreBudgets(std::size_t perSession, std::size_t total);
     // Takes bytes for a session that already stores sessionBytes: false, with nothing taken,
@@ -147,7 +153,7 @@ class QVReportingStats {
     void TEST_reset();
 
   private:
-    static constexpr std::size_t kLimitKinds = 10;
+    static constexpr std::size_t kLimitKinds = 11;
     // At most this many distinct sink names are tracked; sinks are few and named by the daemon.
     static constexpr std::size_t kMaxTrackedSinks = 32;
 
@@ -170,6 +176,7 @@ class QVReportingStats {
     std::atomic<std::uint64_t> heldCalls_{0};
     std::atomic<std::uint64_t> heldCallsMax_{0};
     std::atomic<std::uint64_t> busReadsPaused_{0};
+    std::atomic<std::uint64_t> directConnectionsAccepted_{0};
     mutable std::mutex mutex_;
     std::map<std::string, std::uint64_t, std::less<>> sinkLinesLost_;        // guarded by mutex_
     std::map<std::string, std::uint64_t, std::less<>> issueCaptureRefused_;  // guarded by mutex_

@@ -49,7 +49,26 @@ void SerialQueue::async(const Lane& lane, std::function<void()> task) {
             ready_.push_back(lane.state_);
         }
     }
+    for (WakeBatch* batch = batch_; batch; batch = batch->outer_) {
+        if (&batch->queue_ == this) {
+            batch->posted_ = true;
+            return;
+        }
+    }
     wake_.notify_one();
+}
+
+thread_local SerialQueue::WakeBatch* SerialQueue::batch_ = nullptr;
+
+SerialQueue::WakeBatch::WakeBatch(SerialQueue& queue) : queue_(queue), outer_(batch_) {
+    batch_ = this;
+}
+
+SerialQueue::WakeBatch::~WakeBatch() {
+    batch_ = outer_;
+    if (posted_) {
+        queue_.wake_.notify_one();
+    }
 }
 
 void SerialQueue::sync(const std::function<void()>& task) {

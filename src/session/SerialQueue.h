@@ -39,6 +39,24 @@ class SerialQueue {
         std::shared_ptr<LaneState> state_;
     };
 
+    // Holds back the wake-ups of the tasks this thread posts to the queue while it lives, and
+    // wakes the queue once at its end if any were posted: a thread that posts a burst (the bus
+    // thread reading a run of calls) then costs the queue one wake-up instead of one a task.
+    // Scopes nest. Only the thread that made it may post under it.
+    class WakeBatch {
+      public:
+        explicit WakeBatch(SerialQueue& queue);
+        ~WakeBatch();
+        WakeBatch(const WakeBatch&) = delete;
+        WakeBatch& operator=(const WakeBatch&) = delete;
+
+      private:
+        friend class SerialQueue;
+        SerialQueue& queue_;
+        WakeBatch* const outer_;
+        bool posted_ = false;
+    };
+
     explicit SerialQueue(std::string label);
     // Runs what was posted before, then ends the thread.
     ~SerialQueue();
@@ -85,6 +103,7 @@ class SerialQueue {
     bool stopping_ = false;                         // guarded by mutex_
     std::thread thread_;
     std::thread::id threadId_;
+    static thread_local WakeBatch* batch_;  // the innermost WakeBatch of this thread
 };
 
 // The one queue of client work, "com.korvane.qvsound.reporting.server", made on first use and

@@ -50,7 +50,8 @@ class TheClientLibrary : public ::testing::Test {
         daemon_ = fork();
         if (daemon_ == 0) {
             execl(QVREPORTD_PATH, QVREPORTD_PATH, "--bus", address_.c_str(), "--state-dir",
-                  (work_ / "state").c_str(), static_cast<char*>(nullptr));
+                  (work_ / "state").c_str(), "--direct-socket", (work_ / "direct").c_str(),
+                  static_cast<char*>(nullptr));
             _exit(127);
         }
         ASSERT_TRUE(waitUntil([&] {
@@ -159,6 +160,46 @@ TEST_F(TheClientLibrary, LosesItsSessionsWhenItsConnectionCloses) {
         EXPECT_EQ(observer->getAllReporters(), std::vector<std::int64_t>{77});
     }
     ASSERT_TRUE(waitUntil([&] { return observer->getAllReporters().empty(); }));
+}
+
+TEST_F(TheClientLibrary, TakesTheDirectSocketOutlivesTheDaemonOnItAndFallsBackToTheBus) {
+    const std::string socket = (work_ / "direct").string();
+    auto direct = QVReportingClient::connect(address_, QVReportingTransport::Auto, socket);
+    auto held = QVReportingClient::connect(address_, QVReportingTransport::Direct, socket);
+    auto overBus = QVReportingClient::connect(address_, QVReportingTransport::Bus, socket);
+    EXPECT_TRUE(direct->isDirect());
+    EXPECT_TRUE(held->isDirect());
+    EXPECT_FALSE(overBus->isDirect());
+    ASSERT_TRUE(held->createReportingSession(7));
+    std::atomic<int> answered{0};
+    std::string heard;
+    held->startReportingSessionAsync(7, [&](const QVReportingClientError* e, bool) {
+        heard = e ? e->name() : "a reply";
+        ++answered;
+    });
+    EXPECT_EQ(overBus->getAllReporters(), (std::vector<std::int64_t>{7}));
+    EXPECT_EQ(direct->daemonOwner(), overBus->daemonOwner());
+    auto stats = direct->getStats();
+    EXPECT_EQ(stats.at("direct_clients").get<std::uint64_t>(), 1u);
+    EXPECT_EQ(stats.at("bus_clients").get<std::uint64_t>(), 1u);
+
+    // Killed from the socket, the daemon takes its connections with it: a held call fails,
+    // and nothing ends the client's process.
+    direct->killService();
+    int status = 0;
+    waitpid(daemon_, &status, 0);
+    daemon_ = 0;
+    EXPECT_EQ(WEXITSTATUS(status), 2);
+    ASSERT_TRUE(waitUntil([&] { return answered.load() > 0; }));
+    EXPECT_EQ(heard, "org.freedesktop.DBus.Error.NoReply");
+    EXPECT_THROW(held->getAllReporters(), QVReportingClientError);
+
+    // The socket it left answers nobody: auto takes the bus, direct says why it cannot.
+    EXPECT_TRUE(std::filesystem::exists(socket));
+    EXPECT_FALSE(
+        QVReportingClient::connect(address_, QVReportingTransport::Auto, socket)->isDirect());
+    EXPECT_THROW(QVReportingClient::connect(address_, QVReportingTransport::Direct, socket),
+                 QVReportingClientError);
 }
 
 }  // namespace

@@ -167,6 +167,18 @@ class Client:
         return bool(self.reporting.StopReportingSession(dbus.Int64(rid)))
 
 
+class DirectClient(Client):
+    """A client on the daemon's direct socket: a peer-to-peer connection, no bus in between."""
+
+    def __init__(self, socket):
+        self.connection = dbus.connection.Connection("unix:path=" + socket)
+        obj = self.connection.get_object(None, OBJECT_PATH, introspect=False)
+        self.reporting = dbus.Interface(obj, INTERFACE)
+        self.stats = dbus.Interface(obj, STATS_INTERFACE)
+        notify = self.connection.get_object(None, NOTIFY_PATH, introspect=False)
+        self.notify = dbus.Interface(notify, NOTIFY_INTERFACE)
+
+
 class DaemonTestCase(unittest.TestCase):
     system_like = False
     daemon_args = ()
@@ -176,7 +188,9 @@ class DaemonTestCase(unittest.TestCase):
         self.bus = Bus(self.workdir, self.system_like)
         state = os.path.join(self.workdir, "state")
         os.makedirs(state)
-        self.daemon = Daemon(self.bus, state, *self.daemon_args)
+        self.direct_socket = os.path.join(self.workdir, "direct")
+        self.daemon = Daemon(self.bus, state, "--direct-socket", self.direct_socket,
+                             *self.daemon_args)
 
     def tearDown(self):
         self.daemon.stop()
@@ -185,3 +199,6 @@ class DaemonTestCase(unittest.TestCase):
 
     def client(self):
         return Client(self.bus)
+
+    def direct_client(self):
+        return DirectClient(self.direct_socket)

@@ -2,6 +2,8 @@
 
 #include <gtest/gtest.h>
 
+#include "service/RawMessage.h"
+
 #include <cstdint>
 #include <functional>
 #include <map>
@@ -37,13 +39,13 @@ sdbus::PlainMessage payload(const std::string& signature,
 
 QVReportingDecodeResult decode(sdbus::Message& m, std::size_t maxValues, std::size_t maxDepth) {
     m.rewind(true);
-    return QVReportingReadDictionary(m, {kBytes, maxValues, maxDepth});
+    return QVReportingReadDictionary(RawMessage::of(m), {kBytes, maxValues, maxDepth});
 }
 
 // What the daemon writes back must read again under the limits the client's payload met.
 void expectRereads(const Dictionary& dictionary, std::size_t maxValues, std::size_t maxDepth) {
     sdbus::PlainMessage again = sdbus::createPlainMessage();
-    QVReportingAppendDictionary(again, dictionary);
+    ASSERT_GE(QVReportingAppendDictionary(RawMessage::of(again), dictionary), 0);
     again.seal();
     const QVReportingDecodeResult reread = decode(again, maxValues, maxDepth);
     ASSERT_FALSE(reread.error) << reread.error->message;

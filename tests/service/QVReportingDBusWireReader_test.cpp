@@ -2,6 +2,8 @@
 
 #include <gtest/gtest.h>
 
+#include "service/RawMessage.h"
+
 #include <cstring>
 #include <functional>
 #include <map>
@@ -249,7 +251,7 @@ TEST(AQVReportingDBusWireReader, RefusesEveryTruncationOfABodyAndOfAMessage) {
     sdbus::PlainMessage m = sdbus::createPlainMessage();
     m << std::map<std::string, sdbus::Variant>{{"k", sdbus::Variant(std::string("v"))}};
     m.seal();
-    auto bytes = QVReportingDBusMessageBytes::forThisThread().of(m);
+    auto bytes = QVReportingDBusMessageBytes::forThisThread().of(RawMessage::of(m));
     ASSERT_TRUE(bytes);
     ASSERT_TRUE(QVReportingDBusWireReader::split(*bytes));
     for (std::size_t size = 0; size < bytes->size(); ++size) {
@@ -271,7 +273,7 @@ TEST(AQVReportingDBusWireReader, AgreesWithTheCodecOnLimitsAndRestOnWhatSdBusRea
     m.closeContainer();
     m << std::uint32_t{7} << std::uint16_t{9} << std::vector<std::int64_t>{-1, 1};
     m.seal();
-    auto bytes = QVReportingDBusMessageBytes::forThisThread().of(m);
+    auto bytes = QVReportingDBusMessageBytes::forThisThread().of(RawMessage::of(m));
     ASSERT_TRUE(bytes);
     const auto wire = QVReportingDBusWireReader::split(*bytes);
     ASSERT_TRUE(wire);
@@ -283,7 +285,8 @@ TEST(AQVReportingDBusWireReader, AgreesWithTheCodecOnLimitsAndRestOnWhatSdBusRea
                 const QVReportingInputBudget budget{maxBytes, maxValues, maxDepth};
                 SCOPED_TRACE(testing::Message() << maxBytes << " " << maxValues << " " << maxDepth);
                 m.rewind(true);
-                const QVReportingDecodeResult codec = QVReportingReadDictionary(m, budget);
+                const QVReportingDecodeResult codec =
+                    QVReportingReadDictionary(RawMessage::of(m), budget);
                 const QVReportingDecodeResult read =
                     QVReportingDBusWireReader::readArguments(*wire, budget);
                 EXPECT_EQ(Value(read.dictionary), Value(codec.dictionary));
@@ -297,8 +300,9 @@ TEST(AQVReportingDBusWireReader, AgreesWithTheCodecOnLimitsAndRestOnWhatSdBusRea
                 std::uint32_t category = 0, wireCategory = 0;
                 std::uint16_t type = 0, wireType = 0;
                 std::vector<std::int64_t> ids, wireIds;
-                QVReportingReadRest(m, codec, category, type, ids);
-                QVReportingReadRest(m, read, wireCategory, wireType, wireIds);
+                ASSERT_TRUE(QVReportingReadRest(RawMessage::of(m), codec, category, type, ids));
+                ASSERT_TRUE(
+                    QVReportingReadRest(RawMessage::of(m), read, wireCategory, wireType, wireIds));
                 EXPECT_EQ(std::tie(wireCategory, wireType, wireIds), std::tie(category, type, ids));
                 EXPECT_EQ(std::tie(category, type, ids),
                           std::tuple(7u, 9, std::vector<std::int64_t>{-1, 1}));

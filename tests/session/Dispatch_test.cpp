@@ -76,6 +76,37 @@ TEST(ASerialQueue, LetsLanesTakeTurnsAndSyncWaitsForEveryLane) {
     EXPECT_GT(at("late"), at("f99"));
 }
 
+TEST(ASerialQueue, WakesOnceABatchOfPostsEndsLosingNoneAcrossNestedBatchesOfTwoQueues) {
+    SerialQueue a("test.a");
+    SerialQueue b("test.b");
+    a.sync([] {});  // both threads idle, waiting for a wake-up
+    b.sync([] {});
+    std::vector<int> seenA, seenB;  // touched only on their queues
+    std::promise<void> doneA, doneB, doneAfter;
+    {
+        SerialQueue::WakeBatch outer(a);
+        for (int i = 0; i < 100; ++i) {
+            a.async([&seenA, i] { seenA.push_back(i); });
+        }
+        {
+            // An inner batch of another queue holds back only that queue's wake-up.
+            SerialQueue::WakeBatch inner(b);
+            b.async([&seenB] { seenB.push_back(1); });
+            b.async([&doneB] { doneB.set_value(); });
+            a.async([&doneA] { doneA.set_value(); });
+        }
+        ASSERT_EQ(doneB.get_future().wait_for(std::chrono::seconds(30)), std::future_status::ready);
+    }
+    ASSERT_EQ(doneA.get_future().wait_for(std::chrono::seconds(30)), std::future_status::ready);
+    // Past its batch, a post wakes the queue at once again.
+    a.async([&doneAfter] { doneAfter.set_value(); });
+    ASSERT_EQ(doneAfter.get_future().wait_for(std::chrono::seconds(30)), std::future_status::ready);
+    a.sync([] {});
+    EXPECT_EQ(seenA.size(), 100u);
+    EXPECT_TRUE(std::is_sorted(seenA.begin(), seenA.end()));
+    EXPECT_EQ(seenB, std::vector<int>{1});
+}
+
 TEST(ARepeatingTimer, FiresUntilItsHandlerDestroysIt) {
     std::promise<int> done;
     std::atomic<int> ticks{0};
