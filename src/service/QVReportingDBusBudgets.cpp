@@ -11,20 +11,12 @@
 
 namespace qv {
 
-namespace {
-
-const QVReportingLogCategory& logCategory() {
-    return QVReportingServiceDelegateCategory();
-}
-
-std::uint64_t monotonicMicros() {
+std::uint64_t QVReportingDBusServer::monotonicMicros() {
     timespec ts{};
     clock_gettime(CLOCK_MONOTONIC, &ts);
     return static_cast<std::uint64_t>(ts.tv_sec) * 1000000u +
            static_cast<std::uint64_t>(ts.tv_nsec) / 1000u;
 }
-
-}  // namespace
 
 QVReportingDBusServer::Client* QVReportingDBusServer::admit(Connection& c, sd_bus_message* call,
                                                             bool held) {
@@ -43,7 +35,8 @@ QVReportingDBusServer::Client* QVReportingDBusServer::admit(Connection& c, sd_bu
             pid_t busPid = 0;
             const int r = sd_bus_query_sender_creds(call, SD_BUS_CREDS_PID, &creds);
             if (r < 0 || sd_bus_creds_get_pid(creds, &busPid) < 0) {
-                QVLOG_ERROR(logCategory(), "no process ID for {}: {}", key, strerror(-r));
+                QVLOG_ERROR(QVReportingServiceDelegateCategory(), "no process ID for {}: {}", key,
+                            strerror(-r));
             }
             sd_bus_creds_unref(creds);
             pid = busPid;
@@ -163,7 +156,8 @@ void QVReportingDBusServer::answer(const TicketPtr& ticket,
         MessagePtr owned(reply);
         if (fill) {
             if (const int r = fill(reply); r < 0) {
-                QVLOG_ERROR(logCategory(), "cannot write a reply: {}", strerror(-r));
+                QVLOG_ERROR(QVReportingServiceDelegateCategory(), "cannot write a reply: {}",
+                            strerror(-r));
                 return;
             }
         }

@@ -29,17 +29,6 @@ constexpr int kCallsPerTurn = 64;
 // without bound. On the bus, the broker plays this part.
 constexpr std::uint64_t kMaxUnreadReplies = 1024;
 
-const QVReportingLogCategory& logCategory() {
-    return QVReportingServiceDelegateCategory();
-}
-
-std::uint64_t monotonicMicros() {
-    timespec ts{};
-    clock_gettime(CLOCK_MONOTONIC, &ts);
-    return static_cast<std::uint64_t>(ts.tv_sec) * 1000000u +
-           static_cast<std::uint64_t>(ts.tv_nsec) / 1000u;
-}
-
 }  // namespace
 
 QVReportingDBusServer::QVReportingDBusServer(sd_bus* bus, QVReportingService& service,
@@ -106,9 +95,11 @@ void QVReportingDBusServer::start() {
     }
     const char* unique = nullptr;
     sd_bus_get_unique_name(bus_.bus, &unique);
-    QVLOG_DEFAULT(logCategory(), "owning bus name {} as {}", dbus::kBusName, unique ? unique : "?");
+    QVLOG_DEFAULT(QVReportingServiceDelegateCategory(), "owning bus name {} as {}", dbus::kBusName,
+                  unique ? unique : "?");
     if (direct_) {
-        QVLOG_DEFAULT(logCategory(), "listening for direct connections on {}", direct_->path());
+        QVLOG_DEFAULT(QVReportingServiceDelegateCategory(),
+                      "listening for direct connections on {}", direct_->path());
     }
     loopThread_ = std::thread([this] {
         loop();
@@ -210,7 +201,7 @@ void QVReportingDBusServer::drainPosted(bool last) {
         try {
             fn();
         } catch (const std::exception& e) {
-            QVLOG_ERROR(logCategory(), "posted work failed: {}", e.what());
+            QVLOG_ERROR(QVReportingServiceDelegateCategory(), "posted work failed: {}", e.what());
         }
     }
 }
@@ -224,21 +215,21 @@ void QVReportingDBusServer::loop() {
             if (!readsPaused_) {
                 readsPaused_ = true;
                 QVReportingStats::shared().noteBusReadsPaused();
-                QVLOG_ERROR(logCategory(),
+                QVLOG_ERROR(QVReportingServiceDelegateCategory(),
                             "calls not yet answered take {} bytes (at most {}): reading the "
                             "bus again when they drain",
                             callBytes_, limits_.maxCallBytes);
             }
             pollfd wake{wakeFd_, POLLIN, 0};
             if (::poll(&wake, 1, -1) < 0 && errno != EINTR) {
-                QVLOG_ERROR(logCategory(), "poll failed: {}", errno);
+                QVLOG_ERROR(QVReportingServiceDelegateCategory(), "poll failed: {}", errno);
             }
             drainPosted();
             continue;
         }
         if (readsPaused_) {
             readsPaused_ = false;
-            QVLOG_DEFAULT(logCategory(), "reading the bus again");
+            QVLOG_DEFAULT(QVReportingServiceDelegateCategory(), "reading the bus again");
         }
         const bool busy = processConnections();
         if (stopping_ || busy) {
@@ -259,7 +250,8 @@ bool QVReportingDBusServer::processConnections() {
             if (r < 0 || (c.direct && sd_bus_is_open(c.bus) <= 0)) {
                 if (!c.direct) {
                     // Without a bus there is nothing to serve: stop the daemon the normal way.
-                    QVLOG_ERROR(logCategory(), "lost the bus: {}", strerror(-r));
+                    QVLOG_ERROR(QVReportingServiceDelegateCategory(), "lost the bus: {}",
+                                strerror(-r));
                     stopping_ = true;
                     ::kill(::getpid(), SIGTERM);
                 }
@@ -286,7 +278,7 @@ bool QVReportingDBusServer::processConnections() {
         } else if (sd_bus_get_n_queued_write(it->bus, &unread) >= 0 && unread > kMaxUnreadReplies) {
             QVReportingStats::shared().noteLimitExceeded(
                 QVReportingStats::Limit::DirectRepliesUnread);
-            QVLOG_ERROR(logCategory(),
+            QVLOG_ERROR(QVReportingServiceDelegateCategory(),
                         "closing direct connection {} of pid {}: {} replies left unread", it->key,
                         it->pid, unread);
             closeDirectConnection(it);
@@ -328,7 +320,7 @@ void QVReportingDBusServer::waitForWork() {
                 : static_cast<int>(std::min<std::uint64_t>((deadline - now + 999) / 1000, 60000));
     }
     if (::poll(fds.data(), fds.size(), timeoutMs) < 0 && errno != EINTR) {
-        QVLOG_ERROR(logCategory(), "poll failed: {}", errno);
+        QVLOG_ERROR(QVReportingServiceDelegateCategory(), "poll failed: {}", errno);
     }
     if (fds[0].revents & POLLIN) {
         drainPosted();
@@ -344,8 +336,9 @@ void QVReportingDBusServer::acceptDirectConnections() {
         // are bounded like the clients.
         if (directConnections_.size() >= limits_.maxClients) {
             QVReportingStats::shared().noteLimitExceeded(QVReportingStats::Limit::Clients);
-            QVLOG_ERROR(logCategory(), "refusing a direct connection of pid {}: {} are open",
-                        peer->pid, directConnections_.size());
+            QVLOG_ERROR(QVReportingServiceDelegateCategory(),
+                        "refusing a direct connection of pid {}: {} are open", peer->pid,
+                        directConnections_.size());
             ::close(peer->fd);
             continue;
         }
@@ -355,8 +348,8 @@ void QVReportingDBusServer::acceptDirectConnections() {
             bus = sd_bus_unref(bus);
         }
         if (r < 0) {
-            QVLOG_ERROR(logCategory(), "cannot serve a direct connection of pid {}: {}", peer->pid,
-                        strerror(-r));
+            QVLOG_ERROR(QVReportingServiceDelegateCategory(),
+                        "cannot serve a direct connection of pid {}: {}", peer->pid, strerror(-r));
             ::close(peer->fd);
             continue;
         }
@@ -383,14 +376,16 @@ void QVReportingDBusServer::acceptDirectConnections() {
         c.pid = peer->pid;
         c.uid = peer->uid;
         if (r < 0 || !registerObjects(c)) {
-            QVLOG_ERROR(logCategory(), "cannot serve a direct connection of pid {}: {}", peer->pid,
+            QVLOG_ERROR(QVReportingServiceDelegateCategory(),
+                        "cannot serve a direct connection of pid {}: {}", peer->pid,
                         strerror(r < 0 ? -r : ENOMEM));
             closeDirectConnection(std::prev(directConnections_.end()));
             continue;
         }
         QVReportingStats::shared().noteDirectConnection();
         directCount_ = directConnections_.size();
-        QVLOG_INFO(logCategory(), "direct connection {} from pid {} uid {}", c.key, c.pid, c.uid);
+        QVLOG_INFO(QVReportingServiceDelegateCategory(), "direct connection {} from pid {} uid {}",
+                   c.key, c.pid, c.uid);
     }
 }
 
@@ -418,7 +413,8 @@ int QVReportingDBusServer::onNameOwnerChanged(sd_bus_message* signal, void* user
     try {
         self->clientGone(name);
     } catch (const std::exception& e) {
-        QVLOG_ERROR(logCategory(), "dropping client {} failed: {}", name, e.what());
+        QVLOG_ERROR(QVReportingServiceDelegateCategory(), "dropping client {} failed: {}", name,
+                    e.what());
     }
     return 0;
 }
@@ -441,7 +437,7 @@ void QVReportingDBusServer::clientGone(const std::string& key) {
     auto client = std::move(it->second.instance);
     busClientCount_ -= it->second.direct ? 0 : 1;
     clients_.erase(it);
-    QVLOG_DEFAULT(logCategory(), "interruptionHandler: connection exited");
+    QVLOG_DEFAULT(QVReportingServiceDelegateCategory(), "interruptionHandler: connection exited");
     service_.connectionInvalidated(client);
 }
 

@@ -168,6 +168,8 @@ class QVReportingDBusServer {
     void answer(const TicketPtr& ticket, const std::optional<QVReportingError>& error, Fill fill);
     // Refuses a call on the loop thread: an error reply, unless the caller expects none.
     static void refuse(sd_bus_message* call, const QVReportingError& error);
+    // Microseconds on the monotonic clock, for the payload rate budget.
+    static std::uint64_t monotonicMicros();
     void noteBudgets() const;
 
     // ---- the interfaces' methods (QVReportingDBusMethods.cpp) ----

@@ -52,10 +52,6 @@ namespace {
 
 using namespace qv;
 
-const QVReportingLogCategory& logCategory() {
-    return QVReportingServiceDelegateCategory();
-}
-
 // The bus connection, opened but not yet owning a name; throws std::runtime_error.
 sd_bus* connectTo(const std::string& address) {
     sd_bus* bus = nullptr;
@@ -129,20 +125,21 @@ int main(int argc, char** argv) {
     std::error_code ec;
     std::filesystem::create_directories(options->stateDir, ec);
     if (ec) {
-        QVLOG_ERROR(logCategory(), "cannot create the state directory {}: {}", options->stateDir,
-                    ec.message());
+        QVLOG_ERROR(QVReportingServiceDelegateCategory(),
+                    "cannot create the state directory {}: {}", options->stateDir, ec.message());
         return 1;
     }
 
     auto reportProblem = [](const std::string& message) {
-        QVLOG_ERROR(logCategory(), "{}", message);
+        QVLOG_ERROR(QVReportingServiceDelegateCategory(), "{}", message);
     };
     LinuxClock clock;
     LinuxDeviceInformation device(options->deviceFile,
                                   std::filesystem::path(options->stateDir) / "logs",
                                   options->internalBuild);
     if (!device.loadError().empty()) {
-        QVLOG_ERROR(logCategory(), "device file ignored: {}", device.loadError());
+        QVLOG_ERROR(QVReportingServiceDelegateCategory(), "device file ignored: {}",
+                    device.loadError());
     }
     if (device.fileRefused()) {
         QVReportingStats::shared().noteFileRefused();
@@ -189,7 +186,7 @@ int main(int argc, char** argv) {
     auto analytics = LinuxAnalyticsService::create(
         options->stateDir, clock, options->analyticsEventsFile, sinkCallbacks, sinkSegments);
     if (!analytics.service) {
-        QVLOG_ERROR(logCategory(), "{}", analytics.error);
+        QVLOG_ERROR(QVReportingServiceDelegateCategory(), "{}", analytics.error);
         return 1;
     }
     LinuxSystemCondition condition;
@@ -288,7 +285,8 @@ int main(int argc, char** argv) {
             direct = QVReportingDirectSocket::listen(options->directSocket);
         }
     } catch (const std::runtime_error& e) {
-        QVLOG_ERROR(logCategory(), "cannot listen for direct connections: {}", e.what());
+        QVLOG_ERROR(QVReportingServiceDelegateCategory(),
+                    "cannot listen for direct connections: {}", e.what());
         return 1;
     }
     std::unique_ptr<QVReportingDBusServer> server;
@@ -297,7 +295,8 @@ int main(int argc, char** argv) {
                                                          &notifications, std::move(direct));
         server->start();
     } catch (const std::runtime_error& e) {
-        QVLOG_ERROR(logCategory(), "cannot serve on the {} bus: {}", options->bus, e.what());
+        QVLOG_ERROR(QVReportingServiceDelegateCategory(), "cannot serve on the {} bus: {}",
+                    options->bus, e.what());
         return 1;
     }
 
@@ -306,7 +305,8 @@ int main(int argc, char** argv) {
 
     int signal = 0;
     sigwait(&stopSignals, &signal);
-    QVLOG_DEFAULT(logCategory(), "stopping on {}: stopping every session", strsignal(signal));
+    QVLOG_DEFAULT(QVReportingServiceDelegateCategory(), "stopping on {}: stopping every session",
+                  strsignal(signal));
     // Sessions stop first so their workers flush into the sinks; then held replies go out, and
     // the sinks and the log are written through before the process leaves.
     service.stopAllSessions();
@@ -318,13 +318,14 @@ int main(int argc, char** argv) {
     // Work the sessions left on the pool (the Convo summaries and flushes) goes into the sinks
     // before they are flushed.
     if (!executor.waitUntilIdle(kPoolDrainTimeout)) {
-        QVLOG_ERROR(logCategory(), "background work still running after {} s; leaving anyway",
+        QVLOG_ERROR(QVReportingServiceDelegateCategory(),
+                    "background work still running after {} s; leaving anyway",
                     std::chrono::duration<double>(kPoolDrainTimeout).count());
     }
     server.reset();
     JsonlSink::flushAll(std::chrono::steady_clock::now() + kShutdownFlushTimeout);
     QVReportingSystemMonitor::reset();
-    QVLOG_DEFAULT(logCategory(), "stopped");
+    QVLOG_DEFAULT(QVReportingServiceDelegateCategory(), "stopped");
     if (auto sink = logSink()) {
         sink->flush();
     }
