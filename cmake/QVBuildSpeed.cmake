@@ -8,16 +8,20 @@ set(QV_PCH_HEADERS
     <variant> <vector> <fmt/format.h> <nlohmann/json.hpp>)
 
 # qv_build_together(TARGET [TESTS] [SEPARATE] [ALONE FILE...])
-#   TESTS     adds GoogleTest and GoogleMock to the precompiled headers
+#   TESTS     adds GoogleTest and GoogleMock to the precompiled headers; without it the target
+#             reuses qv_values' precompiled headers (each one costs as much as a few files)
 #   SEPARATE  precompiled headers only, no unity batches
 #   ALONE     files compiled on their own: file-local names that clash with another file's
 function(qv_build_together target)
     cmake_parse_arguments(ARG "TESTS;SEPARATE" "" "ALONE" ${ARGN})
-    set(headers ${QV_PCH_HEADERS})
     if(ARG_TESTS)
-        list(APPEND headers <gtest/gtest.h> <gmock/gmock.h>)
+        target_precompile_headers(${target} PRIVATE ${QV_PCH_HEADERS} <gtest/gtest.h>
+                                  <gmock/gmock.h>)
+    elseif(target STREQUAL "qv_values")
+        target_precompile_headers(${target} PRIVATE ${QV_PCH_HEADERS})
+    else()
+        target_precompile_headers(${target} REUSE_FROM qv_values)
     endif()
-    target_precompile_headers(${target} PRIVATE ${headers})
     if(NOT ARG_SEPARATE)
         set_target_properties(${target} PROPERTIES UNITY_BUILD ON UNITY_BUILD_BATCH_SIZE 8)
         set_source_files_properties(${ARG_ALONE} TARGET_DIRECTORY ${target}
