@@ -11,9 +11,9 @@
 
 #include <sdbus-c++/sdbus-c++.h>
 
+#include "QVReportingDBusNames.h"
 #include "platform/linux/LinuxNotificationCenter.h"
 #include "service/QVReportingDBusCodec.h"
-#include "service/QVReportingDBusNames.h"
 #include "session/QVReportingLog.h"
 
 namespace qv {
