@@ -147,12 +147,16 @@ int QVReportingCtlComplete(const CLI::App& app, const std::vector<std::string>& 
                 }
                 continue;
             }
-            if (i + 2 == words.size()) {
+            std::size_t value = i + 1;
+            if (value + 1 < words.size() && words[value] == "=") {
+                ++value;  // bash splits "--option=value" at the '='
+            }
+            if (value + 1 == words.size()) {
                 pendingValue = option;
             } else if (option->check_name("--state-dir")) {
-                stateDir = words[i + 1];
+                stateDir = words[value];
             }
-            ++i;
+            i = value;
             continue;
         }
         if (const CLI::App* sub = subcommand(*command, word)) {
