@@ -1,4 +1,4 @@
-// Shell completion of qvreportctl, answered by qvreportctl itself: the completion functions of
+// Shell completion of qvreportctl, answered by qvreportctl itself: the completion function of
 // bash run `qvreportctl __complete -- WORD...` (a command the help leaves out) and offer what it
 // prints, so subcommands and options come from the very command-line definition that parses them.
 #pragma once
