@@ -176,7 +176,7 @@ int run(int argc, char** argv) {
                            "List the issue captures (logs/Audio/Captures) with their manifests");
     c->callback([&] { action = [&] { return printCaptures(options); }; });
 
-    // What the shell completion functions ask for (QVReportingCtlCompletion.h), read before the
+    // What the shell completion function asks for (QVReportingCtlCompletion.h), read before the
     // parser, which would drop the empty word under the cursor.
     if (argc > 2 && argv[1] == std::string_view("__complete") &&
         argv[2] == std::string_view("--")) {
