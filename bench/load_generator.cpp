@@ -38,7 +38,7 @@
 #include <thread>
 #include <vector>
 
-#include "service/QVReportingDBusNames.h"
+#include "QVReportingDBusNames.h"
 
 namespace {
 

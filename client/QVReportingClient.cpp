@@ -7,7 +7,7 @@
 #include <type_traits>
 #include <utility>
 
-#include "service/QVReportingDBusNames.h"
+#include "QVReportingDBusNames.h"
 
 namespace qv::client {
 

@@ -8,7 +8,7 @@
 
 #include "QVReportingCtl.h"
 #include "QVReportingCtlSupport.h"
-#include "service/QVReportingDBusNames.h"
+#include "QVReportingDBusNames.h"
 #include "session/QVReportingVocabulary.h"
 
 namespace qv::ctl {

@@ -6,11 +6,13 @@
 #include <iostream>
 #include <map>
 #include <string>
+#include <string_view>
 #include <vector>
 
 #include <CLI/CLI.hpp>
 
 #include "QVReportingCtl.h"
+#include "QVReportingCtlCompletion.h"
 #include "QVReportingCtlSupport.h"
 
 namespace {
@@ -201,6 +203,13 @@ int run(int argc, char** argv) {
     c = app.add_subcommand("captures",
                            "List the issue captures (logs/Audio/Captures) with their manifests");
     c->callback([&] { action = [&] { return printCaptures(options); }; });
+
+    // What the shell completion function asks for (QVReportingCtlCompletion.h), read before the
+    // parser, which would drop the empty word under the cursor.
+    if (argc > 2 && argv[1] == std::string_view("__complete") &&
+        argv[2] == std::string_view("--")) {
+        return QVReportingCtlComplete(app, std::vector<std::string>(argv + 3, argv + argc));
+    }
 
     try {
         app.parse(argc, argv);

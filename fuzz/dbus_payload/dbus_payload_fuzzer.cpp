@@ -31,11 +31,11 @@
 #include <sdbus-c++/Message.h>
 #include <sdbus-c++/Types.h>
 
+#include "QVReportingDBusNames.h"
 #include "common/DBusTypes.h"
 #include "common/FuzzSupport.h"
 #include "service/QVReportingDBusCodec.h"
 #include "service/QVReportingDBusMessageBytes.h"
-#include "service/QVReportingDBusNames.h"
 #include "service/QVReportingDBusWireReader.h"
 
 // Exported by libsdbus-c++ 1.2 (variants are built on it) but declared in its public headers only

@@ -3,8 +3,8 @@
 // work to the client's object; answers come back through answer().
 #include <fmt/format.h>
 
+#include "QVReportingDBusNames.h"
 #include "platform/linux/LinuxNotificationCenter.h"
-#include "service/QVReportingDBusNames.h"
 #include "service/QVReportingDBusServer.h"
 #include "session/QVReportingLog.h"
 

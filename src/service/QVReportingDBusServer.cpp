@@ -11,8 +11,8 @@
 #include <future>
 #include <stdexcept>
 
+#include "QVReportingDBusNames.h"
 #include "platform/linux/LinuxNotificationCenter.h"
-#include "service/QVReportingDBusNames.h"
 #include "service/QVReportingDirectSocket.h"
 #include "session/QVReportingLog.h"
 

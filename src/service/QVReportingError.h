@@ -3,7 +3,7 @@
 
 #include <string>
 
-#include "service/QVReportingDBusNames.h"
+#include "QVReportingDBusNames.h"
 
 namespace qv {
 

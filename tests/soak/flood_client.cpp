@@ -30,7 +30,7 @@
 
 #include <systemd/sd-bus.h>
 
-#include "service/QVReportingDBusNames.h"
+#include "QVReportingDBusNames.h"
 
 namespace {
 

@@ -32,7 +32,7 @@
 
 #include <sdbus-c++/sdbus-c++.h>
 
-#include "service/QVReportingDBusNames.h"
+#include "QVReportingDBusNames.h"
 
 namespace {
 
