@@ -8,6 +8,7 @@
 // results go to standard output as one JSON document per line.
 #pragma once
 
+#include <chrono>
 #include <cstdint>
 #include <memory>
 #include <string>
@@ -21,6 +22,9 @@
 #include "platform/linux/LinuxPreferenceStore.h"
 
 namespace qv::ctl {
+
+// How long a command or a script waits, after stopping a session, for its held start reply.
+inline constexpr auto kStartReplyWait = std::chrono::seconds(5);
 
 using client::QVReportingClient;
 using client::QVReportingClientError;

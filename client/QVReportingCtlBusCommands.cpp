@@ -13,13 +13,6 @@
 
 namespace qv::ctl {
 
-namespace {
-
-// How long a started session's command waits, after stopping it, for its held start reply.
-constexpr auto kStartReplyWait = std::chrono::seconds(5);
-
-}  // namespace
-
 QVReportingClient& BusCommands::client() {
     if (!client_) {
         client_ =

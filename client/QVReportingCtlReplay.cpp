@@ -19,8 +19,6 @@ namespace qv::ctl {
 
 namespace {
 
-// How long a script waits, after stopping a session, for that session's held start reply.
-constexpr auto kStartReplyWait = std::chrono::seconds(5);
 constexpr std::uint16_t kUnknownServiceType = 65535;
 // How long a script's end waits for answers that it did not wait for on the way.
 constexpr auto kLateAnswerWait = std::chrono::milliseconds(200);

@@ -7,16 +7,20 @@ set(QV_PCH_HEADERS
     <map> <memory> <mutex> <optional> <set> <string> <string_view> <thread> <unordered_map>
     <variant> <vector> <fmt/format.h> <nlohmann/json.hpp>)
 
-# qv_build_together(TARGET [TESTS] [SEPARATE] [ALONE FILE...])
-#   TESTS     adds GoogleTest and GoogleMock to the precompiled headers; without it the target
-#             reuses qv_values' precompiled headers (each one costs as much as a few files)
+# qv_build_together(TARGET [TESTS] [SEPARATE] [HEADERS HEADER...] [ALONE FILE...])
+#   TESTS     adds GoogleTest and GoogleMock to the precompiled headers; without it or HEADERS
+#             the target reuses qv_values' precompiled headers (each one costs as much as a few
+#             files)
+#   HEADERS   more headers of the target's own to precompile
 #   SEPARATE  precompiled headers only, no unity batches
 #   ALONE     files compiled on their own: file-local names that clash with another file's
 function(qv_build_together target)
-    cmake_parse_arguments(ARG "TESTS;SEPARATE" "" "ALONE" ${ARGN})
+    cmake_parse_arguments(ARG "TESTS;SEPARATE" "" "HEADERS;ALONE" ${ARGN})
     if(ARG_TESTS)
-        target_precompile_headers(${target} PRIVATE ${QV_PCH_HEADERS} <gtest/gtest.h>
-                                  <gmock/gmock.h>)
+        list(APPEND ARG_HEADERS <gtest/gtest.h> <gmock/gmock.h>)
+    endif()
+    if(ARG_HEADERS)
+        target_precompile_headers(${target} PRIVATE ${QV_PCH_HEADERS} ${ARG_HEADERS})
     elseif(target STREQUAL "qv_values")
         target_precompile_headers(${target} PRIVATE ${QV_PCH_HEADERS})
     else()
