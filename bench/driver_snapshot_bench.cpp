@@ -16,7 +16,7 @@
 #include "fixtures/LaptopSysfsFixture.h"
 #include "monitoring/QVReportingDriverUtility.h"
 #include "monitoring/QVReportingSessionDriverSnapshotWorker.h"
-#include "platform/linux/LinuxStatFeed.h"
+#include "platform/linux/stats/LinuxStatFeed.h"
 #include "session/QVReportingSession.h"
 #include "session/QVReportingWorkerRegistry.h"
 

@@ -21,9 +21,9 @@
 #include <string>
 
 #include "platform/SinkSegments.h"
-#include "platform/linux/DiskBudget.h"
-#include "platform/linux/JsonlSink.h"
-#include "platform/linux/LinuxClock.h"
+#include "platform/linux/sinks/DiskBudget.h"
+#include "platform/linux/sinks/JsonlSink.h"
+#include "platform/linux/system/LinuxClock.h"
 
 namespace {
 

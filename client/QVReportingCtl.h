@@ -19,7 +19,7 @@
 
 #include "QVReportingClient.h"
 #include "QVReportingJsonVariant.h"
-#include "platform/linux/LinuxPreferenceStore.h"
+#include "platform/linux/system/LinuxPreferenceStore.h"
 
 namespace qv::ctl {
 

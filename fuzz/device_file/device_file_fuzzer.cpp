@@ -17,7 +17,7 @@
 #include <nlohmann/json.hpp>
 
 #include "common/FuzzSupport.h"
-#include "platform/linux/LinuxDeviceInformation.h"
+#include "platform/linux/system/LinuxDeviceInformation.h"
 
 using qv::fuzz::check;
 

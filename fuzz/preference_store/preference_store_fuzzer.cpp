@@ -17,7 +17,7 @@
 #include <nlohmann/json.hpp>
 
 #include "common/FuzzSupport.h"
-#include "platform/linux/LinuxPreferenceStore.h"
+#include "platform/linux/system/LinuxPreferenceStore.h"
 #include "values/ValueJson.h"
 
 namespace {

@@ -6,7 +6,7 @@
 #include <mutex>
 #include <utility>
 
-#include "platform/linux/JsonlSink.h"
+#include "platform/linux/sinks/JsonlSink.h"
 #include "session/QVReportingLog.h"
 #include "session/QVReportingStats.h"
 #include "session/QVReportingUtility.h"

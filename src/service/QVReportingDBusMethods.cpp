@@ -4,7 +4,7 @@
 #include <fmt/format.h>
 
 #include "QVReportingDBusNames.h"
-#include "platform/linux/LinuxNotificationCenter.h"
+#include "platform/linux/system/LinuxNotificationCenter.h"
 #include "service/QVReportingDBusServer.h"
 #include "session/QVReportingLog.h"
 

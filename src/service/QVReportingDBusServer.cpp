@@ -12,7 +12,7 @@
 #include <stdexcept>
 
 #include "QVReportingDBusNames.h"
-#include "platform/linux/LinuxNotificationCenter.h"
+#include "platform/linux/system/LinuxNotificationCenter.h"
 #include "service/QVReportingDirectSocket.h"
 #include "session/QVReportingLog.h"
 

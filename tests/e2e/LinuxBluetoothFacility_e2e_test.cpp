@@ -1,7 +1,7 @@
 // The Linux Bluetooth facility against a BlueZ on a private bus: a dbus-daemon of its own and
 // python-dbusmock's bluez5 template, driven through its mock interface as a test bench would
 // drive a radio. No adapter is needed.
-#include "platform/linux/LinuxBluetoothFacility.h"
+#include "platform/linux/bluetooth/LinuxBluetoothFacility.h"
 
 #include <fcntl.h>
 #include <gtest/gtest.h>

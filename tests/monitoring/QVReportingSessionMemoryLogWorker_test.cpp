@@ -7,7 +7,7 @@
 
 #include "fakes/FakePlatform.h"
 #include "fakes/MemoryLogSink.h"
-#include "platform/linux/LinuxProcessLauncher.h"
+#include "platform/linux/capture/LinuxProcessLauncher.h"
 #include "session/QVReportingSession.h"
 #include "session/QVReportingStats.h"
 #include "session/QVReportingUtility.h"

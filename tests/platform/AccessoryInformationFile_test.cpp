@@ -1,4 +1,4 @@
-#include "platform/linux/AccessoryInformationFile.h"
+#include "platform/linux/bluetooth/AccessoryInformationFile.h"
 
 #include <gtest/gtest.h>
 #include <sys/stat.h>

@@ -1,4 +1,4 @@
-#include "platform/linux/DiskBudget.h"
+#include "platform/linux/sinks/DiskBudget.h"
 
 #include <gtest/gtest.h>
 
@@ -14,7 +14,7 @@
 #include "fakes/FakeClock.h"
 #include "fakes/TempDirectory.h"
 #include "platform/SinkSegments.h"
-#include "platform/linux/JsonlSink.h"
+#include "platform/linux/sinks/JsonlSink.h"
 
 namespace qv {
 namespace {

@@ -1,4 +1,4 @@
-#include "platform/linux/JsonlSink.h"
+#include "platform/linux/sinks/JsonlSink.h"
 
 #include <gtest/gtest.h>
 

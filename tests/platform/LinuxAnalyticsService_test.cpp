@@ -1,4 +1,4 @@
-#include "platform/linux/LinuxAnalyticsService.h"
+#include "platform/linux/sinks/LinuxAnalyticsService.h"
 
 #include <gtest/gtest.h>
 

@@ -1,4 +1,4 @@
-#include "platform/linux/LinuxConvoService.h"
+#include "platform/linux/sinks/LinuxConvoService.h"
 
 #include <gtest/gtest.h>
 

@@ -1,4 +1,4 @@
-#include "platform/linux/LinuxDeviceInformation.h"
+#include "platform/linux/system/LinuxDeviceInformation.h"
 
 #include <gtest/gtest.h>
 

@@ -1,4 +1,4 @@
-#include "platform/linux/LinuxDiagnosticRequestService.h"
+#include "platform/linux/capture/LinuxDiagnosticRequestService.h"
 
 #include <fcntl.h>
 #include <gtest/gtest.h>
@@ -15,8 +15,8 @@
 #include <vector>
 
 #include "fakes/TempDirectory.h"
-#include "platform/linux/LinuxClock.h"
-#include "platform/linux/LinuxConfinedProcess.h"
+#include "platform/linux/capture/LinuxConfinedProcess.h"
+#include "platform/linux/system/LinuxClock.h"
 
 namespace qv {
 namespace {

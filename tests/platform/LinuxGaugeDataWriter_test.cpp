@@ -1,4 +1,4 @@
-#include "platform/linux/LinuxGaugeDataWriter.h"
+#include "platform/linux/trace/LinuxGaugeDataWriter.h"
 
 #include <gtest/gtest.h>
 #include <nlohmann/json.hpp>

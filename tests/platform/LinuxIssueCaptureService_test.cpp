@@ -1,4 +1,4 @@
-#include "platform/linux/LinuxIssueCaptureService.h"
+#include "platform/linux/capture/LinuxIssueCaptureService.h"
 
 #include <fmt/format.h>
 #include <gtest/gtest.h>
@@ -18,7 +18,7 @@
 #include "fakes/FakeClock.h"
 #include "fakes/FakeServices.h"
 #include "fakes/TempDirectory.h"
-#include "platform/linux/IssueCaptureCollector.h"
+#include "platform/linux/capture/IssueCaptureCollector.h"
 
 namespace qv {
 namespace {

@@ -1,4 +1,4 @@
-#include "platform/linux/LinuxIssueFilerService.h"
+#include "platform/linux/capture/LinuxIssueFilerService.h"
 
 #include <fcntl.h>
 #include <gtest/gtest.h>

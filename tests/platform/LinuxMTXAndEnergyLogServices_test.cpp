@@ -8,8 +8,8 @@
 
 #include "fakes/FakeClock.h"
 #include "fakes/TempDirectory.h"
-#include "platform/linux/LinuxEnergyLogService.h"
-#include "platform/linux/LinuxMTXMetricsService.h"
+#include "platform/linux/sinks/LinuxEnergyLogService.h"
+#include "platform/linux/sinks/LinuxMTXMetricsService.h"
 
 namespace qv {
 namespace {

@@ -1,4 +1,4 @@
-#include "platform/linux/LinuxNotificationCenter.h"
+#include "platform/linux/system/LinuxNotificationCenter.h"
 
 #include <gtest/gtest.h>
 

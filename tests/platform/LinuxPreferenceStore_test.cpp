@@ -1,4 +1,4 @@
-#include "platform/linux/LinuxPreferenceStore.h"
+#include "platform/linux/system/LinuxPreferenceStore.h"
 
 #include <fmt/format.h>
 #include <gtest/gtest.h>

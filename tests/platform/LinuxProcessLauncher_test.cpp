@@ -1,4 +1,4 @@
-#include "platform/linux/LinuxProcessLauncher.h"
+#include "platform/linux/capture/LinuxProcessLauncher.h"
 
 #include <gtest/gtest.h>
 

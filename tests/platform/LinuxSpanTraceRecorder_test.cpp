@@ -1,4 +1,4 @@
-#include "platform/linux/LinuxSpanTraceRecorder.h"
+#include "platform/linux/trace/LinuxSpanTraceRecorder.h"
 
 #include <gtest/gtest.h>
 #include <sys/mount.h>
@@ -15,7 +15,7 @@
 #include <fmt/format.h>
 
 #include "fakes/TempDirectory.h"
-#include "platform/linux/LinuxThreadlineModelReader.h"
+#include "platform/linux/trace/LinuxThreadlineModelReader.h"
 
 namespace qv {
 namespace {

@@ -1,4 +1,4 @@
-#include "platform/linux/LinuxStatFeed.h"
+#include "platform/linux/stats/LinuxStatFeed.h"
 
 #include <gtest/gtest.h>
 

@@ -1,4 +1,4 @@
-#include "platform/linux/LinuxSystemCondition.h"
+#include "platform/linux/system/LinuxSystemCondition.h"
 
 #include <gtest/gtest.h>
 #include <unistd.h>

@@ -1,4 +1,4 @@
-#include "platform/linux/LinuxThreadlineModelReader.h"
+#include "platform/linux/trace/LinuxThreadlineModelReader.h"
 
 #include <gtest/gtest.h>
 #include <sys/stat.h>

@@ -11,7 +11,7 @@
 
 #include "fakes/FakeClock.h"
 #include "fakes/FakeTaskExecutor.h"
-#include "platform/linux/LinuxTaskExecutor.h"
+#include "platform/linux/system/LinuxTaskExecutor.h"
 #include "session/AsyncSemaphore.h"
 
 namespace qv {
