@@ -14,22 +14,14 @@
 #include <vector>
 
 #include "QVReportingClient.h"
+#include "fakes/WaitUntil.h"
 
 namespace qv::client {
 namespace {
 
 using namespace std::chrono_literals;
 
-// Waits for a condition, not for a while.
-bool waitUntil(const std::function<bool()>& condition) {
-    const auto deadline = std::chrono::steady_clock::now() + 10s;
-    while (!condition()) {
-        if (std::chrono::steady_clock::now() > deadline)
-            return false;
-        std::this_thread::sleep_for(10ms);
-    }
-    return true;
-}
+using qv::test::waitUntil;
 
 class TheClientLibrary : public ::testing::Test {
   protected:

@@ -21,6 +21,7 @@
 #include <sdbus-c++/sdbus-c++.h>
 
 #include "fakes/TempDirectory.h"
+#include "fakes/WaitUntil.h"
 
 namespace qv {
 namespace {
@@ -29,17 +30,6 @@ using namespace std::chrono_literals;
 
 constexpr const char* kMock = "org.bluez.Mock";
 constexpr const char* kGenericMock = "org.freedesktop.DBus.Mock";
-
-bool waitUntil(const std::function<bool()>& predicate, std::chrono::seconds timeout = 10s) {
-    const auto deadline = std::chrono::steady_clock::now() + timeout;
-    while (!predicate()) {
-        if (std::chrono::steady_clock::now() > deadline) {
-            return false;
-        }
-        std::this_thread::sleep_for(10ms);
-    }
-    return true;
-}
 
 // A private bus and, when asked, a mock BlueZ on it; both ended with the object.
 class PrivateBus {
@@ -79,7 +69,7 @@ class PrivateBus {
         }
         auto daemon =
             sdbus::createProxy(*control_, "org.freedesktop.DBus", "/org/freedesktop/DBus");
-        ASSERT_TRUE(waitUntil([&] {
+        ASSERT_TRUE(test::waitUntil([&] {
             bool owned = false;
             daemon->callMethod("NameHasOwner")
                 .onInterface("org.freedesktop.DBus")
@@ -212,18 +202,18 @@ TEST(TheLinuxBluetoothFacility, FollowsBlueZAndTheAccessoryDirectory) {
     LinuxBluetoothFacility facility(bus.address, dir.path().string(), log.callback());
 
     // No BlueZ yet: unavailable, and said so.
-    ASSERT_TRUE(waitUntil([&] { return log.count("org.bluez has no owner") == 1; }));
+    ASSERT_TRUE(test::waitUntil([&] { return log.count("org.bluez has no owner") == 1; }));
     EXPECT_FALSE(facility.available());
     EXPECT_TRUE(facility.pairedDevices().empty());
 
     bus.startBlueZ();
-    ASSERT_TRUE(waitUntil([&] { return facility.available(); }));
+    ASSERT_TRUE(test::waitUntil([&] { return facility.available(); }));
     bus.mock().callMethod("AddAdapter").onInterface(kMock).withArguments("hci0", "bench");
     const std::string first = bus.addDevice("00:00:00:00:00:01", true, true);
     bus.addDevice("00:00:00:00:00:02", true, false);
     bus.addDevice("00:00:00:00:00:03", false, false);  // seen but not paired
     bus.addDevice("00:00:00:00:00:04", true, false);   // paired, no accessory file
-    ASSERT_TRUE(waitUntil([&] { return facility.pairedDevices().size() == 3; }));
+    ASSERT_TRUE(test::waitUntil([&] { return facility.pairedDevices().size() == 3; }));
     auto devices = facility.pairedDevices();
     EXPECT_EQ(
         addresses(devices),
@@ -241,39 +231,39 @@ TEST(TheLinuxBluetoothFacility, FollowsBlueZAndTheAccessoryDirectory) {
         .callMethod("DisconnectDevice")
         .onInterface(kMock)
         .withArguments("hci0", "00:00:00:00:00:01");
-    ASSERT_TRUE(waitUntil([&] { return !facility.isConnected(first); }));
+    ASSERT_TRUE(test::waitUntil([&] { return !facility.isConnected(first); }));
     bus.mock()
         .callMethod("ConnectDevice")
         .onInterface(kMock)
         .withArguments("hci0", "00:00:00:00:00:01");
-    ASSERT_TRUE(waitUntil([&] { return facility.isConnected(first); }));
+    ASSERT_TRUE(test::waitUntil([&] { return facility.isConnected(first); }));
 
     // The directory is followed: a file that appears, one that goes bad, one that goes away.
     writeAccessory(dir, "00:00:00:00:00:04", kGoodFile);
-    ASSERT_TRUE(waitUntil([&] { return hasInformation(facility, "00:00:00:00:00:04"); }))
+    ASSERT_TRUE(test::waitUntil([&] { return hasInformation(facility, "00:00:00:00:00:04"); }))
         << log.all();
     writeAccessory(dir, "00:00:00:00:00:02", "{\"TELPVersionInfo\": 5, \"CaseInfo\": {}}");
-    ASSERT_TRUE(waitUntil([&] { return !hasInformation(facility, "00:00:00:00:00:02"); }));
+    ASSERT_TRUE(test::waitUntil([&] { return !hasInformation(facility, "00:00:00:00:00:02"); }));
     EXPECT_EQ(log.count("00:00:00:00:00:02.json refused: its \"TELPVersionInfo\" is not a list"),
               1u);
     std::filesystem::remove(dir / "00:00:00:00:00:04.json");
-    ASSERT_TRUE(waitUntil([&] { return !hasInformation(facility, "00:00:00:00:00:04"); }));
+    ASSERT_TRUE(test::waitUntil([&] { return !hasInformation(facility, "00:00:00:00:00:04"); }));
 
     // A device removed from BlueZ leaves the list.
     bus.mock()
         .callMethod("RemoveDevice")
         .onInterface("org.bluez.Adapter1")
         .withArguments(sdbus::ObjectPath(first));
-    ASSERT_TRUE(waitUntil([&] { return facility.pairedDevices().size() == 2; }));
+    ASSERT_TRUE(test::waitUntil([&] { return facility.pairedDevices().size() == 2; }));
     EXPECT_FALSE(facility.isConnected(first));
 
     // BlueZ goes away and comes back: unavailable, then read afresh.
     const auto syncs = facility.TEST_syncCount();
     bus.stopBlueZ();
-    ASSERT_TRUE(waitUntil([&] { return !facility.available(); }));
+    ASSERT_TRUE(test::waitUntil([&] { return !facility.available(); }));
     EXPECT_TRUE(facility.pairedDevices().empty());
     bus.startBlueZ();
-    ASSERT_TRUE(waitUntil([&] { return facility.TEST_syncCount() > syncs; }));
+    ASSERT_TRUE(test::waitUntil([&] { return facility.TEST_syncCount() > syncs; }));
     EXPECT_TRUE(facility.available());
     EXPECT_TRUE(facility.pairedDevices().empty()) << "the new BlueZ has no devices yet";
 }
@@ -291,7 +281,7 @@ TEST(TheLinuxBluetoothFacility, NeverLetsWhatBlueZClaimsNameAFileOutsideItsDirec
     Lines log;
     bus.startBlueZ();
     LinuxBluetoothFacility facility(bus.address, dir.string(), log.callback());
-    ASSERT_TRUE(waitUntil([&] { return facility.available(); }));
+    ASSERT_TRUE(test::waitUntil([&] { return facility.available(); }));
     bus.mock().callMethod("AddAdapter").onInterface(kMock).withArguments("hci0", "bench");
 
     auto raw = [&](const std::string& path, sdbus::Variant address, sdbus::Variant paired) {
@@ -307,8 +297,8 @@ TEST(TheLinuxBluetoothFacility, NeverLetsWhatBlueZClaimsNameAFileOutsideItsDirec
         sdbus::Variant(std::string("yes")));
     raw("/org/bluez/hci0/dev_f", sdbus::Variant(std::string("AA:BB:CC:DD:EE:FF/../../passwd")),
         sdbus::Variant(true));
-    ASSERT_TRUE(waitUntil([&] { return log.count("is not a boolean") == 1; }));
-    ASSERT_TRUE(waitUntil([&] { return facility.pairedDevices().size() == 5; }));
+    ASSERT_TRUE(test::waitUntil([&] { return log.count("is not a boolean") == 1; }));
+    ASSERT_TRUE(test::waitUntil([&] { return facility.pairedDevices().size() == 5; }));
 
     // Only the well-formed address (in any case) has accessory information; the others are
     // listed without any, each refusal logged; a Paired that is not a boolean pairs nothing.

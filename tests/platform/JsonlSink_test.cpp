@@ -25,6 +25,7 @@
 
 #include "fakes/FakeClock.h"
 #include "fakes/TempDirectory.h"
+#include "fakes/WaitUntil.h"
 #include "platform/SinkSegments.h"
 
 namespace qv {
@@ -123,11 +124,7 @@ TEST_F(AJsonlSink, DropsAndCountsLinesWhenItsBufferIsFull) {
     {
         JsonlSink sink((tmp / "plain").string(), "busy", clock, callbacks, /*capacity=*/2);
         sink.append({{"n", 0}});
-        const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(30);
-        while (!holding && std::chrono::steady_clock::now() < deadline) {
-            std::this_thread::sleep_for(std::chrono::milliseconds(1));
-        }
-        ASSERT_TRUE(holding);
+        ASSERT_TRUE(test::waitUntil([&] { return holding.load(); }));
         fs::remove(tmp / "plain");
         for (int i = 1; i <= 5; ++i) {
             refused += sink.append({{"n", i}}) ? 0 : 1;

@@ -15,6 +15,7 @@
 #include <vector>
 
 #include "fakes/TempDirectory.h"
+#include "fakes/WaitUntil.h"
 #include "platform/linux/capture/LinuxConfinedProcess.h"
 #include "platform/linux/system/LinuxClock.h"
 
@@ -51,18 +52,6 @@ bool processGone(pid_t pid) {
     }
     const auto close = text.rfind(')');
     return close != std::string::npos && close + 2 < text.size() && text[close + 2] == 'Z';
-}
-
-// Waits for a condition, not for a while.
-bool waitUntil(const std::function<bool()>& condition) {
-    const auto deadline = std::chrono::steady_clock::now() + 10s;
-    while (!condition()) {
-        if (std::chrono::steady_clock::now() > deadline) {
-            return false;
-        }
-        std::this_thread::sleep_for(5ms);
-    }
-    return true;
 }
 
 class TheLinuxDiagnosticRequestService : public ::testing::Test {
@@ -309,14 +298,15 @@ TEST_F(TheLinuxDiagnosticRequestService, StopsAPerfThatOverstaysWithEverythingIt
     EXPECT_EQ(samples[0]["ok"], false);
     EXPECT_EQ(samples[0]["error"], "perf record did not finish within 150 ms and was stopped");
     const pid_t child = std::stoi(readFile(pidFile));
-    EXPECT_TRUE(waitUntil([&] { return processGone(child); })) << "what perf started goes with it";
+    EXPECT_TRUE(test::waitUntil([&] { return processGone(child); }))
+        << "what perf started goes with it";
     EXPECT_EQ(service->counters().samplesFailed, 1u);
 
     // A sampler still running when the service goes is killed, and says so.
     const fs::path started = spinlogs / "started";
     auto hanging = make(options(fakePerf("touch started\nexec sleep 1000")));
     request(*hanging, 2);
-    ASSERT_TRUE(waitUntil([&] { return fs::exists(started); }));
+    ASSERT_TRUE(test::waitUntil([&] { return fs::exists(started); }));
     hanging.reset();
     const auto stopped = lines("sample");
     ASSERT_EQ(stopped.size(), 2u);
