@@ -22,7 +22,7 @@ DAEMON = os.environ.get("QVREPORTD", "qvreportd")
 SOURCE_DIR = os.environ.get("QV_SOURCE_DIR", os.path.join(os.path.dirname(__file__), "..", ".."))
 
 
-def wait_until(predicate, timeout=10.0, interval=0.02, what="condition"):
+def wait_until(predicate, timeout=30.0, interval=0.02, what="condition"):
     deadline = time.monotonic() + timeout
     while True:
         value = predicate()
@@ -89,12 +89,12 @@ class Bus:
 
     def stop(self):
         self.process.terminate()
-        self.process.wait(timeout=10)
+        self.process.wait(timeout=30)
         self.process.stdout.close()
 
 
 class Daemon:
-    def __init__(self, bus, state_dir, *extra, preexec_fn=None, timeout=10.0):
+    def __init__(self, bus, state_dir, *extra, preexec_fn=None, timeout=30.0):
         self.state_dir = state_dir
         self.log_path = os.path.join(state_dir, "..", "qvreportd.log")
         self.log = open(self.log_path, "w")
@@ -133,7 +133,7 @@ class Daemon:
         if self.process.poll() is None:
             self.process.send_signal(signal.SIGTERM)
         try:
-            return self.process.wait(timeout=10)
+            return self.process.wait(timeout=30)
         finally:
             self.log.close()
 

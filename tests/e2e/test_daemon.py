@@ -64,7 +64,7 @@ class SingleMessageSession(DaemonTestCase):
                             what="the message in the standalone session")
         self.assertEqual(events[0]["payload"]["lonely"], 1)
         wait_until(lambda: "Stopping singleMessageSession after timeout=5.000000" in self.daemon.log_text(),
-                   timeout=12, what="the idle session to be reaped")
+                   timeout=30, what="the idle session to be reaped")
         c.send({"nowhere": 1}, GENERIC_CATEGORY, GENERIC_TYPE, [123])  # unknown IDs never make one
         self.assertEqual(self.daemon.log_text().count("Creating singleMessageSession"), 1)
 
@@ -224,7 +224,7 @@ class Shutdown(DaemonTestCase):
             c.send({"i": i}, PLAYBACK, START, [12])
         self.daemon.process.send_signal(signal.SIGTERM)
         self.bus.process.kill()
-        self.assertEqual(self.daemon.process.wait(timeout=10), 0)
+        self.assertEqual(self.daemon.process.wait(timeout=30), 0)
         self.assertEqual(len(self.daemon.events("com.korvane.qvsound.Playback.Start")), 50)
 
 
@@ -238,7 +238,7 @@ class KillService(DaemonTestCase):
         for i in range(300):  # each answered once its events are in the sink's buffer
             c.send({"i": i, "padding": "x" * 200}, PLAYBACK, START, [41])
         c.reporting.KillService(ignore_reply=True)
-        self.assertEqual(self.daemon.process.wait(timeout=10), 2)
+        self.assertEqual(self.daemon.process.wait(timeout=30), 2)
         lines = self.daemon.sink_lines("analytics")
         starts = [l for l in lines if l["event"] == "com.korvane.qvsound.Playback.Start"]
         self.assertEqual([l["payload"]["i"] for l in starts], list(range(300)))

@@ -33,7 +33,7 @@ class BusPolicy(DaemonTestCase):
         self.assertEqual(out.stdout.splitlines(), [
             "create True", "reporters [31]", "kill refused org.freedesktop.DBus.Error.AccessDenied"])
         self.client().reporting.KillService(ignore_reply=True)
-        self.assertEqual(self.daemon.process.wait(timeout=10), 2)
+        self.assertEqual(self.daemon.process.wait(timeout=30), 2)
 
 
 if __name__ == "__main__":
