@@ -70,9 +70,8 @@ TEST(QVBridgeEventQueue, CloseDrainsThenStopsWaiting) {
     EXPECT_FALSE(q.push(event(Kind::kMessage, 1)));
     QVBridgeEvent e;
     EXPECT_TRUE(q.pop(e, 10s));
-    const auto before = std::chrono::steady_clock::now();
-    EXPECT_FALSE(q.pop(e, 10s));  // closed and empty: at once, not after 10 s
-    EXPECT_LT(std::chrono::steady_clock::now() - before, 5s);
+    // Closed and empty: false at once; a pop that waited out its time-out would hang the test.
+    EXPECT_FALSE(q.pop(e, std::chrono::hours(24)));
 }
 
 TEST(QVBridgeEventQueue, APopperWakesForAPushFromAnotherThread) {
