@@ -1,11 +1,6 @@
 #include "platform/linux/bluetooth/AccessoryInformationFile.h"
 
-#include <fcntl.h>
-#include <sys/stat.h>
-#include <unistd.h>
-
-#include <cerrno>
-#include <cstring>
+#include <algorithm>
 
 #include <fmt/format.h>
 #include <nlohmann/json.hpp>
@@ -22,10 +17,7 @@ namespace {
 constexpr std::size_t kAddressLength = 17;  // "AA:BB:CC:DD:EE:FF"
 
 AccessoryFileResult refused(std::string reason) {
-    AccessoryFileResult r;
-    r.status = AccessoryFileResult::Status::Refused;
-    r.reason = std::move(reason);
-    return r;
+    return {AccessoryFileResult::Status::Refused, {}, std::move(reason)};
 }
 
 }  // namespace

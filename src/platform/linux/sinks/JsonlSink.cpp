@@ -36,29 +36,6 @@ std::string errnoText(int error) {
 std::mutex gSinksMutex;
 std::vector<JsonlSink*> gSinks;  // guarded by gSinksMutex
 
-// Where a torn last line starts in a file of `size` bytes: just after its last line feed (0 when
-// it has none); -1 when the file ends with a line feed or cannot be read.
-off_t startOfTornLine(int fd, off_t size) {
-    char block[4096];
-    off_t end = size;
-    bool atEnd = true;
-    while (end > 0) {
-        const off_t from = std::max<off_t>(0, end - static_cast<off_t>(sizeof block));
-        const ssize_t n = ::pread(fd, block, static_cast<std::size_t>(end - from), from);
-        if (n != end - from) {
-            return -1;
-        }
-        for (ssize_t i = n - 1; i >= 0; --i) {
-            if (block[i] == '\n') {
-                return atEnd && i == n - 1 ? -1 : from + i + 1;
-            }
-            atEnd = false;
-        }
-        end = from;
-    }
-    return 0;
-}
-
 // Where the line that ends just before `end` starts: just after the line feed before it.
 off_t startOfLineBefore(int fd, off_t end) {
     char block[4096];
@@ -76,6 +53,19 @@ off_t startOfLineBefore(int fd, off_t end) {
         end = from;
     }
     return 0;
+}
+
+// Where a torn last line starts in a file of `size` bytes: just after its last line feed (0 when
+// it has none); -1 when the file ends with a line feed or cannot be read.
+off_t startOfTornLine(int fd, off_t size) {
+    if (size == 0) {
+        return 0;
+    }
+    char last = 0;
+    if (::pread(fd, &last, 1, size - 1) != 1) {
+        return -1;
+    }
+    return last == '\n' ? -1 : startOfLineBefore(fd, size);
 }
 
 // The start of the line at offset: enough for its "time" and "seq".

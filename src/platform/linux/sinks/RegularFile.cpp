@@ -14,10 +14,7 @@ namespace qv {
 namespace {
 
 RegularFileRead refused(std::string reason) {
-    RegularFileRead r;
-    r.status = RegularFileRead::Status::Refused;
-    r.reason = std::move(reason);
-    return r;
+    return {RegularFileRead::Status::Refused, {}, std::move(reason)};
 }
 
 }  // namespace
