@@ -34,9 +34,13 @@ class ExportTestCase(unittest.TestCase):
     def setUp(self):
         self.workdir = tempfile.mkdtemp(prefix="qvexport-")
         self.state = os.path.join(self.workdir, "state")
-        self.server = NatsServer(self.workdir, "single")
-        self.server.start()
         self.exporters = []
+        self.server = self.make_server()
+        self.server.start()
+        self.url = self.server.url
+
+    def make_server(self):
+        return NatsServer(self.workdir, "single")
 
     def tearDown(self):
         for exporter in self.exporters:
@@ -44,8 +48,8 @@ class ExportTestCase(unittest.TestCase):
         self.server.stop()
         shutil.rmtree(self.workdir, ignore_errors=True)
 
-    def exporter(self, *extra):
-        exporter = Exporter(self.workdir, self.state, self.server.url, *extra)
+    def exporter(self, *extra, state=None, name="exporter"):
+        exporter = Exporter(self.workdir, state or self.state, self.url, *extra, name=name)
         self.exporters.append(exporter)
         return exporter
 
@@ -171,11 +175,10 @@ class Everyday(ExportTestCase):
         StreamComparison(self.server.url, self.state, ["analytics"]).check(self)
 
 
-class Security(unittest.TestCase):
+class Security(ExportTestCase):
     """TLS through the URL and an nkey file, against a server that requires both."""
 
-    def setUp(self):
-        self.workdir = tempfile.mkdtemp(prefix="qvexport-tls-")
+    def make_server(self):
         cert, key = (os.path.join(self.workdir, n) for n in ("cert.pem", "key.pem"))
         subprocess.run(["openssl", "req", "-x509", "-newkey", "ec", "-pkeyopt",
                         "ec_paramgen_curve:prime256v1", "-nodes", "-keyout", key, "-out", cert,
@@ -191,27 +194,19 @@ class Security(unittest.TestCase):
         self.stranger = os.path.join(self.workdir, "stranger.nk")
         with open(self.stranger, "w") as f:
             f.write(f"{stranger_public}\n{stranger_seed}\n")
-        self.server = NatsServer(
+        return NatsServer(
             self.workdir, "secure",
             extra_config=(f'tls {{ cert_file: "{cert}", key_file: "{key}" }}\n'
                           f"authorization {{ users = [ {{ nkey: {public} }} ] }}\n"))
-        self.server.start()
-        self.url = f"tls://127.0.0.1:{self.server.port}"
-        self.exporters = []
 
-    def tearDown(self):
-        for exporter in self.exporters:
-            exporter.stop(signal.SIGKILL)
-        self.server.stop()
-        shutil.rmtree(self.workdir, ignore_errors=True)
+    def setUp(self):
+        super().setUp()
+        self.url = f"tls://127.0.0.1:{self.server.port}"
 
     def test_tls_and_nkey(self):
-        state = os.path.join(self.workdir, "state")
-        SinkFiles(state, "analytics").append(20)
-        exporter = Exporter(self.workdir, state, self.url, "--tls-ca", self.cert, "--nkey",
-                            self.nkey)
-        self.exporters.append(exporter)
-        exporter.start().wait_caught_up({"analytics": 20})
+        SinkFiles(self.state, "analytics").append(20)
+        self.exporter("--tls-ca", self.cert, "--nkey", self.nkey).start().wait_caught_up(
+            {"analytics": 20})
         secure = ("--tls-ca", self.cert, "--nkey", self.nkey)
         lines = stream_lines(self.url, *secure)
         self.assertEqual([seq for _, lines in lines.items() for seq, _ in lines], list(range(1, 21)))
@@ -226,10 +221,8 @@ class Security(unittest.TestCase):
             self.assertIn("cannot connect", done.stderr)
         stranger_state = os.path.join(self.workdir, "stranger-state")
         SinkFiles(stranger_state, "analytics").append(5)
-        stranger = Exporter(self.workdir, stranger_state, self.url, "--tls-ca", self.cert,
-                            "--nkey", self.stranger, name="stranger")
-        self.exporters.append(stranger)
-        stranger.start()
+        stranger = self.exporter("--tls-ca", self.cert, "--nkey", self.stranger,
+                                 state=stranger_state, name="stranger").start()
         # Three seconds of trying (the right key connects within a few milliseconds).
         def tried_long_enough():
             status = stranger.status()
