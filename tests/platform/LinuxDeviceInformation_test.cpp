@@ -60,6 +60,11 @@ TEST_F(ALinuxDeviceInformation, UsesAnObjectAndRefusesEverythingElseNamingTheFil
 }
 
 TEST_F(ALinuxDeviceInformation, RefusesWhatIsNotASmallRegularFileWithoutBlockingOrReadingOn) {
+    // A valid device file of exactly `bytes` bytes.
+    const auto padded = [](std::size_t bytes) {
+        const std::string head = R"({"InternalBuild": true, "pad": ")";
+        return head + std::string(bytes - head.size() - 2, ' ') + "\"}";
+    };
     const std::string valid = write(R"({"InternalBuild": true})");
     const struct {
         std::string path;
@@ -75,10 +80,8 @@ TEST_F(ALinuxDeviceInformation, RefusesWhatIsNotASmallRegularFileWithoutBlocking
         {(dir / "link").string(), [&](const fs::path& p) { fs::create_symlink(valid, p); },
          "it is a symbolic link"},
         {(dir / "large").string(),
-         [](const fs::path& p) {
-             std::ofstream(p) << "{\"InternalBuild\": true, \"pad\": \""
-                              << std::string(LinuxDeviceInformation::kMaxDeviceFileBytes, ' ')
-                              << "\"}";
+         [&](const fs::path& p) {
+             std::ofstream(p) << padded(LinuxDeviceInformation::kMaxDeviceFileBytes + 1);
          },
          "more than the 1048576 accepted"},
     };
@@ -93,6 +96,11 @@ TEST_F(ALinuxDeviceInformation, RefusesWhatIsNotASmallRegularFileWithoutBlocking
         EXPECT_EQ(device.boolAnswer("InternalBuild"), std::nullopt) << c.path;
     }
     EXPECT_FALSE(LinuxDeviceInformation(valid, dir, std::nullopt).fileRefused());
+    // The limit itself is accepted.
+    const LinuxDeviceInformation atLimit(write(padded(LinuxDeviceInformation::kMaxDeviceFileBytes)),
+                                         dir, std::nullopt);
+    EXPECT_EQ(atLimit.loadError(), "");
+    EXPECT_EQ(atLimit.boolAnswer("InternalBuild"), true);
 }
 
 }  // namespace
