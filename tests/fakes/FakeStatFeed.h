@@ -65,10 +65,6 @@ class FakeStatFeed : public StatFeed {
         std::lock_guard lock(mutex_);
         channelErrors_[description] = code;
     }
-    void failSubscriptions(long code) {
-        std::lock_guard lock(mutex_);
-        subscriptionError_ = code;
-    }
     void failSamples(long code) {
         std::lock_guard lock(mutex_);
         samplesError_ = code;
@@ -104,9 +100,6 @@ class FakeStatFeed : public StatFeed {
 
     StatFeedResult<Subscribed> createSubscription(const StatFeedChannelSet& channels) override {
         std::lock_guard lock(mutex_);
-        if (subscriptionError_ != 0) {
-            return StatFeedError{subscriptionError_};
-        }
         auto subscription = std::make_shared<Subscription>();
         for (const auto& info : channels) {
             subscription->ids.push_back(info->id);
@@ -153,7 +146,6 @@ class FakeStatFeed : public StatFeed {
     std::vector<std::shared_ptr<StatFeedChannelInfo>> channels_;
     std::map<std::uint64_t, Reading> readings_;
     std::map<std::string, long> channelErrors_;
-    long subscriptionError_ = 0;
     long samplesError_ = 0;
     double uptime_ = 1000.0;
     int channelsInGroupCalls_ = 0;

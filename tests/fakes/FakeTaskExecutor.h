@@ -72,10 +72,6 @@ class FakeTaskExecutor : public TaskExecutor {
         }
     }
 
-    std::size_t queuedTasks() const {
-        std::lock_guard lock(mutex_);
-        return tasks_.size();
-    }
     std::size_t pendingTimers() const {
         std::lock_guard lock(mutex_);
         return timers_.size();

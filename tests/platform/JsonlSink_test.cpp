@@ -24,6 +24,7 @@
 #include <vector>
 
 #include "fakes/FakeClock.h"
+#include "fakes/SinkLines.h"
 #include "fakes/TempDirectory.h"
 #include "fakes/WaitUntil.h"
 #include "platform/SinkSegments.h"
@@ -57,12 +58,7 @@ class AJsonlSink : public ::testing::Test {
         return problems;
     }
     static std::vector<ordered_json> readLines(const fs::path& path) {
-        std::ifstream in(path, std::ios::binary);
-        std::vector<ordered_json> lines;
-        for (std::string line; std::getline(in, line);) {
-            lines.push_back(ordered_json::parse(line));
-        }
-        return lines;
+        return test::readSinkLines(path);
     }
 
     test::TempDirectory tmp{"qvsink"};

@@ -13,6 +13,7 @@
 
 #include "fakes/FakeClock.h"
 #include "fakes/FakeServices.h"
+#include "fakes/SinkLines.h"
 #include "fakes/TempDirectory.h"
 
 namespace qv {
@@ -24,12 +25,7 @@ class ALinuxConvoService : public ::testing::Test {
   protected:
     std::vector<nlohmann::ordered_json> lines() {
         service.flush();
-        std::vector<nlohmann::ordered_json> out;
-        std::ifstream file(tmp.path() / "sinks" / "convo.jsonl");
-        for (std::string line; std::getline(file, line);) {
-            out.push_back(nlohmann::ordered_json::parse(line));
-        }
-        return out;
+        return test::readSinkLines(tmp.path() / "sinks" / "convo.jsonl");
     }
     // The answer to a configuration, and the thread it came on.
     std::pair<Backends, std::thread::id> configure(ConvoSession& session) {

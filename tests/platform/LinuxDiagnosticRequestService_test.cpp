@@ -14,6 +14,7 @@
 #include <thread>
 #include <vector>
 
+#include "fakes/SinkLines.h"
 #include "fakes/TempDirectory.h"
 #include "fakes/WaitUntil.h"
 #include "platform/linux/capture/LinuxConfinedProcess.h"
@@ -24,19 +25,9 @@ namespace {
 
 namespace fs = std::filesystem;
 using namespace std::chrono_literals;
-using Json = nlohmann::json;
+using Json = nlohmann::ordered_json;
 
 constexpr DiagnosticRequestOptions kSpinlog{true, true, false, false, false};
-
-std::vector<Json> readLines(const fs::path& path) {
-    std::vector<Json> lines;
-    std::ifstream in(path);
-    std::string line;
-    while (std::getline(in, line)) {
-        lines.push_back(Json::parse(line));
-    }
-    return lines;
-}
 
 std::string readFile(const fs::path& path) {
     std::ifstream in(path);
@@ -96,14 +87,8 @@ class TheLinuxDiagnosticRequestService : public ::testing::Test {
         service.request("com.korvane.qvsound", "AudioOverloads", "com.example.daw",
                         Dictionary{{"smallest_buffer_frame_size", 1024}, {"n", n}}, o);
     }
-    std::vector<Json> lines(const std::string& op) const {
-        std::vector<Json> out;
-        for (auto& l : readLines(state / "sinks/diagnostics.jsonl")) {
-            if (l["op"] == op) {
-                out.push_back(l);
-            }
-        }
-        return out;
+    std::vector<nlohmann::ordered_json> lines(const std::string& op) const {
+        return test::readSinkLines(state / "sinks/diagnostics.jsonl", op);
     }
     std::vector<std::string> noticesSoFar() {
         std::lock_guard lock(mutex);

@@ -17,6 +17,7 @@
 
 #include "fakes/FakeClock.h"
 #include "fakes/FakeServices.h"
+#include "fakes/SinkLines.h"
 #include "fakes/TempDirectory.h"
 #include "platform/linux/capture/IssueCaptureCollector.h"
 
@@ -87,17 +88,9 @@ class ALinuxIssueCaptureService : public ::testing::Test {
         std::ifstream in(captures() / captureID / "manifest.json");
         return nlohmann::json::parse(in, nullptr, false);
     }
-    std::vector<nlohmann::json> sinkLines(std::string_view op) {
+    std::vector<nlohmann::ordered_json> sinkLines(std::string_view op) {
         service->flush();
-        std::vector<nlohmann::json> out;
-        std::ifstream in(state / "sinks/issuecapture.jsonl");
-        for (std::string line; std::getline(in, line);) {
-            auto j = nlohmann::json::parse(line);
-            if (j["op"] == op) {
-                out.push_back(j);
-            }
-        }
-        return out;
+        return test::readSinkLines(state / "sinks/issuecapture.jsonl", op);
     }
     void set(std::string_view key, Value value) {
         preferences.setValue(LinuxIssueCaptureService::kSuite, key, value);

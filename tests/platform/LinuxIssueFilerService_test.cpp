@@ -21,6 +21,7 @@
 #include <vector>
 
 #include "fakes/FakeClock.h"
+#include "fakes/SinkLines.h"
 #include "fakes/TempDirectory.h"
 #include "fakes/WaitUntil.h"
 
@@ -29,17 +30,7 @@ namespace {
 
 namespace fs = std::filesystem;
 using namespace std::chrono_literals;
-using Json = nlohmann::json;
-
-std::vector<Json> readLines(const fs::path& path) {
-    std::vector<Json> lines;
-    std::ifstream in(path);
-    std::string line;
-    while (std::getline(in, line)) {
-        lines.push_back(Json::parse(line));
-    }
-    return lines;
-}
+using Json = nlohmann::ordered_json;
 
 IssueDraft sampleDraft() {
     IssueDraft draft;
@@ -143,15 +134,8 @@ class TheLinuxIssueFilerService : public ::testing::Test {
             completions.push_back({error, std::this_thread::get_id()});
         };
     }
-    std::vector<Json> sinkLines() const { return readLines(state / "sinks/issuefiler.jsonl"); }
-    static std::vector<Json> withOp(const std::vector<Json>& lines, const std::string& op) {
-        std::vector<Json> out;
-        for (const auto& l : lines) {
-            if (l["op"] == op) {
-                out.push_back(l);
-            }
-        }
-        return out;
+    std::vector<nlohmann::ordered_json> sinkLines(std::string_view op = {}) const {
+        return test::readSinkLines(state / "sinks/issuefiler.jsonl", op);
     }
 
     // A private session bus, or nothing where dbus-daemon or python's D-Bus modules are missing.
@@ -215,8 +199,7 @@ TEST_F(TheLinuxIssueFilerService, WithoutASessionBusRecordsTheDraftAndSaysWhyNoP
     service->createDraft(sampleDraft(), "", "again", recorder());
     service->flush();
 
-    const auto lines = sinkLines();
-    const auto drafts = withOp(lines, "draft");
+    const auto drafts = sinkLines("draft");
     ASSERT_EQ(drafts.size(), 2u);
     const Json& d = drafts[0];
     EXPECT_EQ(d["draft"], 1);
@@ -233,7 +216,7 @@ TEST_F(TheLinuxIssueFilerService, WithoutASessionBusRecordsTheDraftAndSaysWhyNoP
               Json::array({"com.korvane.DiagnosticExtensions.audio"}));
     EXPECT_EQ(drafts[1]["draft"], 2);
 
-    const auto prompts = withOp(lines, "prompt");
+    const auto prompts = sinkLines("prompt");
     ASSERT_EQ(prompts.size(), 2u);
     for (std::size_t i = 0; i < 2; ++i) {
         EXPECT_EQ(prompts[i]["draft"], static_cast<int>(i + 1));
@@ -263,14 +246,14 @@ TEST_F(TheLinuxIssueFilerService, PromptsThroughTheDesktopNotificationServiceWhe
                          "a Vidcall spatial positioning error occurred", recorder());
     service->flush();
 
-    const auto prompts = withOp(sinkLines(), "prompt");
+    const auto prompts = sinkLines("prompt");
     ASSERT_EQ(prompts.size(), 2u);
     EXPECT_EQ(prompts[0]["shown"], false);
     EXPECT_EQ(prompts[0]["reason"], "no notification service on the session bus");
     EXPECT_EQ(prompts[1]["shown"], true);
     EXPECT_EQ(prompts[1]["notification"], 1);
 
-    const auto notified = readLines(state / "notified.jsonl");
+    const auto notified = test::readSinkLines(state / "notified.jsonl");
     ASSERT_EQ(notified.size(), 1u);
     EXPECT_EQ(notified[0]["app_name"], "qvreportd");
     EXPECT_EQ(notified[0]["summary"], "Invalid x/y coordinates during a Vidcall call (ITF)");
@@ -304,10 +287,9 @@ TEST_F(TheLinuxIssueFilerService, GivesUpOnANotificationServiceThatHangsWithoutP
     }
     service->flush();
 
-    const auto lines = sinkLines();
-    EXPECT_EQ(withOp(lines, "draft").size(), 4u);
+    EXPECT_EQ(sinkLines("draft").size(), 4u);
     std::map<int, std::string> reasons;
-    for (const auto& p : withOp(lines, "prompt")) {
+    for (const auto& p : sinkLines("prompt")) {
         EXPECT_EQ(p["shown"], false);
         EXPECT_TRUE(reasons.emplace(p["draft"].get<int>(), p["reason"]).second)
             << "one prompt line per draft";
@@ -332,7 +314,7 @@ TEST_F(TheLinuxIssueFilerService, GivesUpOnANotificationServiceThatHangsWithoutP
     mute->createDraft(sampleDraft(), "vidcalld", "mute", {});
     mute->flush();
     ::close(fd);
-    const auto last = withOp(sinkLines(), "prompt").back();
+    const auto last = sinkLines("prompt").back();
     EXPECT_EQ(last["reason"],
               "the session bus at unix:path=" + silent.string() + " did not let us in in time");
 }

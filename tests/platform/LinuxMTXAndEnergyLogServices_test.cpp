@@ -7,6 +7,7 @@
 #include <nlohmann/json.hpp>
 
 #include "fakes/FakeClock.h"
+#include "fakes/SinkLines.h"
 #include "fakes/TempDirectory.h"
 #include "platform/linux/sinks/LinuxEnergyLogService.h"
 #include "platform/linux/sinks/LinuxMTXMetricsService.h"
@@ -24,15 +25,6 @@ class Wire final : public MTXMetricRecord {
   private:
     std::string bytes_;
 };
-
-std::vector<Json> linesOf(const std::string& path) {
-    std::vector<Json> lines;
-    std::ifstream in(path);
-    for (std::string line; std::getline(in, line);) {
-        lines.push_back(Json::parse(line));
-    }
-    return lines;
-}
 
 // The daemon's end-to-end test reads both sinks in full; this checks what it cannot reach: a
 // record that is gone right after the call, and the energy log's optional argument.
@@ -54,11 +46,11 @@ TEST(TheLinuxMTXAndEnergyLogServices, CopyWhatTheyAreGivenBeforeTheCallReturns) 
     }
     mtx.flush();
     energyLog.flush();
-    const auto records = linesOf(state + "/sinks/mtx.jsonl");
+    const auto records = test::readSinkLines(state + "/sinks/mtx.jsonl");
     ASSERT_EQ(records.size(), 1u);
     EXPECT_EQ(records[0].dump(),
               R"({"time":1706707501.0,"seq":1,"metric":5963779,"record":"EAEaAA=="})");
-    const auto events = linesOf(state + "/sinks/energylog.jsonl");
+    const auto events = test::readSinkLines(state + "/sinks/energylog.jsonl");
     ASSERT_EQ(events.size(), 1u);
     EXPECT_EQ(events[0].dump(),
               R"({"time":1706707501.0,"seq":1,"registry":28,"event":"LeakedHapticsSessionInfo",)"

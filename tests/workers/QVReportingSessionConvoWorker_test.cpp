@@ -12,9 +12,7 @@
 #include "session/QVReportingStats.h"
 #include "session/QVReportingUtility.h"
 #include "session/QVReportingWorkerRegistry.h"
-#include "workers/QVReportingWorkerClasses.h"
 #include "workers/backends/QVReportingSessionMetricsHubWorker.h"
-#include "workers/derived/QVReportingSessionSummaryJsonFileWorker.h"
 
 namespace qv {
 namespace {
@@ -346,18 +344,6 @@ TEST_F(AConvoWorker, SurvivesItsSessionAndBoundsAFloodDuringTheWait) {
     EXPECT_TRUE(watch.expired());
     fake.convo.completePending(std::vector<std::string>{"jsonl"});
     EXPECT_TRUE(log->contains("timed out waiting for backends"));
-}
-
-TEST(TheWorkerTable, PlacesConvoAfterTheSummaryFileAsAConsumerThatServesSingleMessageSessions) {
-    const auto table = QVReportingAllWorkerClasses();
-    const auto at = [&](const QVReportingWorkerClass& c) {
-        return std::find(table.begin(), table.end(), &c) - table.begin();
-    };
-    const auto& convo = makeWorkerClass<Worker>();
-    EXPECT_LT(at(makeWorkerClass<QVReportingSessionSummaryJsonFileWorker>()), at(convo));
-    EXPECT_LT(at(convo), static_cast<std::ptrdiff_t>(table.size()));
-    EXPECT_TRUE(convo.isConsumer && convo.handleSingleMessageSession && convo.implementsStart);
-    EXPECT_FALSE(convo.startOnInit || convo.isProducer);
 }
 
 }  // namespace
