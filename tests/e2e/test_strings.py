@@ -61,10 +61,10 @@ def raw_send(address, body):
                 (3, "s", b"SendMessage"), (6, "s", BUS_NAME.encode())]
         s.sendall(message(1, bus, b"", b"") + message(2, call, b"a{sv}uqax", body))
         # Then a Ping to the bus, which handles one connection's messages in order: its answer
-        # means the call went through; a hang-up means the bus refused the call.
+        # means the call went through; a hang-up means the bus refused the call, and may come
+        # before the Ping is even written.
         ping = [(1, "o", b"/org/freedesktop/DBus"), (2, "s", b"org.freedesktop.DBus.Peer"),
                 (3, "s", b"Ping"), (6, "s", b"org.freedesktop.DBus")]
-        s.sendall(message(3, ping, b"", b""))
         received = b""
 
         def take(n):
@@ -78,6 +78,7 @@ def raw_send(address, body):
             return out
 
         try:
+            s.sendall(message(3, ping, b"", b""))
             while b"\r\n" not in received:  # the bus's "OK <guid>" line comes first
                 chunk = s.recv(4096)
                 if not chunk:
