@@ -153,13 +153,7 @@ class TheLinuxIssueFilerService : public ::testing::Test {
         return address;
     }
     bool startNotifications(const std::string& address, const std::string& mode) {
-        // __FILE__ may be relative to the build directory, two levels above the test binary.
-        fs::path source(__FILE__);
-        if (source.is_relative()) {
-            source = fs::canonical("/proc/self/exe").parent_path().parent_path() / source;
-        }
-        const fs::path script =
-            source.parent_path().parent_path() / "e2e" / "notification_server.py";
+        const fs::path script = fs::path(QV_SOURCE_DIR) / "tests/e2e/notification_server.py";
         server = std::make_unique<Spawned>(
             std::vector<std::string>{"/usr/bin/python3", script.string(), address,
                                      (state / "notified.jsonl").string(), mode});
