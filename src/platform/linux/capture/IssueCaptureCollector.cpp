@@ -19,6 +19,7 @@
 
 #include "platform/IssueCaptureService.h"
 #include "platform/PosixIO.h"
+#include "platform/linux/system/ErrnoText.h"
 #include "values/ValueJson.h"
 
 namespace qv {
@@ -44,10 +45,6 @@ std::string isoTime(double secondsSince1970) {
     return fmt::format("{:04}-{:02}-{:02}T{:02}:{:02}:{:02}.{:06}Z", tm.tm_year + 1900,
                        tm.tm_mon + 1, tm.tm_mday, tm.tm_hour, tm.tm_min, tm.tm_sec,
                        std::min(micros, 999999L));
-}
-
-std::string errnoText(int error) {
-    return std::strerror(error);
 }
 
 // Control bytes would break the one-line-per-entry layout; tabs stay.

@@ -1,4 +1,5 @@
 #include "platform/linux/capture/LinuxConfinedProcess.h"
+#include "platform/linux/system/ErrnoText.h"
 
 #include <fcntl.h>
 #include <linux/landlock.h>
@@ -26,10 +27,6 @@ namespace {
 #ifndef LANDLOCK_ACCESS_FS_TRUNCATE
 #define LANDLOCK_ACCESS_FS_TRUNCATE (1ULL << 14)
 #endif
-
-std::string errnoText(int error) {
-    return std::error_code(error, std::generic_category()).message();
-}
 
 class Fd {
   public:

@@ -19,6 +19,7 @@
 
 #include "platform/Clock.h"
 #include "platform/linux/capture/LinuxConfinedProcess.h"
+#include "platform/linux/system/ErrnoText.h"
 
 namespace qv {
 
@@ -43,10 +44,6 @@ constexpr std::size_t kLogTailLines = 3;
 // Capability bits of /proc/self/status "CapEff".
 constexpr int kCapSysAdmin = 21;
 constexpr int kCapPerfmon = 38;
-
-std::string errnoText(int error) {
-    return std::error_code(error, std::generic_category()).message();
-}
 
 bool isExecutable(const std::string& path) {
     struct stat st {};

@@ -9,6 +9,7 @@
 #include <fmt/format.h>
 #include <systemd/sd-bus.h>
 
+#include "platform/linux/system/ErrnoText.h"
 #include "values/Utf8.h"
 
 namespace qv {
@@ -24,10 +25,6 @@ constexpr const char* kAppIcon = "dialog-warning";
 constexpr std::uint8_t kUrgencyNormal = 1;
 // Let the notification server choose how long the prompt stays.
 constexpr std::int32_t kServerDefaultExpiry = -1;
-
-std::string errnoText(int error) {
-    return std::error_code(error, std::generic_category()).message();
-}
 
 // The bus takes only valid UTF-8: bad bytes become U+FFFD rather than losing the prompt.
 std::string validUtf8(std::string_view text) {

@@ -21,16 +21,13 @@
 #include "platform/SinkSegments.h"
 #include "platform/linux/sinks/DiskBudget.h"
 #include "platform/linux/sinks/RegularFile.h"
+#include "platform/linux/system/ErrnoText.h"
 #include "platform/linux/system/ThreadPriority.h"
 #include "values/ValueJson.h"
 
 namespace qv {
 
 namespace {
-
-std::string errnoText(int error) {
-    return std::error_code(error, std::generic_category()).message();
-}
 
 // Every live sink, for flushAll(). Sinks come and go only at start-up, shutdown and in tests.
 std::mutex gSinksMutex;

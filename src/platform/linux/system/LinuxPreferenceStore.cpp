@@ -1,4 +1,5 @@
 #include "platform/linux/system/LinuxPreferenceStore.h"
+#include "platform/linux/system/ErrnoText.h"
 
 #include <fcntl.h>
 #include <sys/file.h>
@@ -27,10 +28,6 @@ constexpr int kMaximumNesting = 64;
 // A copy of a file modified less than this long before it was read may hide a later rewrite
 // within the same timestamp tick.
 constexpr double kTrustAfterSeconds = 1.0;
-
-std::string errnoText(int error) {
-    return std::strerror(error);
-}
 
 // Closes a descriptor on every path out of a scope.
 class FileDescriptor {

@@ -1,4 +1,5 @@
 #include "platform/linux/trace/LinuxSpanTraceRecorder.h"
+#include "platform/linux/system/ErrnoText.h"
 
 #include <dirent.h>
 #include <fcntl.h>
@@ -40,10 +41,6 @@ constexpr std::size_t kCopyChunk = 1024 * 1024;
 // An instance held open by some program is tried again this often before it is left for later.
 constexpr int kRemoveAttempts = 5;
 constexpr auto kRemovePause = std::chrono::milliseconds(20);
-
-std::string errnoText(int error) {
-    return std::strerror(error);
-}
 
 }  // namespace
 
