@@ -2,6 +2,7 @@
 play, record, change volume, move, crash and restart; the checks read what reached the daemon's
 analytics sink."""
 
+import json
 import os
 import shutil
 import signal
@@ -44,13 +45,19 @@ class BridgeTestCase(unittest.TestCase):
         self.addCleanup(self.daemon.stop)
         self.bridge = Bridge(self.pw, self.bus.address, self.workdir)
         self.addCleanup(self.bridge.stop)
-        self.addCleanup(self.show_logs_on_failure)
 
-    def show_logs_on_failure(self):
+    def tearDown(self):
+        # Before the cleanups, which stop a daemon started after the bridge first: the bridge
+        # would log that absence as if it had come during the test. The bridge stops first, so
+        # the log ends with its counters.
         result = self._outcome.result
         if any(test is self for test, _ in result.failures + result.errors):
-            lines = [l for l in self.bridge.text().splitlines() if "debug: event" not in l]
-            print("--- bridge log (events left out):\n" + "\n".join(lines[-40:]), file=sys.stderr)
+            try:
+                self.bridge.stop()
+            finally:
+                lines = [l for l in self.bridge.text().splitlines() if "debug: event" not in l]
+                print("--- bridge log (events left out):\n" + "\n".join(lines[-40:]),
+                      file=sys.stderr)
 
     def tone(self, seconds, name=None, **kw):
         path = os.path.join(self.workdir, name or f"tone-{seconds}.wav")
@@ -60,6 +67,28 @@ class BridgeTestCase(unittest.TestCase):
 
     def wpctl(self, *args):
         self.pw.run("wpctl", *map(str, args))
+
+    def bridge_events(self):
+        """The operations the bridge queued for the daemon, as its debug log shows them."""
+        # What follows the last newline is a line still being written.
+        return [json.loads(line.split("debug: event ", 1)[1])
+                for line in self.bridge.text().split("\n")[:-1] if "debug: event " in line]
+
+    def change_volume_until_delivered(self, node, app_id, volumes):
+        """Sets each volume in turn until one reaches the daemon: the queue is first in, first
+        out, so by then the bridge has handed over all it held. A change that finds the queue
+        still full is dropped; the next one tries again."""
+        for volume in volumes:
+            self.wpctl("set-volume", node, volume)
+            try:
+                wait_until(lambda v=volume: any(abs(p.get("KXSessionVolume", -1) - v) < 1e-4
+                                                for p in with_app(self.daemon, VOLUME_STATE,
+                                                                  app_id)),
+                           timeout=15, what=f"the volume {volume} to reach the daemon")
+                return
+            except AssertionError:
+                continue
+        self.fail(f"none of the volumes {volumes} reached the daemon")
 
     def stop_all(self):
         """The bridge, then the daemon: every session stops and derives its messages."""
@@ -221,8 +250,15 @@ class DaemonAwayOrStalled(BridgeTestCase):
         node = self.pw.stream_of("patient")
         wait_until(lambda: "wait for it" in self.bridge.text(), timeout=30,
                    what="the bridge to notice the daemon's absence")
+        # A volume set while the stream is still being set up can be lost: it is set once the
+        # bridge has seen the stream run, and the daemon comes once the bridge has seen it.
+        wait_until(lambda: any(e.get("category") == 4 and e.get("type") == 1
+                               for e in self.bridge_events()),
+                   timeout=30, what="the bridge to see the stream run")
         self.wpctl("set-volume", node, 0.25)
-        time.sleep(0.5)
+        wait_until(lambda: any(abs(e.get("payload", {}).get("KXSessionVolume", -1) - 0.25) < 1e-4
+                               for e in self.bridge_events()),
+                   timeout=30, what="the bridge to see the volume 0.25")
         self.daemon = Daemon(self.bus, self.state)
         self.addCleanup(self.daemon.stop)
         start = wait_for(self.daemon, PLAYBACK_START, "patient")[0]
@@ -237,6 +273,9 @@ class DaemonAwayOrStalled(BridgeTestCase):
                        what="the bridge to drop events")
         finally:
             os.kill(self.daemon.process.pid, signal.SIGCONT)
+        # Until the bridge catches up with the continued daemon its queue stays full, and the
+        # stream's Stop would be dropped like any message that finds it so.
+        self.change_volume_until_delivered(node, "patient", [0.9 + i * 0.01 for i in range(6)])
         player.kill()
         player.wait(timeout=10)
         wait_for(self.daemon, PLAYBACK_STOP, "patient")

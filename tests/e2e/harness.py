@@ -122,8 +122,12 @@ class Daemon:
         for name in closed + [sink + ".jsonl"]:
             path = os.path.join(sinks, name)
             if os.path.exists(path):
-                with open(path) as f:
-                    lines += [json.loads(line) for line in f if line.strip()]
+                with open(path, "rb") as f:
+                    data = f.read()
+                # What follows the last newline is a line still being written (one write can
+                # reach the file a page at a time, even mid-character): the next read has it.
+                lines += [json.loads(line.decode()) for line in data.split(b"\n")[:-1]
+                          if line.strip()]
         return lines
 
     def events(self, prefix=""):

@@ -57,7 +57,7 @@ class DriverStatistics(DaemonTestCase):
         self.assertTrue(c.stop(700))
 
         wait_until(lambda: self.daemon.events("com.korvane.test.ChannelStats.State"),
-                   what="the ChannelStats messages")
+                   timeout=30, what="the ChannelStats messages")
         stats = [e for e in self.daemon.events("com.korvane.qvsound.ChannelStats.")]
         self.assertEqual([e["event"].rsplit(".", 1)[1] for e in stats],
                          ["Simple", "Histogram", "State"])
@@ -92,7 +92,7 @@ class DriverStatistics(DaemonTestCase):
                 self.write("sys/class/net/lo/statistics/rx_packets", str(1000 + 13 * 17 + 1))
             self.assertTrue(c.stop(rid))
         simple = wait_until(lambda: self.daemon.events("com.korvane.qvsound.ChannelStats.Simple")
-                            [1:], what="the third session's statistics")
+                            [1:], timeout=30, what="the third session's statistics")
         self.assertEqual({k: v for k, v in simple[0]["payload"].items() if "_Simple_" in k},
                          {"lo_Rx_Simple_rxpackets": 1})
         self.assertEqual(len(self.daemon.events("com.korvane.qvsound.ChannelStats.")), 4)
