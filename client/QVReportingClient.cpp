@@ -1,7 +1,12 @@
 #include "QVReportingClient.h"
 
+#include <sys/socket.h>
 #include <sys/stat.h>
+#include <sys/un.h>
+#include <unistd.h>
 
+#include <cerrno>
+#include <cstring>
 #include <future>
 #include <limits>
 #include <type_traits>
@@ -169,6 +174,28 @@ QVReportingClient::QVReportingClient(std::unique_ptr<sdbus::IConnection> connect
 }
 
 std::unique_ptr<QVReportingClient> QVReportingClient::connectDirect(const std::string& path) {
+    // A socket nobody listens on (left by a daemon that is gone) is refused here: sdbus-c++
+    // leaks the sd-bus object of a connection that fails to start.
+    const int fd = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+    sockaddr_un address{};
+    address.sun_family = AF_UNIX;
+    int error = fd < 0 ? errno : 0;
+    if (fd >= 0 && path.size() >= sizeof address.sun_path) {
+        error = ENAMETOOLONG;
+    } else if (fd >= 0) {
+        path.copy(address.sun_path, path.size());
+        if (::connect(fd, reinterpret_cast<const sockaddr*>(&address), sizeof address) != 0) {
+            error = errno;
+        }
+    }
+    if (fd >= 0) {
+        ::close(fd);
+    }
+    if (error != 0) {
+        throw QVReportingClientError(
+            std::string("System.Error.") + ::strerrorname_np(error),
+            "cannot connect to the daemon's direct socket " + path + ": " + std::strerror(error));
+    }
     // The daemon's socket answers Hello as a bus would, so a connection opened as to a bus works
     // there unchanged.
     return make([&] { return sdbus::createSessionBusConnectionWithAddress("unix:path=" + path); },
