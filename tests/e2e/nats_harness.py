@@ -298,10 +298,21 @@ def ctl(*args, timeout=120):
     return done.stdout
 
 
-def stream_lines(urls, *extra):
+def stream_lines(urls, *extra, timeout=90):
     """{(device, sink): [(seq, object without device and sink)]} in stream order."""
+    # After every server restarts, the stream takes writes before the cluster's meta leader is
+    # settled, and making a reader's consumer times out until it is: read again then.
+    deadline = time.monotonic() + timeout
+    while True:
+        try:
+            text = ctl("--json", "fleet", "tail", "--nats-url", urls, *extra)
+            break
+        except AssertionError as e:
+            if "Timeout" not in str(e) or time.monotonic() > deadline:
+                raise
+            time.sleep(1)
     out = {}
-    for line in ctl("--json", "fleet", "tail", "--nats-url", urls, *extra).splitlines():
+    for line in text.splitlines():
         obj = json.loads(line)
         key = (obj.pop("device"), obj.pop("sink"))
         out.setdefault(key, []).append((obj["seq"], obj))
