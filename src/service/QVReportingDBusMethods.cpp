@@ -63,15 +63,23 @@ static QVReportingError unreadableArguments() {
     return QVReportingError::invalidArgs("the call's arguments cannot be read");
 }
 
+QVReportingDBusServer::Client* QVReportingDBusServer::admitWithID(Connection& connection,
+                                                                  sd_bus_message* call,
+                                                                  ReporterID& id, bool held) {
+    Client* client = admit(connection, call, held);
+    if (client && sd_bus_message_read_basic(call, 'x', &id) < 0) {
+        refuse(call, unreadableArguments());
+        return nullptr;
+    }
+    return client;
+}
+
 template <QVReportingDBusServer::IDCall Op, bool Held>
 void QVReportingDBusServer::idCall(Connection& connection, sd_bus_message* call) {
-    Client* client = admit(connection, call, Held);
+    ReporterID id = 0;
+    Client* client = admitWithID(connection, call, id, Held);
     if (!client) {
         return;
-    }
-    ReporterID id = 0;
-    if (sd_bus_message_read_basic(call, 'x', &id) < 0) {
-        return refuse(call, unreadableArguments());
     }
     auto instance = client->instance;
     ((*instance).*Op)(id, boolReply(hold(call, *client, 0, Held)));
@@ -93,13 +101,10 @@ void QVReportingDBusServer::setServiceType(Connection& connection, sd_bus_messag
 
 void QVReportingDBusServer::getServiceNameForReporterID(Connection& connection,
                                                         sd_bus_message* call) {
-    Client* client = admit(connection, call);
+    ReporterID id = 0;
+    Client* client = admitWithID(connection, call, id);
     if (!client) {
         return;
-    }
-    ReporterID id = 0;
-    if (sd_bus_message_read_basic(call, 'x', &id) < 0) {
-        return refuse(call, unreadableArguments());
     }
     auto instance = client->instance;
     auto ticket = hold(call, *client, 0);
@@ -155,13 +160,10 @@ void QVReportingDBusServer::sendMessage(Connection& connection, sd_bus_message* 
 }
 
 void QVReportingDBusServer::reporterIDValid(Connection& connection, sd_bus_message* call) {
-    Client* client = admit(connection, call);
+    ReporterID id = 0;
+    Client* client = admitWithID(connection, call, id);
     if (!client) {
         return;
-    }
-    ReporterID id = 0;
-    if (sd_bus_message_read_basic(call, 'x', &id) < 0) {
-        return refuse(call, unreadableArguments());
     }
     auto instance = client->instance;
     auto ticket = hold(call, *client, 0);

@@ -158,6 +158,10 @@ class QVReportingDBusServer {
     // the call fits the client's budgets (held: a call that waits for a later event); null when
     // the call was refused instead (too many clients, or past a budget: answered with an error).
     Client* admit(Connection& connection, sd_bus_message* call, bool held = false);
+    // admit() for a call whose one argument is a reporter ID, read into `id`; a call whose
+    // argument cannot be read is refused (null).
+    Client* admitWithID(Connection& connection, sd_bus_message* call, ReporterID& id,
+                        bool held = false);
     // Keeps the call, charged to its client, until it is answered or let go.
     TicketPtr hold(sd_bus_message* call, Client& client, std::size_t argumentBytes,
                    bool held = false);
