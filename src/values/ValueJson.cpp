@@ -286,6 +286,15 @@ bool appendJsonText(std::string& out, const Value& value, int indent, int depth)
 
 }  // namespace
 
+bool QVReportingAppendJsonString(std::string& out, std::string_view text) {
+    const std::size_t before = out.size();
+    if (!appendJsonString(out, text)) {
+        out.resize(before);
+        return false;
+    }
+    return true;
+}
+
 bool QVReportingAppendJsonText(std::string& out, const Value& value, int indent) {
     const std::size_t before = out.size();
     if (!appendJsonText(out, value, indent, 0)) {

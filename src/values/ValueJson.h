@@ -33,6 +33,8 @@ nlohmann::ordered_json QVReportingDictionaryToJson(const Dictionary& dictionary)
 // files and of every sink line spend most of their time there). indent < 0 is the compact form.
 // False, with out as it was, when a string is not valid UTF-8: the caller decides what to do.
 bool QVReportingAppendJsonText(std::string& out, const Value& value, int indent = -1);
+// The same for one string (a key, say), without making a Value of it.
+bool QVReportingAppendJsonString(std::string& out, std::string_view text);
 
 // True when JSON text nests arrays and objects more than limit deep (strings skipped), checked
 // before parsing: the parser recurses once per level, so text from outside is refused first.

@@ -174,11 +174,11 @@ void JsonlSink::formatLine(std::string& out, const Line& line, std::uint64_t seq
     out += "{\"time\":";
     QVReportingAppendJsonText(out, Value(line.time));
     out += ",\"seq\":";
-    out += std::to_string(seq);
+    QVReportingAppendJsonText(out, Value(seq));
     bool valid = true;
     for (const auto& [key, value] : line.members) {
         out += ',';
-        valid = QVReportingAppendJsonText(out, Value(std::string_view(key))) && valid;
+        valid = QVReportingAppendJsonString(out, key) && valid;
         out += ':';
         valid = valid && QVReportingAppendJsonText(out, value);
         if (!valid) {
