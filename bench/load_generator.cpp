@@ -416,6 +416,7 @@ int main(int argc, char** argv) {
     std::int64_t total = 200000;
     bool memoryOnly = false;
     bool direct = true;
+    std::vector<int> clientCounts{1, 4, 16};
     for (int i = 1; i < argc; ++i) {
         const std::string a = argv[i];
         if (a == "--trivial-server" && i + 1 < argc) {
@@ -429,14 +430,17 @@ int main(int argc, char** argv) {
             memoryOnly = true;
         } else if (a == "--no-direct") {
             direct = false;
+        } else if (a == "--clients" && i + 1 < argc) {
+            clientCounts = {std::stoi(argv[++i])};
         } else {
             std::fprintf(stderr,
                          "usage: %s --daemon PATH/qvreportd [--messages N] [--memory-only] "
-                         "[--no-direct]\n"
+                         "[--no-direct] [--clients N]\n"
                          "  N: messages per pipelined workload (default 200000; serial ones "
                          "send a tenth)\n"
                          "  --memory-only: only the memory check, not the throughput table\n"
-                         "  --no-direct: the bus only (a daemon without a direct socket)\n",
+                         "  --no-direct: the bus only (a daemon without a direct socket)\n"
+                         "  --clients N: only the rows of N clients (default 1, 4 and 16)\n",
                          argv[0]);
             return 2;
         }
@@ -489,7 +493,7 @@ int main(int argc, char** argv) {
                 "(daemon over the bus)", "(daemon, direct socket)", "bus", "direct");
     std::int64_t nextID = 1000;
     bool busMet = true, directMet = true;
-    for (int clients : {1, 4, 16}) {
+    for (int clients : clientCounts) {
         for (bool pipelined : {false, true}) {
             if (memoryOnly) {
                 break;
