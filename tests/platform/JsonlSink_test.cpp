@@ -71,32 +71,30 @@ class AJsonlSink : public ::testing::Test {
     std::atomic<int> filesRefused{0};
 };
 
-TEST_F(AJsonlSink, WritesOneObjectPerLineWithTheTimeFirstAndEveryValueExact) {
+// Values are written by the JSON writer its own tests cover; here, what the sink adds: the time
+// and seq first, members in their order, and a line kept whole when text is not UTF-8.
+TEST_F(AJsonlSink, WritesOneObjectPerLineWithTheTimeAndSeqFirst) {
     const double startTime = clock.now() + 0.125;
     clock.setNow(startTime);
     {
         JsonlSink sink(stateDir.string(), "analytics", clock, recording());
         EXPECT_EQ(sink.path(), (stateDir / "sinks" / "analytics.jsonl").string());
-        EXPECT_TRUE(sink.append({{"zeta", std::numeric_limits<std::uint64_t>::max()},
-                                 {"alpha", std::numeric_limits<std::int64_t>::min()},
-                                 {"third", 0.1 + 0.2},
-                                 {"bytes", Bytes{0x00, 0x01, 0x02, 0xFF}},
-                                 {"nested", Dictionary{{"b", 1}, {"a", 2}}},
-                                 {"text", "two\nlines \"quoted\""}}));
+        EXPECT_TRUE(sink.append({{"zeta", 1}, {"nested", Dictionary{{"b", 1}, {"a", 2}}}}));
+        EXPECT_TRUE(sink.append({{"zeta", 2}, {"text", "bad \xff byte"}}));
     }
     const auto lines = readLines(stateDir / "sinks" / "analytics.jsonl");
-    ASSERT_EQ(lines.size(), 1u);
-    auto first = lines[0];
-    EXPECT_EQ(first.begin().key(), "time");
-    EXPECT_EQ(first["time"].get<double>(), startTime);
-    EXPECT_TRUE(first["zeta"].is_number_unsigned());
-    EXPECT_EQ(std::next(first.begin()).key(), "seq");
-    EXPECT_EQ(first["seq"], 1);
-    first.erase("time");
-    first.erase("seq");
-    EXPECT_EQ(first, ordered_json::parse(R"({"zeta":18446744073709551615,
-        "alpha":-9223372036854775808,"third":0.30000000000000004,"bytes":"AAEC/w==",
-        "nested":{"b":1,"a":2},"text":"two\nlines \"quoted\""})"));
+    ASSERT_EQ(lines.size(), 2u);
+    for (std::size_t i = 0; i < 2; ++i) {
+        auto line = lines[i];
+        EXPECT_EQ(line.begin().key(), "time");
+        EXPECT_EQ(line["time"].get<double>(), startTime);
+        EXPECT_EQ(std::next(line.begin()).key(), "seq");
+        EXPECT_EQ(line["seq"], i + 1);
+        line.erase("time");
+        line.erase("seq");
+        EXPECT_EQ(line, ordered_json::parse(i == 0 ? R"({"zeta":1,"nested":{"b":1,"a":2}})"
+                                                   : R"({"zeta":2,"text":"bad \uFFFD byte"})"));
+    }
     EXPECT_TRUE(lost.empty());
     EXPECT_TRUE(problems.empty());
 }
