@@ -10,6 +10,7 @@
 
 #include "QVReportingCtlReportData.h"
 #include "QVReportingCtlReportPage.h"
+#include "fakes/TempDirectory.h"
 
 namespace qv::client {
 namespace {
@@ -60,10 +61,6 @@ TEST(TheReportTimes, ReadSinkSecondsAndISODatesWithTheirZonesAndNothingElse) {
 class TheReportData : public ::testing::Test {
   protected:
     void SetUp() override {
-        root_ = fs::temp_directory_path() /
-                fmt::format("qv-report-test-{}-{}", ::getpid(),
-                            ::testing::UnitTest::GetInstance()->current_test_info()->name());
-        fs::remove_all(root_);
         fs::create_directories(root_ / "sinks");
 
         // First run: a music session (5) and a recorder session (7), both stopped.
@@ -125,8 +122,6 @@ class TheReportData : public ::testing::Test {
         append("analytics.jsonl", "{\"time\":125,\"seq\":8,not json}\n");
         volume("analytics.jsonl", 9, 130, "music", 1, 1.0, 2, "Speaker");
     }
-    void TearDown() override { fs::remove_all(root_); }
-
     void append(const std::string& file, const std::string& text) {
         std::ofstream(root_ / "sinks" / file, std::ios::app) << text;
     }
@@ -148,7 +143,8 @@ class TheReportData : public ::testing::Test {
         return QVReportingCtlGatherReport(root_.string(), filter);
     }
 
-    fs::path root_;
+    test::TempDirectory tmp_{"qv-report"};
+    const fs::path root_ = tmp_.path();
     std::uint64_t convoSeq_ = 0;
 };
 
