@@ -114,22 +114,10 @@ TEST_F(TheLinuxDiagnosticRequestService, RecordsRequestsAndSaysOnceThatPerfIsMis
 
     auto requests = lines("request");
     ASSERT_EQ(requests.size(), 3u);
-    EXPECT_EQ(requests[0], (Json{{"time", requests[0]["time"]},
-                                 {"seq", requests[0]["seq"]},
-                                 {"op", "request"},
-                                 {"request", 1},
-                                 {"domain", "com.korvane.qvsound"},
-                                 {"kind", "AudioOverloads"},
-                                 {"description", "com.example.daw"},
-                                 {"payload", {{"smallest_buffer_frame_size", 1024}, {"n", 1}}},
-                                 {"options",
-                                  {{"sampleStacks", true},
-                                   {"callGraphs", true},
-                                   {"extendedWindow", false},
-                                   {"userSpaceOnly", false},
-                                   {"skipReport", false}}},
-                                 {"sampled", true}}))
-        << "perf is looked for by the sampler, not the caller";
+    // The request's members are the end-to-end overload test's; here, its number and that it
+    // was taken to be sampled before the sampler looked for perf.
+    EXPECT_EQ(requests[0]["request"], 1);
+    EXPECT_EQ(requests[0]["sampled"], true) << "perf is looked for by the sampler, not the caller";
     auto samples = lines("sample");
     ASSERT_EQ(samples.size(), 1u);
     EXPECT_EQ(samples[0]["ok"], false);
