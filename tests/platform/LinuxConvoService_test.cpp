@@ -75,22 +75,24 @@ TEST_F(ALinuxConvoService, AnswersFromItsSuiteReadAfreshAtEveryQuestion) {
 }
 
 // The end-to-end test reads a whole session's lines; here, what a client cannot make it write.
-TEST_F(ALinuxConvoService, NumbersItsSessionsAndWritesANullForAMissingSessionID) {
+TEST_F(ALinuxConvoService, NumbersItsSessionsAndWritesEachOnesSessionIDOrANull) {
     auto first = service.createSession({{"SessionID", 42}}, {}, std::nullopt);
     auto second = service.createSession({}, {}, std::nullopt);
+    EXPECT_EQ(first->sendMessage(4, 18, {}), std::nullopt);
     EXPECT_EQ(second->sendMessage(0xFFFF, 0xFFFF, {}), std::nullopt);
     first->flush();
     EXPECT_EQ(first->description(), "<ConvoSession 1 sessionID=42>");
 
     const auto got = lines();
-    ASSERT_EQ(got.size(), 4u);
+    ASSERT_EQ(got.size(), 5u);
     EXPECT_EQ(got[0]["session"], 1);
     EXPECT_EQ(got[1]["session"], 2);
-    EXPECT_EQ(got[2]["session"], 2);
-    EXPECT_TRUE(got[2]["sessionID"].is_null());
-    EXPECT_EQ(got[2]["category"], 65535);
-    EXPECT_EQ(got[3]["op"], "flush");
-    EXPECT_EQ(got[3]["session"], 1);
+    EXPECT_EQ(got[2]["sessionID"], 42);
+    EXPECT_EQ(got[3]["session"], 2);
+    EXPECT_TRUE(got[3]["sessionID"].is_null());
+    EXPECT_EQ(got[3]["category"], 65535);
+    EXPECT_EQ(got[4]["op"], "flush");
+    EXPECT_EQ(got[4]["session"], 1);
 }
 
 }  // namespace
