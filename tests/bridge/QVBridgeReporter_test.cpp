@@ -52,14 +52,10 @@ TEST(QVBridgeReporter, ASessionIsOpenedAtOnceButStartedOnlyOnTheFirstRun) {
     EXPECT_EQ(shape(r.update(idle)), (Shape{"open 7"}));
     idle.volume = 0.5;  // changes before the first run ride on its Start
     EXPECT_EQ(shape(r.update(idle)), Shape{});
+    // What the Start holds is the Playback end-to-end test's.
     const auto events = r.update(playing());
     EXPECT_EQ(shape(events), (Shape{"start", "4,1"}));
     EXPECT_EQ(events[1].reporterID, 100);
-    const auto& p = events[1].payload;
-    EXPECT_EQ(std::get<bool>(*QVBridgePayloadFind(p, "session_output_running")), true);
-    EXPECT_EQ(std::get<double>(*QVBridgePayloadFind(p, "KXSessionVolume")), 1.0);
-    EXPECT_EQ(std::get<std::string>(*QVBridgePayloadFind(p, "active_devices")), "Speaker");
-    EXPECT_EQ(std::get<std::int64_t>(*QVBridgePayloadFind(p, "mChannelsPerFrame")), 2);
 }
 
 TEST(QVBridgeReporter, EachChangeOfARunningStreamIsItsOwnMessage) {
@@ -98,6 +94,7 @@ TEST(QVBridgeReporter, EachChangeOfARunningStreamIsItsOwnMessage) {
     }
 }
 
+// A recording's start and stop are the Recording end-to-end test's; its format changes are not.
 TEST(QVBridgeReporter, RecordingUsesTheInputCategories) {
     QVBridgeReporter r(1);
     auto s = playing();
@@ -106,10 +103,6 @@ TEST(QVBridgeReporter, RecordingUsesTheInputCategories) {
     EXPECT_EQ(shape(r.update(s)), (Shape{"open 2", "start", "2,1"}));
     s.format = "S16LE 16000 Hz 1 ch";
     EXPECT_EQ(shape(r.update(s)), (Shape{"3,18"}));
-    const auto stop = r.remove(s.nodeID);
-    EXPECT_EQ(shape(stop), (Shape{"2,2", "close"}));
-    EXPECT_EQ(std::get<bool>(*QVBridgePayloadFind(stop[0].payload, "session_input_running")),
-              false);
 }
 
 TEST(QVBridgeReporter, RemovalStopsOnlyWhatRuns) {

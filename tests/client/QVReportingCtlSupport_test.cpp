@@ -6,6 +6,8 @@
 
 #include <gtest/gtest.h>
 
+#include "fakes/TempDirectory.h"
+
 namespace qv::client {
 namespace {
 
@@ -41,16 +43,14 @@ TEST(TheCtlVocabulary, ReadsNumbersAtTheirLimitsAndOnlyNamesThatStandForOneValue
 }
 
 TEST(ASinkList, NamesEachSinkOnceWhateverSegmentsItHas) {
-    char pattern[] = "/tmp/qvsinklist.XXXXXX";
-    ASSERT_NE(mkdtemp(pattern), nullptr);
-    const std::string dir = pattern;
+    const test::TempDirectory tmp("qvsinklist");
+    const std::string dir = tmp.path().string();
     std::filesystem::create_directories(dir + "/sinks");
     for (const char* name : {"analytics.jsonl", "analytics.000000000001.jsonl",
                              "mtx.000000000007.jsonl", ".hidden.jsonl", "notes.txt"}) {
         std::ofstream(dir + "/sinks/" + name) << "";
     }
     EXPECT_EQ(QVReportingCtlListSinks(dir), (std::vector<std::string>{"analytics", "mtx"}));
-    std::filesystem::remove_all(dir);
 }
 
 }  // namespace

@@ -14,6 +14,7 @@
 #include <vector>
 
 #include "QVReportingClient.h"
+#include "fakes/TempDirectory.h"
 #include "fakes/WaitUntil.h"
 
 namespace qv::client {
@@ -26,9 +27,6 @@ using qv::test::waitUntil;
 class TheClientLibrary : public ::testing::Test {
   protected:
     void SetUp() override {
-        work_ = std::filesystem::temp_directory_path() /
-                ("qv-client-e2e-" + std::to_string(getpid()) + "-" +
-                 ::testing::UnitTest::GetInstance()->current_test_info()->name());
         std::filesystem::create_directories(work_ / "state");
         FILE* bus = popen("dbus-daemon --session --fork --print-address=1 --print-pid=1", "r");
         ASSERT_NE(bus, nullptr);
@@ -58,7 +56,6 @@ class TheClientLibrary : public ::testing::Test {
     void TearDown() override {
         stopDaemon();
         kill(bus_, SIGTERM);
-        std::filesystem::remove_all(work_);
     }
     int stopDaemon() {
         if (daemon_ <= 0)
@@ -70,7 +67,8 @@ class TheClientLibrary : public ::testing::Test {
         return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
     }
 
-    std::filesystem::path work_;
+    test::TempDirectory tmp_{"qv-client-e2e"};
+    const std::filesystem::path work_ = tmp_.path();
     std::string address_;
     pid_t bus_ = 0;
     pid_t daemon_ = 0;

@@ -276,7 +276,6 @@ TEST(TheLinuxBluetoothFacility, NeverLetsWhatBlueZClaimsNameAFileOutsideItsDirec
     const auto dir = root / "accessories";
     // Files a hostile address could aim at, next to and above the directory.
     std::ofstream(root / "passwd.json") << kGoodFile;
-    std::ofstream(dir / ".json") << kGoodFile;
     std::ofstream(dir / "AA:BB:CC:DD:EE:FF.json") << kGoodFile;
     Lines log;
     bus.startBlueZ();
@@ -289,26 +288,24 @@ TEST(TheLinuxBluetoothFacility, NeverLetsWhatBlueZClaimsNameAFileOutsideItsDirec
             path, {{"Address", address}, {"Paired", paired}, {"Connected", sdbus::Variant(true)}});
     };
     raw("/org/bluez/hci0/dev_a", sdbus::Variant(std::string("../passwd")), sdbus::Variant(true));
-    raw("/org/bluez/hci0/dev_b", sdbus::Variant(std::string("")), sdbus::Variant(true));
     raw("/org/bluez/hci0/dev_c", sdbus::Variant(std::string("aa:bb:cc:dd:ee:ff")),
         sdbus::Variant(true));
     raw("/org/bluez/hci0/dev_d", sdbus::Variant(std::uint32_t{7}), sdbus::Variant(true));
     raw("/org/bluez/hci0/dev_e", sdbus::Variant(std::string("AA:BB:CC:DD:EE:FF")),
         sdbus::Variant(std::string("yes")));
-    raw("/org/bluez/hci0/dev_f", sdbus::Variant(std::string("AA:BB:CC:DD:EE:FF/../../passwd")),
-        sdbus::Variant(true));
     ASSERT_TRUE(test::waitUntil([&] { return log.count("is not a boolean") == 1; }));
-    ASSERT_TRUE(test::waitUntil([&] { return facility.pairedDevices().size() == 5; }));
+    ASSERT_TRUE(test::waitUntil([&] { return facility.pairedDevices().size() == 3; }));
 
     // Only the well-formed address (in any case) has accessory information; the others are
     // listed without any, each refusal logged; a Paired that is not a boolean pairs nothing.
+    // Which texts are addresses is the address parser's unit test.
     for (const auto& d : facility.pairedDevices()) {
         EXPECT_EQ(d.accessoryInformation.has_value(), d.identifier == "/org/bluez/hci0/dev_c")
             << d.identifier;
         EXPECT_TRUE(d.address.empty() || d.address == "AA:BB:CC:DD:EE:FF") << d.address;
     }
     EXPECT_EQ(log.count("has the address \"../passwd\", which is not a Bluetooth address"), 1u);
-    EXPECT_EQ(log.count("which is not a Bluetooth address"), 3u);
+    EXPECT_EQ(log.count("which is not a Bluetooth address"), 1u);
     EXPECT_EQ(log.count("Address of /org/bluez/hci0/dev_d is not a string"), 1u);
 }
 

@@ -4,29 +4,22 @@
 
 #include <fstream>
 
-#include <unistd.h>
-
 #include "QVReportingExportFiles.h"
+#include "fakes/TempDirectory.h"
 
 namespace qv::exporter {
 namespace {
 
 class QVReportingExportCursorTest : public ::testing::Test {
   protected:
-    void SetUp() override {
-        dir_ = std::filesystem::temp_directory_path() /
-               ("qvexport-cursor-" + std::to_string(::getpid()) + "-" +
-                ::testing::UnitTest::GetInstance()->current_test_info()->name());
-        std::filesystem::remove_all(dir_);
-    }
-    void TearDown() override { std::filesystem::remove_all(dir_); }
     void write(const std::string& text) {
         std::filesystem::create_directories(path().parent_path());
         std::ofstream(path()) << text;
     }
     std::filesystem::path path() const { return QVReportingExportCursorPath(dir_); }
 
-    std::filesystem::path dir_;
+    test::TempDirectory tmp_{"qvexport-cursor"};
+    const std::filesystem::path dir_ = tmp_.path();
 };
 
 TEST_F(QVReportingExportCursorTest, RoundTripsAndNeverGoesBack) {
@@ -59,7 +52,6 @@ TEST_F(QVReportingExportCursorTest, AFileThatIsNotACursorIsAnErrorNeverAnEmptyCu
 }
 
 TEST_F(QVReportingExportCursorTest, ASaveIntoADirectoryThatCannotBeMadeSaysWhy) {
-    std::filesystem::create_directories(dir_);
     std::ofstream(dir_ / "export") << "a file where the directory should be";
     QVReportingExportCursor cursor;
     cursor.advance("analytics", 1);

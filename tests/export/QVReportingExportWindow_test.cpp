@@ -51,17 +51,6 @@ TEST(QVReportingExportWindow, TheCursorMovesOnlyPastLinesAcknowledgedInSeqOrder)
     }
 }
 
-TEST(QVReportingExportWindow, TakeKeepsToTheLimitAndSeqOrder) {
-    auto window = withLines(0, 1, 5);
-    EXPECT_EQ(seqs(window.take(2)), (std::vector<std::uint64_t>{1, 2}));
-    EXPECT_EQ(seqs(window.take(0)), (std::vector<std::uint64_t>{}));
-    EXPECT_EQ(seqs(window.take(10)), (std::vector<std::uint64_t>{3, 4, 5}));
-    EXPECT_EQ(window.inFlight(), 5u);
-    EXPECT_TRUE(window.take(10).empty());
-    window.add(6, "line 6", 0);
-    EXPECT_EQ(seqs(window.take(10)), (std::vector<std::uint64_t>{6}));
-}
-
 TEST(QVReportingExportWindow, AFailureSettlesThenResendsEverythingNotAcknowledgedFromTheOldest) {
     auto window = withLines(0, 1, 6);
     window.take(4);  // 1..4 in flight

@@ -112,16 +112,8 @@ TEST(ADiskBudget, KeepsTheClosedSegmentsOfSinksThatShareItWithinIt) {
     EXPECT_LE(closedBytes, 600u);
     EXPECT_GT(closedBytes, 300u) << "only what the budget needs is removed";
     EXPECT_GT(expired["a"], 0u);
-    // Every byte written is either on disk or counted as expired.
-    SinkLineReader reader(sinks, "a", 0);
-    std::vector<std::uint64_t> seqs;
-    while (auto line = reader.next()) {
-        seqs.push_back(line->seq);
-    }
-    ASSERT_FALSE(seqs.empty());
-    EXPECT_GT(seqs.front(), 1u) << "the oldest lines expired: a gap before the first";
-    EXPECT_EQ(seqs.back(), 30u);
-    EXPECT_EQ(seqs.size(), 30 - seqs.front() + 1) << "no gap after it";
+    // Every byte written is either on disk or counted as expired. That the oldest lines went,
+    // and only they, is the table above's and the end-to-end SegmentsAndBudgets test's.
     std::uint64_t written = 0;
     for (int i = 0; i < 40; ++i) {
         // {"time":1706707501.0,"seq":N,"i":I}\n

@@ -71,32 +71,30 @@ class AJsonlSink : public ::testing::Test {
     std::atomic<int> filesRefused{0};
 };
 
-TEST_F(AJsonlSink, WritesOneObjectPerLineWithTheTimeFirstAndEveryValueExact) {
+// Values are written by the JSON writer its own tests cover; here, what the sink adds: the time
+// and seq first, members in their order, and a line kept whole when text is not UTF-8.
+TEST_F(AJsonlSink, WritesOneObjectPerLineWithTheTimeAndSeqFirst) {
     const double startTime = clock.now() + 0.125;
     clock.setNow(startTime);
     {
         JsonlSink sink(stateDir.string(), "analytics", clock, recording());
         EXPECT_EQ(sink.path(), (stateDir / "sinks" / "analytics.jsonl").string());
-        EXPECT_TRUE(sink.append({{"zeta", std::numeric_limits<std::uint64_t>::max()},
-                                 {"alpha", std::numeric_limits<std::int64_t>::min()},
-                                 {"third", 0.1 + 0.2},
-                                 {"bytes", Bytes{0x00, 0x01, 0x02, 0xFF}},
-                                 {"nested", Dictionary{{"b", 1}, {"a", 2}}},
-                                 {"text", "two\nlines \"quoted\""}}));
+        EXPECT_TRUE(sink.append({{"zeta", 1}, {"nested", Dictionary{{"b", 1}, {"a", 2}}}}));
+        EXPECT_TRUE(sink.append({{"zeta", 2}, {"text", "bad \xff byte"}}));
     }
     const auto lines = readLines(stateDir / "sinks" / "analytics.jsonl");
-    ASSERT_EQ(lines.size(), 1u);
-    auto first = lines[0];
-    EXPECT_EQ(first.begin().key(), "time");
-    EXPECT_EQ(first["time"].get<double>(), startTime);
-    EXPECT_TRUE(first["zeta"].is_number_unsigned());
-    EXPECT_EQ(std::next(first.begin()).key(), "seq");
-    EXPECT_EQ(first["seq"], 1);
-    first.erase("time");
-    first.erase("seq");
-    EXPECT_EQ(first, ordered_json::parse(R"({"zeta":18446744073709551615,
-        "alpha":-9223372036854775808,"third":0.30000000000000004,"bytes":"AAEC/w==",
-        "nested":{"b":1,"a":2},"text":"two\nlines \"quoted\""})"));
+    ASSERT_EQ(lines.size(), 2u);
+    for (std::size_t i = 0; i < 2; ++i) {
+        auto line = lines[i];
+        EXPECT_EQ(line.begin().key(), "time");
+        EXPECT_EQ(line["time"].get<double>(), startTime);
+        EXPECT_EQ(std::next(line.begin()).key(), "seq");
+        EXPECT_EQ(line["seq"], i + 1);
+        line.erase("time");
+        line.erase("seq");
+        EXPECT_EQ(line, ordered_json::parse(i == 0 ? R"({"zeta":1,"nested":{"b":1,"a":2}})"
+                                                   : R"({"zeta":2,"text":"bad \uFFFD byte"})"));
+    }
     EXPECT_TRUE(lost.empty());
     EXPECT_TRUE(problems.empty());
 }
@@ -163,27 +161,6 @@ TEST_F(AJsonlSink, ReportsACauseOnceCountsLostLinesAndRecovers) {
     EXPECT_EQ(lines[0]["i"], 3);
     ASSERT_EQ(problemsSoFar().size(), 2u);
     EXPECT_NE(problemsSoFar()[1].find("again"), std::string::npos);
-}
-
-TEST_F(AJsonlSink, RemovesATornLastLineLeftByACrashBeforeItWrites) {
-    const fs::path path = stateDir / "sinks" / "mtx.jsonl";
-    fs::create_directories(path.parent_path());
-    const std::string whole = "{\"time\":1,\"n\":1}\n{\"time\":2,\"n\":2}\n";
-    const std::string torn(5000, 'x');  // longer than one block read back
-    for (const std::string& before : {whole + "{\"time\":3,\"n\"", whole, torn}) {
-        SCOPED_TRACE(before.size());
-        std::ofstream(path, std::ios::binary | std::ios::trunc) << before;
-        tornRemoved = 0;
-        {
-            JsonlSink sink(stateDir.string(), "mtx", clock, recording());
-            sink.append({{"n", 9}});
-        }
-        const auto lines = readLines(path);  // every line parses
-        const bool wasTorn = before.back() != '\n';
-        EXPECT_EQ(tornRemoved, wasTorn ? 1 : 0);
-        ASSERT_EQ(lines.size(), before == torn ? 1u : 3u);
-        EXPECT_EQ(lines.back()["n"], 9);
-    }
 }
 
 TEST_F(AJsonlSink, LosesOnlyWhatAFullDiskRefusesAndKeepsLaterLinesWhole) {
@@ -345,23 +322,28 @@ TEST_F(AJsonlSink, GoesOnFromTheNewestSegmentsLastWholeLineWhenItStartsAgain) {
         std::uint64_t expectedSeq;
         std::vector<std::uint64_t> closedAfter;
         int torn;
+        std::size_t lines;  // in the current file after the new one
     } cases[] = {
-        {"nothing yet", "", "", 1, {}, 0},
+        {"nothing yet", "", "", 1, {}, 0, 1},
         {"a current file with a torn line",
          line(7, now) + line(8, now) + "{\"time\":1,\"se",
          "",
          9,
          {},
-         1},
-        {"only closed segments", "", line(1, now) + line(2, now) + line(3, now), 4, {1}, 0},
-        {"an empty current file", "\n", line(1, now) + line(2, now), 3, {1}, 0},
+         1,
+         3},
+        // A crash may leave more of a line than the sink reads back at once.
+        {"a torn line longer than a block", std::string(5000, 'x'), "", 1, {}, 1, 1},
+        {"only closed segments", "", line(1, now) + line(2, now) + line(3, now), 4, {1}, 0, 1},
+        {"an empty current file", "\n", line(1, now) + line(2, now), 3, {1}, 0, 1},
         // A current segment begun more than a day ago is closed before the first new line.
         {"an old current file",
          line(4, now - 86401) + line(5, now - 86400),
          line(1, now) + line(2, now) + line(3, now),
          6,
          {1, 4},
-         0},
+         0,
+         1},
     };
     for (const auto& c : cases) {
         SCOPED_TRACE(c.what);
@@ -379,8 +361,8 @@ TEST_F(AJsonlSink, GoesOnFromTheNewestSegmentsLastWholeLineWhenItStartsAgain) {
             JsonlSink sink(stateDir.string(), "s", clock, recording());
             sink.append({{"i", 0}});
         }
-        const auto lines = readLines(sinks / "s.jsonl");
-        ASSERT_FALSE(lines.empty());
+        const auto lines = readLines(sinks / "s.jsonl");  // every line parses
+        ASSERT_EQ(lines.size(), c.lines);
         EXPECT_EQ(lines.back()["seq"].get<std::uint64_t>(), c.expectedSeq);
         EXPECT_EQ(closedFirstSeqs(sinks, "s"), c.closedAfter);
         EXPECT_EQ(tornRemoved, c.torn);

@@ -114,22 +114,10 @@ TEST_F(TheLinuxDiagnosticRequestService, RecordsRequestsAndSaysOnceThatPerfIsMis
 
     auto requests = lines("request");
     ASSERT_EQ(requests.size(), 3u);
-    EXPECT_EQ(requests[0], (Json{{"time", requests[0]["time"]},
-                                 {"seq", requests[0]["seq"]},
-                                 {"op", "request"},
-                                 {"request", 1},
-                                 {"domain", "com.korvane.qvsound"},
-                                 {"kind", "AudioOverloads"},
-                                 {"description", "com.example.daw"},
-                                 {"payload", {{"smallest_buffer_frame_size", 1024}, {"n", 1}}},
-                                 {"options",
-                                  {{"sampleStacks", true},
-                                   {"callGraphs", true},
-                                   {"extendedWindow", false},
-                                   {"userSpaceOnly", false},
-                                   {"skipReport", false}}},
-                                 {"sampled", true}}))
-        << "perf is looked for by the sampler, not the caller";
+    // The request's members are the end-to-end overload test's; here, its number and that it
+    // was taken to be sampled before the sampler looked for perf.
+    EXPECT_EQ(requests[0]["request"], 1);
+    EXPECT_EQ(requests[0]["sampled"], true) << "perf is looked for by the sampler, not the caller";
     auto samples = lines("sample");
     ASSERT_EQ(samples.size(), 1u);
     EXPECT_EQ(samples[0]["ok"], false);
@@ -296,48 +284,6 @@ TEST_F(TheLinuxDiagnosticRequestService, StopsAPerfThatOverstaysWithEverythingIt
     const auto stopped = lines("sample");
     ASSERT_EQ(stopped.size(), 2u);
     EXPECT_EQ(stopped[1]["error"], "perf record was stopped: the service is stopping");
-}
-
-TEST_F(TheLinuxDiagnosticRequestService, TakesARealSystemWideSampleWithPerf) {
-    if (const auto why = LinuxDiagnosticRequestService::perfUnavailableReason("perf")) {
-        GTEST_SKIP() << "no stack sample here: " << *why;
-    }
-    auto o = options("perf");
-    o.sampleWindow = 500ms;
-    auto service = make(std::move(o));
-    request(*service, 1);
-    request(*service, 2);
-    service->flush();
-
-    const auto samples = lines("sample");
-    ASSERT_EQ(samples.size(), 1u);
-    if (samples[0]["ok"] != true) {
-        // perf present and permitted on paper may still be refused (a container's seccomp
-        // filter, say): the service then stops asking it, which is what a refusal looks like.
-        request(*service, 3);
-        service->flush();
-        const auto third = lines("request")[2];
-        if (third["sampled"] == false &&
-            third["reason"].get<std::string>().rfind("perf refused", 0) == 0) {
-            GTEST_SKIP() << "perf refused here: " << samples[0]["error"];
-        }
-        FAIL() << samples[0].dump();
-    }
-    EXPECT_GT(samples[0]["dataBytes"].get<std::uint64_t>(), 0u);
-    const std::string report = readFile(samples[0]["report"].get<std::string>());
-    EXPECT_NE(report.find("# Samples"), std::string::npos) << report.substr(0, 400);
-    EXPECT_EQ(lines("request")[1]["reason"], "a sample is already being taken");
-
-    // perf wrote nothing outside the Spinlogs directory of the state directory.
-    std::vector<std::string> written;
-    for (const auto& e : fs::recursive_directory_iterator(state.path())) {
-        if (e.is_regular_file()) {
-            written.push_back(fs::relative(e.path(), state.path()).string());
-        }
-    }
-    for (const auto& f : written) {
-        EXPECT_TRUE(f == "sinks/diagnostics.jsonl" || f.rfind("logs/Audio/Spinlogs/", 0) == 0) << f;
-    }
 }
 
 }  // namespace

@@ -221,13 +221,8 @@ TEST_F(ALinuxIssueCaptureService, CollectsTheStatusOfLiveProcessesAndSaysWhatItC
     const std::string captureID = id(reply);
     const auto m = manifest(captureID);
     ASSERT_TRUE(m.is_object());
-    EXPECT_EQ(m["kind"], "snapshot");
+    // The status file's contents are the end-to-end test's part; here, what cannot be read.
     EXPECT_EQ(m["processIDs"], (nlohmann::json{self, 4194303}));
-
-    std::ifstream status(captures() / captureID / ("status-" + std::to_string(self) + ".txt"));
-    std::string first;
-    std::getline(status, first);
-    EXPECT_TRUE(first.starts_with("Name:")) << first;
 
     std::vector<std::string> missing;
     for (const auto& n : m["notCollected"]) {
@@ -308,12 +303,6 @@ TEST_F(ALinuxIssueCaptureService, BoundsTheRequestsWaitingForItsThreadAndItsPend
               static_cast<long>(LinuxIssueCaptureService::kMaxQueuedRequests -
                                 LinuxIssueCaptureService::kMaxPendingSessions + 1));
 }
-
-}  // namespace
-}  // namespace qv
-
-namespace qv {
-namespace {
 
 // A disk that fills up in the middle of a capture, played by a file-size limit: every write past
 // it fails (EFBIG) as a full disk's would (ENOSPC), with SIGXFSZ ignored.

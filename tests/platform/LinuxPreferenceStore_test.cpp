@@ -155,16 +155,8 @@ TEST_F(ALinuxPreferenceStore, RefusesWhatIsNotASmallRegularFileOnceWithoutBlocki
 
 TEST_F(ALinuxPreferenceStore, KeepsHostileSuiteNamesInsideItsDirectoryAndApart) {
     LinuxPreferenceStore store(stateDir.string(), recordErrors());
-    const std::string names[] = {"../../etc/x",
-                                 "/abs",
-                                 "a/b",
-                                 "a_b",
-                                 "..",
-                                 ".",
-                                 "",
-                                 std::string("nul\0x", 5),
-                                 "line\nfeed",
-                                 std::string(10000, 'n')};
+    // How each name is escaped is SafeFileName's test; here, that the store escapes them all.
+    const std::string names[] = {"../../etc/x", "a/b", "a_b", "..", "", std::string(10000, 'n')};
     for (std::size_t i = 0; i < std::size(names); ++i) {
         ASSERT_TRUE(store.setValue(names[i], "i", Value(static_cast<std::int64_t>(i)))) << names[i];
     }
