@@ -81,7 +81,11 @@ void onAck(jsCtx*, natsMsg* msg, jsPubAck* ack, jsPubAckErr* error, void* closur
     std::uint64_t seq = 0;
     if (natsMsgHeader_Get(msg, kMessageIDHeader, &id) == NATS_OK && id &&
         parseMessageID(id, sink, seq)) {
-        if (ack) {
+        if (ack && ack->Duplicate && ack->Sequence == 0) {
+            // The stream's leader has the ID from a publication it has not stored yet: that one
+            // is lost if the leader goes before it is, so this is no proof; sent again later.
+            callbacks.failed(sink, seq, "a duplicate of a line the stream has not stored yet");
+        } else if (ack) {
             callbacks.acknowledged(sink, seq, ack->Duplicate);
         } else {
             std::string text =
