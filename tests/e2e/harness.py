@@ -22,6 +22,17 @@ DAEMON = os.environ.get("QVREPORTD", "qvreportd")
 SOURCE_DIR = os.environ.get("QV_SOURCE_DIR", os.path.join(os.path.dirname(__file__), "..", ".."))
 
 
+def jsonl_lines(path):
+    """The whole lines of a JSON-lines file, [] while there is none. What follows the last
+    newline is a line still being written (one write can reach the file a page at a time, even
+    mid-character): the next read has it."""
+    if not os.path.exists(path):
+        return []
+    with open(path, "rb") as f:
+        data = f.read()
+    return [json.loads(line.decode()) for line in data.split(b"\n")[:-1] if line.strip()]
+
+
 def wait_until(predicate, timeout=30.0, interval=0.02, what="condition"):
     deadline = time.monotonic() + timeout
     while True:
@@ -118,17 +129,8 @@ class Daemon:
         closed = sorted(n for n in os.listdir(sinks) if n.startswith(sink + ".")
                         and n.endswith(".jsonl") and n[len(sink) + 1:-6].isdigit()) \
             if os.path.isdir(sinks) else []
-        lines = []
-        for name in closed + [sink + ".jsonl"]:
-            path = os.path.join(sinks, name)
-            if os.path.exists(path):
-                with open(path, "rb") as f:
-                    data = f.read()
-                # What follows the last newline is a line still being written (one write can
-                # reach the file a page at a time, even mid-character): the next read has it.
-                lines += [json.loads(line.decode()) for line in data.split(b"\n")[:-1]
-                          if line.strip()]
-        return lines
+        return [line for name in closed + [sink + ".jsonl"]
+                for line in jsonl_lines(os.path.join(sinks, name))]
 
     def events(self, prefix=""):
         return [l for l in self.sink_lines("analytics") if l["event"].startswith(prefix)]

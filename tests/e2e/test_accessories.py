@@ -13,7 +13,7 @@ import unittest
 
 import dbus
 
-from harness import Bus, Client, Daemon, wait_until
+from harness import Bus, Client, Daemon, jsonl_lines, wait_until
 
 SUITE = "com.korvane.qvsound.qvreporting.audioreg"
 TRIGGER = "Speaker, BT Headphones qwrT ( b71c ) ( 6402 ) , Microphone"
@@ -112,11 +112,7 @@ class AccessoryTestCase(unittest.TestCase):
     def convo(self):
         """The registration report's lines of the convo sink, where every session also mirrors
         itself."""
-        path = os.path.join(self.state, "sinks", "convo.jsonl")
-        if not os.path.exists(path):
-            return []
-        with open(path) as f:
-            lines = [json.loads(line) for line in f if line.strip()]
+        lines = jsonl_lines(os.path.join(self.state, "sinks", "convo.jsonl"))
         reports = {l["session"] for l in lines if l["op"] == "session"
                    and l["userInfo"].get("ClientName") == "Earlink_Telemetry"}
         return [l for l in lines if l["session"] in reports]

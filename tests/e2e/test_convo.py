@@ -1,14 +1,13 @@
 """The Convo sink end to end: a session mirrored into sinks/convo.jsonl by the real daemon, then
 the service switched off through its defaults suite with qvreportctl."""
 
-import json
 import os
 import subprocess
 import sys
 import unittest
 
 sys.path.insert(0, os.path.dirname(__file__))
-from harness import DAEMON, DaemonTestCase, wait_until  # noqa: E402
+from harness import DAEMON, DaemonTestCase, jsonl_lines, wait_until  # noqa: E402
 
 # Built beside qvreportd.
 CTL = os.environ.get("QVREPORTCTL", os.path.join(os.path.dirname(DAEMON), "qvreportctl"))
@@ -18,11 +17,7 @@ DSP_PLAYBACK, STATE, TELEPHONY = 0x10000004, 18, 2
 
 class ConvoReporting(DaemonTestCase):
     def lines(self):
-        path = os.path.join(self.daemon.state_dir, "sinks", "convo.jsonl")
-        if not os.path.exists(path):
-            return []
-        with open(path) as f:
-            return [json.loads(line) for line in f if line.strip()]
+        return jsonl_lines(os.path.join(self.daemon.state_dir, "sinks", "convo.jsonl"))
 
     def defaults_write(self, key, value):
         subprocess.run([CTL, "--bus", self.bus.address, "--state-dir", self.daemon.state_dir,

@@ -15,7 +15,7 @@ from dbus.mainloop.glib import DBusGMainLoop
 from gi.repository import GLib
 
 sys.path.insert(0, os.path.dirname(__file__))
-from harness import (DAEMON, NOTIFY_INTERFACE, Bus, Client, Daemon, wait_until)  # noqa: E402
+from harness import (DAEMON, NOTIFY_INTERFACE, Bus, Client, Daemon, jsonl_lines, wait_until)  # noqa: E402
 
 CTL = os.path.join(os.path.dirname(os.path.abspath(DAEMON)), "qvreportctl")
 SUITE = "com.korvane.qvsound.qvreporting"
@@ -60,11 +60,7 @@ class DiagnosticsTestCase(unittest.TestCase):
         self.assertEqual(status, 0)
 
     def sink(self, name, op=None):
-        path = os.path.join(self.state, "sinks", name + ".jsonl")
-        if not os.path.exists(path):
-            return []
-        with open(path) as f:
-            lines = [json.loads(line) for line in f if line.strip()]
+        lines = jsonl_lines(os.path.join(self.state, "sinks", name + ".jsonl"))
         return [l for l in lines if op is None or l["op"] == op]
 
     def logged(self, text):
@@ -181,12 +177,8 @@ class IssueFilerPrompt(DiagnosticsTestCase):
         self.assertEqual(drafts[0]["title"], "Invalid x/y coordinates during a Vidcall call (ITF)")
         self.assertEqual(drafts[0]["component"]["name"], "Vidcall Core - Callwire")
         self.assertEqual(prompts[0]["shown"], True)
-        def notes_so_far():  # the server may answer before it writes down what it showed
-            if not os.path.exists(notified):
-                return []
-            with open(notified) as f:
-                return [json.loads(line) for line in f if line.endswith("\n")]
-        notes = wait_until(notes_so_far, what="the notification server's record")
+        # The server may answer before it writes down what it showed.
+        notes = wait_until(lambda: jsonl_lines(notified), what="the notification server's record")
         self.assertEqual(len(notes), 1)
         self.assertEqual(notes[0]["summary"], drafts[0]["title"])
         self.assertIn("python3: a Vidcall spatial positioning error occurred", notes[0]["body"])

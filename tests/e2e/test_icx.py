@@ -12,7 +12,7 @@ import unittest
 import uuid
 
 sys.path.insert(0, os.path.dirname(__file__))
-from harness import DAEMON, DaemonTestCase, wait_until  # noqa: E402
+from harness import DAEMON, DaemonTestCase, jsonl_lines, wait_until  # noqa: E402
 
 PLAYBACK, ENERGY_LOG, HAPTICS = 4, 8, 3
 JOURNAL_REMOTE = "/lib/systemd/systemd-journal-remote"
@@ -79,11 +79,7 @@ class HapticLeakCapture(DaemonTestCase):
         wait_until(lambda: "Started ICX session for haptics leaks. sessionId="
                    + os.path.basename(capture) in self.daemon.log_text(), what="the reply's log line")
         def sink_lines():
-            path = os.path.join(self.daemon.state_dir, "sinks", "issuecapture.jsonl")
-            if not os.path.exists(path):
-                return []
-            with open(path) as f:
-                return [json.loads(line) for line in f if line.endswith("\n")]
+            return jsonl_lines(os.path.join(self.daemon.state_dir, "sinks", "issuecapture.jsonl"))
         lines = wait_until(lambda: len(sink_lines()) >= 2 and sink_lines(), what="the sink lines")
         self.assertEqual([l["op"] for l in lines], ["snapshot", "reply"])
         self.assertEqual(lines[0]["payload"]["DEParameters"][

@@ -2,7 +2,6 @@
 record through protoc and the shipped schema, and through qvreportctl."""
 
 import base64
-import json
 import math
 import os
 import subprocess
@@ -12,7 +11,7 @@ import unittest
 import dbus
 
 sys.path.insert(0, os.path.dirname(__file__))
-from harness import DaemonTestCase, SOURCE_DIR, DAEMON, wait_until  # noqa: E402
+from harness import DaemonTestCase, SOURCE_DIR, DAEMON, jsonl_lines, wait_until  # noqa: E402
 
 IO, GENERIC = 7, 1
 ISSUE_DETECTOR, ENERGY_LOG = 7, 8
@@ -21,11 +20,7 @@ QVREPORTCTL = os.path.join(os.path.dirname(DAEMON), "qvreportctl")
 
 
 def sink_lines(daemon, name):
-    path = os.path.join(daemon.state_dir, "sinks", name + ".jsonl")
-    if not os.path.exists(path):
-        return []
-    with open(path) as f:
-        return [json.loads(line) for line in f if line.strip()]
+    return jsonl_lines(os.path.join(daemon.state_dir, "sinks", name + ".jsonl"))
 
 
 def protoc(wire, *arguments):
