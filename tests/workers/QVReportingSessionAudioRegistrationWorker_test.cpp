@@ -242,51 +242,59 @@ TEST_F(AnAudioRegistrationWorker, PublishesDevicesSeenInTheLastEightDaysAsWeekNu
     EXPECT_TRUE(fake.convo.sessions[0]->sessionInfo.contains("HierarchyToken"));
 }
 
-TEST_F(AnAudioRegistrationWorker, ChecksAgainInAWeekWhenNoDeviceWasActive) {
+// A due stop that publishes nothing checks again in a week when no device was active, a day later
+// when the publication failed, and not before the next trigger when it cannot read what it holds.
+TEST_F(AnAudioRegistrationWorker, ReschedulesADueStopThatPublishesNothing) {
     const double now = fake.clock.now();
-    storeRegistration({now - 691201, 0});
-    dueNow();
-    auto session = started();
-    session->stop();
-    EXPECT_TRUE(fake.convo.sessions.empty());
-    EXPECT_TRUE(
-        log->contains("No active Bud connections detected since last publish. Skip "
-                      "publishing anything; check again after SamplingPeriod"));
-    EXPECT_EQ(storedDouble("AudioRegistrationNextInvocationEpoch"), now + 604800);
-}
-
-TEST_F(AnAudioRegistrationWorker, RetriesADayLaterWhenThePublicationFails) {
-    const double now = fake.clock.now();
-    struct Failure {
+    const Value active = Array{Dictionary{{"lastConnectedEpoch", now}}};
+    struct Case {
         const char* what;
+        Value registration;  // the "splunk" list
         std::function<void(test::FakeConvoService&)> arrange;
         const char* logged;
+        std::optional<double> next;  // the next check, from now
     };
-    const Failure failures[] = {
-        {"no token", [](auto& c) { c.available = false; },
+    const Case cases[] = {
+        {"no device active",
+         Array{Dictionary{{"lastConnectedEpoch", now - 691201}},
+               Dictionary{{"lastConnectedEpoch", 0}}},
+         [](auto&) {},
+         "No active Bud connections detected since last publish. Skip publishing anything; check "
+         "again after SamplingPeriod",
+         604800},
+        {"no token", active, [](auto& c) { c.available = false; },
          "newHierarchyTokenFromParentToken returned nil. Will skip convo for this session. "
-         "-[QVReportingSessionAudioRegistrationWorker setupConvoReporterInterface:]"},
-        {"no backends", [](auto& c) { c.backends.reset(); },
-         "no backends found, this session won't get sent to the server"},
-        {"send error", [](auto& c) { c.sendError = "the sink is full"; },
-         "error sending message the sink is full"},
+         "-[QVReportingSessionAudioRegistrationWorker setupConvoReporterInterface:]",
+         86400},
+        {"no backends", active, [](auto& c) { c.backends.reset(); },
+         "no backends found, this session won't get sent to the server", 86400},
+        {"send error", active, [](auto& c) { c.sendError = "the sink is full"; },
+         "error sending message the sink is full", 86400},
+        {"an entry that is no dictionary", Array{"not an entry"}, [](auto&) {},
+         "Exception while trying to process registration info : a registration entry is not a "
+         "dictionary",
+         std::nullopt},
     };
-    for (const auto& f : failures) {
+    for (const auto& c : cases) {
+        SCOPED_TRACE(c.what);
         Worker::TEST_resetSharedState();
         test::FakePlatform platform;
-        f.arrange(platform.convo);
+        c.arrange(platform.convo);
         platform.clock.setNow(now);
-        platform.preferences.setValue(
-            kSuite, "ELRegistrationInfo",
-            Dictionary{{"splunk", Array{Dictionary{{"lastConnectedEpoch", now}}}}});
+        platform.preferences.setValue(kSuite, "ELRegistrationInfo",
+                                      Dictionary{{"splunk", c.registration}});
         platform.preferences.setValue(kSuite, "AudioRegistrationNextInvocationEpoch", now - 1);
         auto session = QVReportingSession::initWithID(platform.platform, 7, {1});
         session->start();
         session->stop();
-        EXPECT_TRUE(log->contains(f.logged)) << f.what;
-        EXPECT_EQ(platform.preferences.value(kSuite, "AudioRegistrationNextInvocationEpoch"),
-                  Value(now + 86400))
-            << f.what;
+        EXPECT_TRUE(log->contains(c.logged));
+        if (c.next) {
+            EXPECT_EQ(platform.preferences.value(kSuite, "AudioRegistrationNextInvocationEpoch"),
+                      Value(now + *c.next));
+        }
+        if (c.next != 86400.0) {
+            EXPECT_TRUE(platform.convo.sessions.empty()) << "nothing to publish";
+        }
     }
 }
 
@@ -307,18 +315,6 @@ TEST_F(AnAudioRegistrationWorker, SendsWhenTheBackendsAnswerAfterTheSessionIsGon
     service.join();
     EXPECT_EQ(sent().size(), 2u);
     EXPECT_EQ(storedDouble("AudioRegistrationNextInvocationEpoch"), now + 604800);
-}
-
-TEST_F(AnAudioRegistrationWorker, LogsARegistrationItCannotRead) {
-    fake.preferences.setValue(kSuite, "ELRegistrationInfo",
-                              Dictionary{{"splunk", Array{"not an entry"}}});
-    dueNow();
-    auto session = started();
-    session->stop();
-    EXPECT_TRUE(log->contains(
-        "Exception while trying to process registration info : a registration entry is not a "
-        "dictionary"));
-    EXPECT_TRUE(fake.convo.sessions.empty());
 }
 
 TEST(AudioRegistrationWorkWeek, CountsSundayWeeksWithTheWeekOfFirstJanuaryAsWeekOne) {
