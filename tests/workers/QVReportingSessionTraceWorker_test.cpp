@@ -79,6 +79,15 @@ class ATraceWorker : public ::testing::Test {
         waits = semaphore.get();
         return Worker::TEST_initWithSession(session, std::move(semaphore));
     }
+    // Records a test session of this configuration once: whether the start was reported. The
+    // worker stays, and with it what waits reads.
+    bool recordOnce(const Dictionary& configuration) {
+        recordedSession = make(service::kTest, configuration);
+        recorded = worker(recordedSession);
+        const bool started = recorded->start();
+        recorded->stop();
+        return started;
+    }
     std::vector<fs::path> files(const fs::path& directory) const {
         std::vector<fs::path> found;
         std::error_code ec;
@@ -103,6 +112,8 @@ class ATraceWorker : public ::testing::Test {
     fs::path trace;
     test::FakePlatform fake;
     test::FakeClockSemaphore* waits = nullptr;
+    std::shared_ptr<QVReportingSession> recordedSession;
+    std::shared_ptr<Worker> recorded;
 };
 
 TEST_F(ATraceWorker, RecordsATestSessionAndWritesEveryEventInMillisecondsDepthFirst) {
@@ -204,10 +215,7 @@ TEST_F(ATraceWorker, StopsAValidRecordingWhenItsStartIsNotReportedInFifteenSecon
 TEST_F(ATraceWorker, LeavesNoResultsFileWhenTheTraceDoesNotCompleteInThreeMinutes) {
     test::ScopedMemoryLog log;
     fake.spanTrace.stopAnswer = test::FakeSpanTraceRecorder::Answer::Never;
-    auto wSession = make(service::kTest, config());
-    auto w = worker(wSession);
-    ASSERT_TRUE(w->start());
-    w->stop();
+    ASSERT_TRUE(recordOnce(config()));
     EXPECT_EQ(waits->timeouts, std::vector<double>{180.0});
     EXPECT_EQ(log->count("timed out waiting for performance trace to stop.  No gdj file wil be "
                          "generated. "),
@@ -236,10 +244,7 @@ TEST_F(ATraceWorker, TakesTheFailurePathsOfTheRecorderWithoutWaitingOrWriting) {
     fake.spanTrace.startError.reset();
     fake.spanTrace.stopError = "cannot switch tracing off";
     fake.spanTrace.completeError = "disk full";
-    auto secondSession = make(service::kTest, config());
-    auto second = worker(secondSession);
-    ASSERT_TRUE(second->start());
-    second->stop();
+    ASSERT_TRUE(recordOnce(config()));
     EXPECT_TRUE(log->contains("spanTraceDidStop cannot switch tracing off"));
     EXPECT_TRUE(log->contains("spanTraceDidComplete disk full"));
     EXPECT_EQ(log->count("No traceResults at path: (null)"), 2u);
@@ -271,10 +276,7 @@ TEST_F(ATraceWorker, RefusesProbeListsItCannotUseAndWritesNothingForThem) {
         std::ofstream(probeList, std::ios::trunc) << c.text;
         fake.threadline.model->asked.clear();
         fake.gaugeData.files.clear();
-        auto wSession = make(service::kTest, config());
-        auto w = worker(wSession);
-        ASSERT_TRUE(w->start());
-        w->stop();
+        ASSERT_TRUE(recordOnce(config()));
         EXPECT_TRUE(log->contains(c.logged));
         const std::size_t asked =
             fake.threadline.model->asked.empty() ? 0 : fake.threadline.model->asked[0].size();
@@ -298,19 +300,13 @@ TEST_F(ATraceWorker, RefusesProbeListsItCannotUseAndWritesNothingForThem) {
 TEST_F(ATraceWorker, LogsModelWriterAndMoveFailuresAndGoesOn) {
     test::ScopedMemoryLog log;
     fake.threadline.error = "not a trace";
-    auto wSession = make(service::kTest, config());
-    auto w = worker(wSession);
-    ASSERT_TRUE(w->start());
-    w->stop();
+    ASSERT_TRUE(recordOnce(config()));
     EXPECT_TRUE(log->contains("failed to create Threadline model: not a trace"));
     EXPECT_TRUE(fake.gaugeData.files.empty());
 
     fake.threadline.error.reset();
     fake.gaugeData.openError = EACCES;
-    auto secondSession = make(service::kTest, config());
-    auto second = worker(secondSession);
-    ASSERT_TRUE(second->start());
-    second->stop();
+    ASSERT_TRUE(recordOnce(config()));
     EXPECT_TRUE(log->contains("Failed to open gaugedata writer. errno: 13"));
     EXPECT_TRUE(log->contains("Failed to move file")) << "no temporary file to move";
     EXPECT_TRUE(log->contains("name:decode time:1000.000000 ms")) << "probes still evaluated";
@@ -345,10 +341,7 @@ TEST_F(ATraceWorker, KeepsItsResultsInsideTheDiagnosticLogDirectory) {
     Dictionary hostile = config();
     hostile.set(QVReportingThreadlineOutputFileDirectory, "../../elsewhere");
     hostile.set(QVReportingThreadlineOutputFileName, "../../etc/results.gdj");
-    auto wSession = make(service::kTest, hostile);
-    auto w = worker(wSession);
-    ASSERT_TRUE(w->start());
-    w->stop();
+    ASSERT_TRUE(recordOnce(hostile));
     EXPECT_TRUE(log->contains("refusing QVReportingThreadlineOutputFileDirectory: "));
     const auto results = files(fallback);
     ASSERT_EQ(results.size(), 1u);
