@@ -8,12 +8,15 @@
 #include <string>
 #include <vector>
 
-#include "workers/WorkerTestSupport.h"
-
 namespace qv {
 namespace {
 
-using test::keysOf;
+std::vector<std::string> keysOf(const Dictionary& d) {
+    std::vector<std::string> keys;
+    for (const auto& entry : d)
+        keys.push_back(entry.first);
+    return keys;
+}
 
 TEST(Value, ComparesNumbersExactlyByValueAcrossKindsButNeverWithOtherKinds) {
     constexpr auto kUMax = std::numeric_limits<std::uint64_t>::max();
