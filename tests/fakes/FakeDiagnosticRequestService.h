@@ -15,19 +15,15 @@ namespace qv::test {
 class FakeDiagnosticRequestService : public DiagnosticRequestService {
   public:
     struct Request {
-        std::string domain;
-        std::string kind;
         std::string description;
         Dictionary payload;
-        DiagnosticRequestOptions options;
     };
 
-    void request(std::string_view domain, std::string_view kind, std::string_view description,
-                 const Dictionary& payload, const DiagnosticRequestOptions& options) override {
+    void request(std::string_view, std::string_view, std::string_view description,
+                 const Dictionary& payload, const DiagnosticRequestOptions&) override {
         {
             std::lock_guard lock(mutex_);
-            requests.push_back({std::string(domain), std::string(kind), std::string(description),
-                                payload, options});
+            requests.push_back({std::string(description), payload});
         }
         if (onRequest) {
             onRequest();

@@ -22,15 +22,11 @@ class FakeGaugeDataWriter : public GaugeDataWriter {
     };
     struct File {
         std::filesystem::path path;
-        std::string name;
-        int version = 0;
-        int options = 0;
         std::vector<Entry> values;
         bool closed = false;
     };
 
-    Opened open(const std::filesystem::path& path, std::string_view name, int version,
-                int options) override {
+    Opened open(const std::filesystem::path& path, std::string_view, int, int) override {
         std::lock_guard lock(mutex_);
         if (openError != 0) {
             return {nullptr, openError};
@@ -38,9 +34,6 @@ class FakeGaugeDataWriter : public GaugeDataWriter {
         std::ofstream(path, std::ios::trunc);
         auto file = std::make_shared<File>();
         file->path = path;
-        file->name = std::string(name);
-        file->version = version;
-        file->options = options;
         files.push_back(file);
         return {std::make_unique<Handle>(files.back()), 0};
     }

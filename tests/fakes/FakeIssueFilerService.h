@@ -1,5 +1,5 @@
-// An IssueFiler service in memory: it records every draft it is asked to create and answers the
-// completion at once with `error` (none by default), on the caller's thread.
+// An IssueFiler service in memory: it records the process of every draft it is asked to create
+// and answers the completion at once with `error` (none by default), on the caller's thread.
 #pragma once
 
 #include <mutex>
@@ -14,17 +14,15 @@ namespace qv::test {
 class FakeIssueFilerService : public IssueFilerService {
   public:
     struct Request {
-        IssueDraft draft;
         std::string processName;
-        std::string displayReason;
     };
 
-    void createDraft(const IssueDraft& draft, std::string_view processName,
-                     std::string_view displayReason, Completion completion) override {
+    void createDraft(const IssueDraft&, std::string_view processName, std::string_view,
+                     Completion completion) override {
         std::optional<std::string> answer;
         {
             std::lock_guard lock(mutex_);
-            requests.push_back({draft, std::string(processName), std::string(displayReason)});
+            requests.push_back({std::string(processName)});
             answer = error;
         }
         if (completion) {

@@ -7,11 +7,8 @@
 
 #include "fakes/FakePlatform.h"
 #include "fakes/MemoryLogSink.h"
-#include "platform/linux/capture/LinuxProcessLauncher.h"
-#include "session/QVReportingSession.h"
 #include "session/QVReportingStats.h"
-#include "session/QVReportingUtility.h"
-#include "session/QVReportingWorkerRegistry.h"
+#include "workers/WorkerTestSupport.h"
 
 namespace qv {
 namespace {
@@ -93,18 +90,12 @@ class AMemoryLogWorker : public ::testing::Test {
   protected:
     void SetUp() override {
         Worker::TEST_resetRateLimit();
-        QVReportingUtilityTEST_resetInternalBuild();
         QVReportingStats::shared().TEST_reset();
-        QVReportingWorkerRegistry::TEST_reset({&makeWorkerClass<Worker>()});
         const auto defaults = Worker::readSettings(fake.preferences);
         processCommand = defaults.commands[0];
         kernelCommand = defaults.commands[1];
     }
-    void TearDown() override {
-        QVReportingWorkerRegistry::TEST_reset({});
-        QVReportingUtilityTEST_resetInternalBuild();
-        Worker::TEST_resetRateLimit();
-    }
+    void TearDown() override { Worker::TEST_resetRateLimit(); }
 
     std::shared_ptr<QVReportingSession> testSession(ReporterID id = 3) {
         auto session = QVReportingSession::initWithID(fake.platform, id, {99});
@@ -128,6 +119,7 @@ class AMemoryLogWorker : public ::testing::Test {
         return out;
     }
 
+    test::ScopedWorkerClasses<Worker> workerClasses;
     test::FakePlatform fake;
     test::ScopedMemoryLog log;
     std::string processCommand;
@@ -176,10 +168,6 @@ TEST_F(AMemoryLogWorker, CapturesBothListingsFilteringTheFirstOncePerFiveSeconds
                             "WIRED LOG BLOCK 1\nRESOURCE pid phys_mem\n   1 phys_mem 10 KiB "
                             "cpu_time 0:01 init\ntail? phys_mem \n",
                             "WIRED LOG BLOCK 1\nslabinfo - version: 2.1\nkmalloc-64 10 20\n"}));
-    for (const std::string& command : {processCommand, kernelCommand}) {
-        EXPECT_TRUE(log->contains("wiredlog: requesting '" + command + "'"));
-        EXPECT_TRUE(log->contains("wiredlog: request " + command + " captured"));
-    }
 
     // Five seconds later exactly, in another session: still too soon.
     fake.clock.advance(5.0);
@@ -225,26 +213,6 @@ TEST_F(AMemoryLogWorker, ReportsMissingToolsAndCutShortOnesAndUsesTheSettings) {
     s->sendMessage(request());
     EXPECT_TRUE(log->contains("wiredlog: unable to execute 'kzone -l'"));
     EXPECT_EQ(blocks().size(), 1u);
-}
-
-// Real shell commands through the Linux launcher: the pipe is read line by line, and a tool that
-// hangs is killed at its time-out while the other still delivers.
-TEST_F(AMemoryLogWorker, ReadsRealPipesAndKillsAToolThatHangs) {
-    LinuxProcessLauncher launcher;
-    const Platform platform = fake.with({.processLauncher = &launcher});
-    fake.preferences.setValue(QVReportingMemoryLogSuite, QVReportingMemoryLogKeyProcessCommand,
-                              "printf 'RESOURCE x\\nno\\n 1 phys_mem 5\\n'; sleep 30");
-    fake.preferences.setValue(QVReportingMemoryLogSuite, QVReportingMemoryLogKeyKernelCommand,
-                              "printf 'a\\nb' | cat");
-    fake.preferences.setValue(QVReportingMemoryLogSuite, QVReportingMemoryLogKeyTimeoutSeconds,
-                              0.3);
-    auto session = QVReportingSession::initWithID(platform, 5, {99});
-    session->setServiceType(service::kTest);
-    session->start();
-    session->sendMessage(request());
-    EXPECT_EQ(blocks(), (std::vector<std::string>{"WIRED LOG BLOCK 1\nRESOURCE x\n 1 phys_mem 5\n",
-                                                  "WIRED LOG BLOCK 1\na\nb\n"}));
-    EXPECT_TRUE(log->contains("cut short: time-out"));
 }
 
 }  // namespace

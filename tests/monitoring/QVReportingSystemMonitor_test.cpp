@@ -4,9 +4,8 @@
 
 #include "fakes/FakePlatform.h"
 #include "monitoring/QVReportingSessionSystemMonitorWorker.h"
-#include "session/QVReportingSession.h"
-#include "session/QVReportingWorkerRegistry.h"
 #include "session/SerialQueue.h"
+#include "workers/WorkerTestSupport.h"
 
 namespace qv {
 namespace {
@@ -29,16 +28,11 @@ TEST(QVReportingDefaultsOfTheSuite, ReadOnlyTheirOwnKeysAsBooleanOrText) {
 
 class ASystemMonitor : public ::testing::Test {
   protected:
-    void SetUp() override {
-        QVReportingSystemMonitor::reset();
-        QVReportingWorkerRegistry::TEST_reset(
-            {&makeWorkerClass<QVReportingSessionSystemMonitorWorker>()});
-    }
+    void SetUp() override { QVReportingSystemMonitor::reset(); }
     void TearDown() override {
         queue.sync([this] { session.reset(); });
         QVReportingSystemMonitor::reset();
         queue.sync([] {});
-        QVReportingWorkerRegistry::TEST_reset({});
     }
 
     void initialize() { QVReportingSystemMonitor::initializeWithQueue(queue, fake.platform); }
@@ -69,6 +63,7 @@ class ASystemMonitor : public ::testing::Test {
         return payloads;
     }
 
+    test::ScopedWorkerClasses<QVReportingSessionSystemMonitorWorker> workerClasses;
     FakePlatform fake;
     SerialQueue queue{"test.systemmonitor"};
     std::shared_ptr<QVReportingSession> session;

@@ -7,6 +7,7 @@
 #include "fakes/FakePlatform.h"
 #include "session/QVReportingSession.h"
 #include "session/QVReportingSessionWorker.h"
+#include "workers/WorkerTestSupport.h"
 
 namespace qv {
 namespace {
@@ -110,14 +111,6 @@ class Workers : public ::testing::Test {
         s->setIsSingleMessageSession(single);
         return s;
     }
-    template <typename T>
-    std::shared_ptr<T> worker(const QVReportingSession& s) {
-        for (const auto& w : s.messageWorkers()) {
-            if (auto t = std::dynamic_pointer_cast<T>(w))
-                return t;
-        }
-        return nullptr;
-    }
 
     test::FakePlatform fake;
 };
@@ -170,8 +163,8 @@ TEST_F(Workers, SkipClassesThatRefuseTheSessionOrSingleMessagesAndRetryWorkersTh
     switches.consumerStarts = false;
     auto s = make();
     s->start();
-    EXPECT_EQ(worker<TestProducer>(*s), nullptr);
-    auto failed = worker<TestRedundantConsumer>(*s);
+    EXPECT_EQ(test::workerOf<TestProducer>(*s), nullptr);
+    auto failed = test::workerOf<TestRedundantConsumer>(*s);
     ASSERT_TRUE(failed);
     EXPECT_FALSE(failed->started());
     journal.clear();
@@ -185,7 +178,7 @@ TEST_F(Workers, SkipClassesThatRefuseTheSessionOrSingleMessagesAndRetryWorkersTh
     auto single = make(/*single=*/true);
     single->start();
     EXPECT_EQ(single->workerInstanceCount(), 1u);
-    EXPECT_NE(worker<TestOnInitConsumer>(*single), nullptr);
+    EXPECT_NE(test::workerOf<TestOnInitConsumer>(*single), nullptr);
 }
 
 TEST_F(Workers, JudgeRedundancyAfterTheStopSortAgainstTheNewestByTime) {

@@ -7,7 +7,6 @@
 #include <cstdio>
 #include <filesystem>
 #include <fstream>
-#include <random>
 #include <string>
 #include <vector>
 
@@ -54,19 +53,11 @@ std::pair<bool, AudioIssueDetected> read(const std::string& bytes) {
 }
 
 TEST(AnAudioIssueDetected, WritesWhatProtocReadsAndFormatsTextAsProtocPrintsIt) {
-    // The worker's record: no timestamp, so no field 1; the number 12 as its text.
+    // A negative duration is sign-extended to ten bytes; bytes that are not text are escaped.
+    // (The worker's everyday record on the wire: its own test and the sink's end-to-end test.)
     AudioIssueDetected record;
     record.issuetype = "stall";
     record.node = "12";
-    record.rtaidclient = "c";
-    record.duration = 5;
-    EXPECT_EQ(wireOf(record),
-              "\x10\x05\x1a\x05stall\x22\x02"
-              "12\x2a\x01"
-              "c"s);
-    EXPECT_EQ(protoc(wireOf(AudioIssueDetected{}), false), "2: 0\n3: \"\"\n4: \"\"\n5: \"\"\n");
-
-    // A negative duration is sign-extended to ten bytes; bytes that are not text are escaped.
     record.duration = -5;
     record.rtaidclient = "a\"b\\c\n\r\t'\x01\xc3\xa9\x7f"s;
     const std::string wire = wireOf(record);
@@ -151,10 +142,11 @@ TEST(AnAudioIssueDetected, ReadsByFieldNumberAloneSkipsUnknownFieldsAndRefusesMa
     EXPECT_FALSE(read(nested(Reader::kMaxGroupDepth + 1)).first);
 }
 
-TEST(AnAudioIssueDetected, ComparesHashesCopiesAndExchangesAsAValue) {
+// The timestamp counts only with its presence bit, in equality, hashing and moves alike. (What a
+// record reads back as, and that copies keep it equal, the mtx_record fuzz target checks.)
+TEST(AnAudioIssueDetected, ComparesHashesAndMovesTheTimestampWithItsPresenceBit) {
     AudioIssueDetected a;
     a.issuetype = "t";
-    a.duration = -3;
     AudioIssueDetected b = a;
     b.timestamp = 99;  // stored, but its presence bit is clear
     b.has = 0xfffffffe;
@@ -164,55 +156,14 @@ TEST(AnAudioIssueDetected, ComparesHashesCopiesAndExchangesAsAValue) {
     EXPECT_NE(a, b);
     a.setTimestamp(98);
     EXPECT_NE(a, b);
-    a.timestamp = 99;
-    EXPECT_EQ(a, b);
-    const std::hash<std::string> h;
-    EXPECT_EQ(std::hash<AudioIssueDetected>{}(a),
-              99u ^ static_cast<std::size_t>(std::int64_t{-3}) ^ h("t") ^ h("") ^ h(""));
-    b.node = std::string(1, '\0');
-    EXPECT_NE(a, b);
 
     // Moving exchanges: the source ends up with what the target held, the mask included.
     AudioIssueDetected target;
-    target.rtaidclient = "target";
-    const AudioIssueDetected before = target;
     const AudioIssueDetected source = b;
     target = std::move(b);
     EXPECT_EQ(target, source);
     EXPECT_EQ(target.has, 0xffffffffu);
-    EXPECT_EQ(b, before);  // NOLINT(bugprone-use-after-move): moving exchanges by definition
-    swap(target, b);
-    EXPECT_EQ(target, before);
-    EXPECT_EQ(b.has, 0xffffffffu);
-}
-
-TEST(AnAudioIssueDetected, ReadsBackWhatItWritesAndReEncodesWhatItAccepts) {
-    std::mt19937_64 random(20240131);
-    const auto bytes = [&](std::size_t maximum) {
-        std::string s(random() % (maximum + 1), '\0');
-        for (auto& c : s) {
-            c = static_cast<char>(random());
-        }
-        return s;
-    };
-    for (int i = 0; i < 2000; ++i) {
-        AudioIssueDetected record;
-        record.issuetype = bytes(i % 7 == 0 ? 300 : 20);
-        record.node = bytes(5);
-        record.rtaidclient = bytes(40);
-        record.duration = static_cast<std::int32_t>(random());
-        if (random() % 2) {
-            record.setTimestamp(random() >> (random() % 64));
-        }
-        const auto [ok, back] = read(wireOf(record));
-        ASSERT_TRUE(ok && back == record && back.hash_value() == record.hash_value()) << i;
-
-        const auto [accepted, noise] = read(bytes(24));
-        if (accepted) {
-            const auto [again, copy] = read(wireOf(noise));
-            ASSERT_TRUE(again && copy == noise && wireOf(copy) == wireOf(noise)) << i;
-        }
-    }
+    EXPECT_EQ(b, AudioIssueDetected{});  // NOLINT(bugprone-use-after-move): moving exchanges
 }
 
 }  // namespace

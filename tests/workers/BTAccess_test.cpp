@@ -8,7 +8,7 @@
 
 #include "fakes/FakePlatform.h"
 #include "fakes/MemoryLogSink.h"
-#include "session/QVReportingUtility.h"
+#include "workers/WorkerTestSupport.h"
 
 namespace qv {
 namespace {
@@ -40,13 +40,7 @@ Dictionary withElement(Dictionary info, std::size_t element, Value value) {
     return info;
 }
 
-std::vector<std::string> keysOf(const Dictionary& d) {
-    std::vector<std::string> keys;
-    for (const auto& [k, v] : d) {
-        keys.push_back(k);
-    }
-    return keys;
-}
+using test::keysOf;
 
 class ABTAccess : public ::testing::Test {
   protected:

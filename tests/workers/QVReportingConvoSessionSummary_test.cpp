@@ -8,17 +8,12 @@
 #include <vector>
 
 #include "values/FrozenPayloads.h"
+#include "workers/WorkerTestSupport.h"
 
 namespace qv {
 namespace {
 
-std::vector<std::string> keysOf(const Dictionary& d) {
-    std::vector<std::string> keys;
-    for (const auto& entry : d) {
-        keys.push_back(entry.first);
-    }
-    return keys;
-}
+using test::keysOf;
 
 std::string text(const Dictionary& d, std::string_view key) {
     const Value* v = d.find(key);

@@ -8,28 +8,13 @@
 
 #include "fakes/FakePlatform.h"
 #include "fakes/MemoryLogSink.h"
-#include "session/QVReportingSession.h"
-#include "session/QVReportingWorkerRegistry.h"
+#include "workers/WorkerTestSupport.h"
 
 namespace qv {
 namespace {
 
-std::vector<std::string> keysOf(const Dictionary& d) {
-    std::vector<std::string> keys;
-    for (const auto& [key, value] : d) {
-        keys.push_back(key);
-    }
-    return keys;
-}
-
 class AnEnergyLogWorker : public ::testing::Test {
   protected:
-    void SetUp() override {
-        QVReportingWorkerRegistry::TEST_reset(
-            {&makeWorkerClass<QVReportingSessionEnergyLogWorker>()});
-    }
-    void TearDown() override { QVReportingWorkerRegistry::TEST_reset({}); }
-
     std::shared_ptr<QVReportingSession> make(const char* appName) {
         auto session = QVReportingSession::initWithID(fake.platform, 7, {1234});
         if (appName != nullptr) {
@@ -41,7 +26,7 @@ class AnEnergyLogWorker : public ::testing::Test {
     static std::shared_ptr<QVReportingSessionMessage> message(
         Dictionary payload, AudioEventType t = type::kEnergyLog,
         AudioEventCategory c = category::kGeneric) {
-        return std::make_shared<QVReportingSessionMessage>(std::move(payload), c, t);
+        return test::message(std::move(payload), c, t);
     }
     static std::vector<std::string> energyLogLines(test::MemoryLogSink& log) {
         std::vector<std::string> lines;
@@ -54,6 +39,7 @@ class AnEnergyLogWorker : public ::testing::Test {
         return lines;
     }
 
+    test::ScopedWorkerClasses<QVReportingSessionEnergyLogWorker> workerClasses;
     test::FakePlatform fake;
 };
 
@@ -62,10 +48,11 @@ TEST_F(AnEnergyLogWorker, RebuildsOneMessageIntoUpToThreeRecordsInAFixedOrder) {
     auto session = make("com.example.haptics");
     session->setIsSingleMessageSession(true);  // it serves those too
     session->start();
-    const Value clients = Array{"com.a", "com.b"};
+    // The records' names, order, keys and values: the sink's end-to-end test. Here, what it
+    // cannot see: any category serves, the end time is the message's, a status is an integer.
     const double stamp = fake.clock.now() - 2;
     session->sendMessage(message({{"Haptic_Active_Hardware_Time_Seconds", 3600.5},
-                                  {"Active_Clients", clients},
+                                  {"Active_Clients", Array{"com.a"}},
                                   {"EngineState", "EngineOn"},
                                   {"EngineOnTime", 12.25},
                                   {"qvreporting_timestamp", stamp}},
@@ -76,20 +63,8 @@ TEST_F(AnEnergyLogWorker, RebuildsOneMessageIntoUpToThreeRecordsInAFixedOrder) {
         EXPECT_EQ(e.registryID, 28u);
         EXPECT_FALSE(e.options.has_value());
     }
-    EXPECT_EQ(events[0].name, "Vantrel_Haptics_EngineOnDuration");
-    EXPECT_EQ(keysOf(events[0].payload),
-              (std::vector<std::string>{"EngineOnDuration", "ApplicationName", "TimestampEnd"}));
-    EXPECT_EQ(events[0].payload, (Dictionary{{"EngineOnDuration", 12.25},
-                                             {"ApplicationName", "com.example.haptics"},
-                                             {"TimestampEnd", stamp}}));
-    EXPECT_EQ(events[1].name, "Vantrel_Haptics_ClientStatus");
-    EXPECT_EQ(keysOf(events[1].payload),
-              (std::vector<std::string>{"Status", "ApplicationName", "TimestampEnd"}));
+    EXPECT_EQ(*events[0].payload.find("TimestampEnd"), Value(stamp));
     EXPECT_EQ(events[1].payload.find("Status")->kind(), Value::Kind::Int);
-    EXPECT_EQ(events[2].name, "LeakedHapticsSessionInfo");
-    EXPECT_EQ(keysOf(events[2].payload),
-              (std::vector<std::string>{"Haptic_Active_Hardware_Time_Seconds", "Active_Clients"}));
-    EXPECT_EQ(*events[2].payload.find("Active_Clients"), clients);
 
     // None of the keys, or another type holding them all: nothing, and no log line.
     fake.energyLog.clear();

@@ -6,7 +6,7 @@
 #include <tuple>
 
 #include "fakes/FakePlatform.h"
-#include "workers/DerivedMessagesTestSupport.h"
+#include "workers/WorkerTestSupport.h"
 
 namespace qv::test {
 namespace {

@@ -10,8 +10,7 @@
 
 #include "fakes/FakePlatform.h"
 #include "fakes/MemoryLogSink.h"
-#include "session/QVReportingSession.h"
-#include "session/QVReportingWorkerRegistry.h"
+#include "workers/WorkerTestSupport.h"
 #include "workers/backends/mtx/AudioIssueDetected.h"
 
 namespace qv {
@@ -23,16 +22,14 @@ using mtxmetrics::AudioIssueDetected;
 class AnMTXWorker : public ::testing::Test {
   protected:
     void SetUp() override {
-        QVReportingWorkerRegistry::TEST_reset({&makeWorkerClass<QVReportingSessionMTXWorker>()});
         session = QVReportingSession::initWithID(fake.platform, 7, {1234});
         worker = QVReportingSessionMTXWorker::initWithSession(session);
     }
-    void TearDown() override { QVReportingWorkerRegistry::TEST_reset({}); }
 
     static std::shared_ptr<QVReportingSessionMessage> message(
         Dictionary payload, AudioEventType t = type::kIssueDetector,
         AudioEventCategory c = category::kIO) {
-        return std::make_shared<QVReportingSessionMessage>(std::move(payload), c, t);
+        return test::message(std::move(payload), c, t);
     }
     // The one record posted since the last call, read back from its wire bytes.
     AudioIssueDetected posted() {
@@ -47,6 +44,7 @@ class AnMTXWorker : public ::testing::Test {
         return record;
     }
 
+    test::ScopedWorkerClasses<QVReportingSessionMTXWorker> workerClasses;
     test::FakePlatform fake;
     std::shared_ptr<QVReportingSession> session;
     std::shared_ptr<QVReportingSessionMTXWorker> worker;
@@ -60,16 +58,8 @@ TEST_F(AnMTXWorker, PostsOneRecordPerIssueDetectorMessageOfAnyCategory) {
                                   {"rtaid_client", "com.example"},
                                   {"any_channel_silence_seconds", 5}},
                                  type::kIssueDetector, category::kPrefixHAL | category::kOutput));
-    const auto all = fake.mtx.posted();
-    ASSERT_EQ(all.size(), 1u);
-    EXPECT_EQ(all[0].metricID, 5963779u);
-    EXPECT_EQ(all[0].wire,
-              "\x10\x05\x1a\x07"
-              "dropout\x22\x02"
-              "12\x2a\x0b"
-              "com.example"s)
-        << "fields 2 to 5 in order, no field 1";
-    fake.mtx.clear();
+    // The sink's end-to-end test decodes such a record; here, any category serves.
+    EXPECT_EQ(posted().issuetype, "dropout");
 
     for (AudioEventType t :
          {type::kGeneric, type::kError, type::kEnergyLog, AudioEventType{0xFFFF}}) {
@@ -153,11 +143,6 @@ TEST_F(AnMTXWorker, StoresTheTextOfAnyValueAndTheIntegerValueCutTo32Bits) {
         EXPECT_EQ(QVReportingSessionMTXWorker::durationFromValue(value), duration)
             << value.description();
     }
-    // Through the worker, a negative duration goes out as a ten-byte varint.
-    worker->handleMessage(message({{"any_channel_silence_seconds", -2.5}}));
-    EXPECT_EQ(fake.mtx.posted().at(0).wire.substr(0, 11),
-              "\x10\xfe\xff\xff\xff\xff\xff\xff\xff\xff\x01"s);
-    EXPECT_EQ(posted().duration, -2);
 }
 
 }  // namespace

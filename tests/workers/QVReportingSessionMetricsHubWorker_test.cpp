@@ -9,11 +9,12 @@
 #include <vector>
 
 #include "fakes/FakePlatform.h"
-#include "session/QVReportingSession.h"
-#include "session/QVReportingWorkerRegistry.h"
+#include "workers/WorkerTestSupport.h"
 
 namespace qv {
 namespace {
+
+using test::message;
 
 // Keeps the producers and runs them when the test says, as a backend recording later would.
 class DeferringAnalytics : public AnalyticsService {
@@ -27,21 +28,10 @@ class DeferringAnalytics : public AnalyticsService {
 
 class AMetricsHubWorker : public ::testing::Test {
   protected:
-    void SetUp() override {
-        QVReportingWorkerRegistry::TEST_reset(
-            {&makeWorkerClass<QVReportingSessionMetricsHubWorker>()});
-    }
-    void TearDown() override { QVReportingWorkerRegistry::TEST_reset({}); }
-
     std::shared_ptr<QVReportingSession> make(const Platform& platform, ReporterID id = 7) {
         return QVReportingSession::initWithID(platform, id, {1234});
     }
-    static std::shared_ptr<QVReportingSessionMessage> message(Dictionary payload,
-                                                              AudioEventCategory c,
-                                                              AudioEventType t) {
-        return std::make_shared<QVReportingSessionMessage>(std::move(payload), c, t);
-    }
-
+    test::ScopedWorkerClasses<QVReportingSessionMetricsHubWorker> workerClasses;
     test::FakePlatform fake;
 };
 

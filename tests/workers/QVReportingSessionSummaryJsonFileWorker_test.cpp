@@ -6,7 +6,6 @@
 #include <signal.h>
 #include <sys/resource.h>
 
-#include <cctype>
 #include <fstream>
 #include <iterator>
 #include <string>
@@ -15,10 +14,8 @@
 #include "fakes/FakePlatform.h"
 #include "fakes/MemoryLogSink.h"
 #include "fakes/TempDirectory.h"
-#include "session/QVReportingSession.h"
-#include "session/QVReportingUtility.h"
-#include "session/QVReportingWorkerRegistry.h"
 #include "values/ValueJson.h"
+#include "workers/WorkerTestSupport.h"
 
 namespace qv {
 namespace {
@@ -27,16 +24,7 @@ namespace fs = std::filesystem;
 
 class ASummaryJsonFileWorker : public ::testing::Test {
   protected:
-    void SetUp() override {
-        QVReportingUtilityTEST_resetInternalBuild();
-        QVReportingWorkerRegistry::TEST_reset(
-            {&makeWorkerClass<QVReportingSessionSummaryJsonFileWorker>()});
-        fake.device.logsDirectory = logs.path();
-    }
-    void TearDown() override {
-        QVReportingWorkerRegistry::TEST_reset({});
-        QVReportingUtilityTEST_resetInternalBuild();
-    }
+    void SetUp() override { fake.device.logsDirectory = logs.path(); }
 
     std::shared_ptr<QVReportingSession> make(AudioServiceType serviceType,
                                              const std::string& appName = "com.example.rec") {
@@ -48,7 +36,7 @@ class ASummaryJsonFileWorker : public ::testing::Test {
     }
     static void send(QVReportingSession& session, Dictionary payload, AudioEventCategory c,
                      AudioEventType t) {
-        session.sendMessage(std::make_shared<QVReportingSessionMessage>(std::move(payload), c, t));
+        session.sendMessage(test::message(std::move(payload), c, t));
     }
     std::vector<fs::path> files() const {
         std::vector<fs::path> found;
@@ -61,6 +49,7 @@ class ASummaryJsonFileWorker : public ::testing::Test {
         return found;
     }
 
+    test::ScopedWorkerClasses<QVReportingSessionSummaryJsonFileWorker> workerClasses;
     test::TempDirectory logs{"qvsummaryfile"};
     test::FakePlatform fake;
 };
@@ -79,11 +68,7 @@ TEST_F(ASummaryJsonFileWorker, WritesEachStoredMessageOnceUnderItsCountedKindAsA
     ASSERT_EQ(written.size(), 1u);
     // "yyyyMMdd-HHmmss" and the zone ("+hhmm" or "-hhmm"), then the session's own parts.
     const std::string name = written[0].filename().string();
-    std::string shape = name.substr(0, 20);
-    for (char& c : shape) {
-        c = std::isdigit(static_cast<unsigned char>(c)) ? '9' : c == '-' ? '+' : c;
-    }
-    EXPECT_EQ(shape, "99999999+999999+9999") << name;
+    EXPECT_EQ(test::timeStampShape(name), "99999999+999999+9999") << name;
     EXPECT_EQ(name.substr(20), "-42-com.example.rec-test.json");
 
     std::ifstream in(written[0]);

@@ -9,9 +9,8 @@
 
 #include "fakes/FakePlatform.h"
 #include "fakes/MemoryLogSink.h"
-#include "session/QVReportingSession.h"
 #include "session/QVReportingStats.h"
-#include "session/QVReportingWorkerRegistry.h"
+#include "workers/WorkerTestSupport.h"
 #include "workers/backends/QVReportingSessionMetricsHubWorker.h"
 
 namespace qv {
@@ -23,18 +22,14 @@ constexpr const char* kSummaryEvent = "com.korvane.qvsound.Session_Generic.Summa
 class ASummaryWorker : public ::testing::Test {
   protected:
     void SetUp() override {
-        QVReportingWorkerRegistry::TEST_reset(
-            {&makeWorkerClass<QVReportingSessionSummaryWorker>(),
-             &makeWorkerClass<QVReportingSessionMetricsHubWorker>()});
         session = QVReportingSession::initWithID(fake.platform, 21, {1234});
         session->setServiceType(service::kLongFormAudio);
         session->start();
     }
-    void TearDown() override { QVReportingWorkerRegistry::TEST_reset({}); }
 
     void send(Dictionary payload, AudioEventCategory c = category::kGeneric,
               AudioEventType t = type::kGeneric) {
-        session->sendMessage(std::make_shared<QVReportingSessionMessage>(std::move(payload), c, t));
+        session->sendMessage(test::message(std::move(payload), c, t));
     }
     // The one summary the stop produced.
     Dictionary stopAndGetSummary() {
@@ -44,6 +39,8 @@ class ASummaryWorker : public ::testing::Test {
         return events.empty() ? Dictionary{} : events.front().payload;
     }
 
+    test::ScopedWorkerClasses<QVReportingSessionSummaryWorker, QVReportingSessionMetricsHubWorker>
+        workerClasses;
     test::FakePlatform fake;
     std::shared_ptr<QVReportingSession> session;
 };

@@ -1,0 +1,87 @@
+// Helpers shared by the tests of sessions and their workers.
+#pragma once
+
+#include <cctype>
+#include <memory>
+#include <string>
+#include <vector>
+
+#include "session/QVReportingSession.h"
+#include "session/QVReportingSessionWorker.h"
+#include "session/QVReportingUtility.h"
+#include "session/QVReportingWorkerRegistry.h"
+
+namespace qv::test {
+
+using Messages = std::vector<std::shared_ptr<QVReportingSessionMessage>>;
+
+// Registers only the worker classes W, in that order, on a fresh reading of the build kind, and
+// leaves no class registered behind it.
+template <typename... W>
+class ScopedWorkerClasses {
+  public:
+    ScopedWorkerClasses() {
+        QVReportingUtilityTEST_resetInternalBuild();
+        QVReportingWorkerRegistry::TEST_reset({&makeWorkerClass<W>()...});
+    }
+    ~ScopedWorkerClasses() {
+        QVReportingWorkerRegistry::TEST_reset({});
+        QVReportingUtilityTEST_resetInternalBuild();
+    }
+    ScopedWorkerClasses(const ScopedWorkerClasses&) = delete;
+    ScopedWorkerClasses& operator=(const ScopedWorkerClasses&) = delete;
+};
+
+inline std::shared_ptr<QVReportingSessionMessage> message(Dictionary payload, AudioEventCategory c,
+                                                          AudioEventType t) {
+    return std::make_shared<QVReportingSessionMessage>(std::move(payload), c, t);
+}
+
+// The session's first worker of class W, or null.
+template <typename W>
+std::shared_ptr<W> workerOf(const QVReportingSession& session) {
+    for (const auto& w : session.messageWorkers()) {
+        if (auto found = std::dynamic_pointer_cast<W>(w)) {
+            return found;
+        }
+    }
+    return nullptr;
+}
+
+inline std::vector<std::string> keysOf(const Dictionary& d) {
+    std::vector<std::string> keys;
+    for (const auto& entry : d) {
+        keys.push_back(entry.first);
+    }
+    return keys;
+}
+
+// The shape of a result file's leading local time, "yyyyMMdd-HHmmss" and its zone ("+hhmm" or
+// "-hhmm"): every digit a 9 and every "-" a "+", so that it reads "99999999+999999+9999".
+inline std::string timeStampShape(const std::string& fileName) {
+    std::string shape = fileName.substr(0, 20);
+    for (char& c : shape) {
+        c = std::isdigit(static_cast<unsigned char>(c)) ? '9' : c == '-' ? '+' : c;
+    }
+    return shape;
+}
+
+// A client message at time t ("qvreporting_timestamp"; none when t is null).
+inline std::shared_ptr<QVReportingSessionMessage> at(Value t, Dictionary payload) {
+    if (!t.isNull()) {
+        payload.set("qvreporting_timestamp", t);
+    }
+    return QVReportingSessionMessage::initWithMessage(payload, category::kPlayback, type::kGeneric);
+}
+inline std::shared_ptr<QVReportingSessionMessage> set(Value t, const char* key, Value v) {
+    return at(t, {{key, v}});
+}
+
+inline std::shared_ptr<QVReportingSession> sessionWith(const Platform& platform,
+                                                       const Dictionary& previous) {
+    auto session = QVReportingSession::initWithID(platform, 7, {1});
+    session->previousValues() = previous;
+    return session;
+}
+
+}  // namespace qv::test
