@@ -5,10 +5,8 @@
 //                          [--app-id ID] [--role ROLE]
 #include <unistd.h>
 
-#include <cmath>
 #include <cstdio>
 #include <cstdlib>
-#include <cstring>
 #include <memory>
 #include <string>
 #include <vector>

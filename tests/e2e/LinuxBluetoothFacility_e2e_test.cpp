@@ -12,10 +12,8 @@
 #include <chrono>
 #include <cstdio>
 #include <fstream>
-#include <functional>
 #include <mutex>
 #include <string>
-#include <thread>
 #include <vector>
 
 #include <sdbus-c++/sdbus-c++.h>

@@ -15,10 +15,8 @@
 #include <fstream>
 #include <functional>
 #include <future>
-#include <limits>
 #include <mutex>
 #include <nlohmann/json.hpp>
-#include <sstream>
 #include <string>
 #include <thread>
 #include <vector>

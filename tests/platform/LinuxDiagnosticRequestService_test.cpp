@@ -11,7 +11,6 @@
 #include <fstream>
 #include <mutex>
 #include <string>
-#include <thread>
 #include <vector>
 
 #include "fakes/SinkLines.h"
