@@ -5,6 +5,7 @@
 //                          [--app-id ID] [--role ROLE]
 #include <unistd.h>
 
+#include <cmath>
 #include <cstdio>
 #include <cstdlib>
 #include <memory>

@@ -9,10 +9,10 @@
 #include <chrono>
 #include <filesystem>
 #include <fstream>
-#include <mutex>
 #include <string>
 #include <vector>
 
+#include "fakes/Notes.h"
 #include "fakes/SinkLines.h"
 #include "fakes/TempDirectory.h"
 #include "fakes/WaitUntil.h"
@@ -50,10 +50,7 @@ class TheLinuxDiagnosticRequestService : public ::testing::Test {
         LinuxDiagnosticRequestService::Options o;
         o.spinlogsDirectory = spinlogs;
         o.perf = perf;
-        o.notice = [this](const std::string& m) {
-            std::lock_guard lock(mutex);
-            notices.push_back(m);
-        };
+        o.notice = notices.callback();
         return o;
     }
     std::unique_ptr<LinuxDiagnosticRequestService> make(LinuxDiagnosticRequestService::Options o) {
@@ -89,18 +86,13 @@ class TheLinuxDiagnosticRequestService : public ::testing::Test {
     std::vector<nlohmann::ordered_json> lines(const std::string& op) const {
         return test::readSinkLines(state / "sinks/diagnostics.jsonl", op);
     }
-    std::vector<std::string> noticesSoFar() {
-        std::lock_guard lock(mutex);
-        return notices;
-    }
 
     test::TempDirectory state{"qv-diagnostics"};
     test::TempDirectory tools{"qv-fakeperf"};
     fs::path spinlogs = state / "logs/Audio/Spinlogs";
     LinuxClock clock;
     int scripts = 0;
-    std::mutex mutex;
-    std::vector<std::string> notices;
+    test::Notes notices;
 };
 
 TEST_F(TheLinuxDiagnosticRequestService, RecordsRequestsAndSaysOnceThatPerfIsMissingOrRefused) {
@@ -124,7 +116,7 @@ TEST_F(TheLinuxDiagnosticRequestService, RecordsRequestsAndSaysOnceThatPerfIsMis
     EXPECT_EQ(requests[1]["sampled"], false);
     EXPECT_EQ(requests[1]["reason"], samples[0]["error"]);
     EXPECT_EQ(requests[2]["reason"], "no stack sample was asked for");
-    EXPECT_EQ(noticesSoFar().size(), 1u);
+    EXPECT_EQ(notices.lines().size(), 1u);
     const auto counters = service->counters();
     EXPECT_EQ(counters.sampled, 0u);
     EXPECT_EQ(counters.notSampledUnavailable, 2u);
@@ -146,7 +138,7 @@ TEST_F(TheLinuxDiagnosticRequestService, RecordsRequestsAndSaysOnceThatPerfIsMis
     EXPECT_NE(error.find("perf_event_paranoid"), std::string::npos) << error;
     requests = lines("request");
     EXPECT_EQ(requests.back()["reason"], "perf refused: " + error);
-    EXPECT_EQ(noticesSoFar().size(), 2u);
+    EXPECT_EQ(notices.lines().size(), 2u);
 }
 
 TEST_F(TheLinuxDiagnosticRequestService, SamplesOneAtATimeAndRecordsTheRestWithoutQueueing) {

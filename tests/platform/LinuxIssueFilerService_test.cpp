@@ -20,6 +20,7 @@
 #include <vector>
 
 #include "fakes/FakeClock.h"
+#include "fakes/Notes.h"
 #include "fakes/SinkLines.h"
 #include "fakes/TempDirectory.h"
 #include "fakes/WaitUntil.h"
@@ -122,10 +123,7 @@ class TheLinuxIssueFilerService : public ::testing::Test {
             LinuxIssueFilerService::Options{.sessionBusAddress = std::move(address),
                                             .notifyTimeout = timeout,
                                             .maxPendingPrompts = maxPending,
-                                            .notice = [this](const std::string& m) {
-                                                std::lock_guard lock(mutex);
-                                                notices.push_back(m);
-                                            }});
+                                            .notice = notices.callback()});
     }
     LinuxIssueFilerService::Completion recorder() {
         return [this](const std::optional<std::string>& error) {
@@ -162,7 +160,7 @@ class TheLinuxIssueFilerService : public ::testing::Test {
     test::TempDirectory state{"qv-issuefiler"};
     test::FakeClock clock;
     std::mutex mutex;
-    std::vector<std::string> notices;
+    test::Notes notices;
     struct Completed {
         std::optional<std::string> error;
         std::thread::id thread;
@@ -196,14 +194,16 @@ TEST_F(TheLinuxIssueFilerService, WithoutASessionBusRecordsTheDraftAndSaysWhyNoP
     ASSERT_EQ(drafts.size(), 2u);
     drafts[0].erase("time");
     drafts[0].erase("seq");
-    EXPECT_EQ(drafts[0], Json::parse(
-        R"({"op":"draft","draft":1,"processName":"vidcalld",)"
-        R"("displayReason":"a Vidcall spatial positioning error occurred",)"
-        R"("title":"Invalid x/y coordinates during a Vidcall call (ITF)",)"
-        R"("problemDescription":"Something went wrong.","component":{"name":)"
-        R"("Vidcall Core - Callwire","version":"All","identifier":1174093},)"
-        R"("reproducibility":6,"classification":7,)"
-        R"("diagnosticExtensionIdentifiers":["com.korvane.DiagnosticExtensions.audio"]})"));
+    EXPECT_EQ(
+        drafts[0],
+        Json::parse(
+            R"({"op":"draft","draft":1,"processName":"vidcalld",)"
+            R"("displayReason":"a Vidcall spatial positioning error occurred",)"
+            R"j("title":"Invalid x/y coordinates during a Vidcall call (ITF)",)j"
+            R"("problemDescription":"Something went wrong.","component":{"name":)"
+            R"("Vidcall Core - Callwire","version":"All","identifier":1174093},)"
+            R"("reproducibility":6,"classification":7,)"
+            R"("diagnosticExtensionIdentifiers":["com.korvane.DiagnosticExtensions.audio"]})"));
     EXPECT_EQ(drafts[1]["draft"], 2);
 
     const auto prompts = sinkLines("prompt");
@@ -219,7 +219,7 @@ TEST_F(TheLinuxIssueFilerService, WithoutASessionBusRecordsTheDraftAndSaysWhyNoP
         EXPECT_EQ(c.error, std::nullopt) << "a recorded draft is a created draft";
         EXPECT_NE(c.thread, std::this_thread::get_id());
     }
-    EXPECT_EQ(notices.size(), 1u) << "the cause is told once";
+    EXPECT_EQ(notices.lines().size(), 1u) << "the cause is told once";
 }
 
 TEST_F(TheLinuxIssueFilerService, PromptsThroughTheDesktopNotificationServiceWhenOneRuns) {
@@ -291,8 +291,9 @@ TEST_F(TheLinuxIssueFilerService, GivesUpOnANotificationServiceThatHangsWithoutP
     {
         std::lock_guard lock(mutex);
         EXPECT_EQ(completions.size(), 4u) << "every completion runs once";
-        EXPECT_EQ(notices, (std::vector<std::string>{"issue filer: no prompt shown: " + refused,
-                                                     "issue filer: no prompt shown: " + timedOut}))
+        EXPECT_EQ(notices.lines(),
+                  (std::vector<std::string>{"issue filer: no prompt shown: " + refused,
+                                            "issue filer: no prompt shown: " + timedOut}))
             << "the overflow and the hang, each once";
     }
 
