@@ -148,10 +148,8 @@ TEST_F(TheReportData, GroupsEachSessionsMessagesAcrossDaemonRunsAndSegments) {
     const ReportData data = gather();
     ASSERT_EQ(data.sessions.size(), 3u);
     const auto& music = data.sessions[0];
-    EXPECT_EQ(music.reporterID, 5);
-    EXPECT_EQ(music.application, "music");
-    EXPECT_EQ(music.service, "longformaudio");
-    EXPECT_TRUE(music.stopped);
+    EXPECT_EQ(std::tie(music.reporterID, music.application, music.service, music.stopped),
+              std::tuple(5, "music", "longformaudio", true));
     EXPECT_DOUBLE_EQ(music.end - music.start, 10);
     EXPECT_EQ(music.messages, 2u);  // the mirror's folded summary is not a message
     EXPECT_EQ(QVReportingCtlCountsText(music.derived), "summary, volume stretch x2");

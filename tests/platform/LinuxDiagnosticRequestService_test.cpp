@@ -117,10 +117,9 @@ TEST_F(TheLinuxDiagnosticRequestService, RecordsRequestsAndSaysOnceThatPerfIsMis
     EXPECT_EQ(requests[1]["reason"], samples[0]["error"]);
     EXPECT_EQ(requests[2]["reason"], "no stack sample was asked for");
     EXPECT_EQ(notices.lines().size(), 1u);
-    const auto counters = service->counters();
-    EXPECT_EQ(counters.sampled, 0u);
-    EXPECT_EQ(counters.notSampledUnavailable, 2u);
-    EXPECT_EQ(counters.notSampledNotAsked, 1u);
+    const auto c = service->counters();
+    EXPECT_EQ(std::tie(c.sampled, c.notSampledUnavailable, c.notSampledNotAsked),
+              std::tuple(0u, 2u, 1u));
     EXPECT_FALSE(fs::exists(spinlogs)) << "nothing is made for a sample that cannot be taken";
 
     // perf that refuses at run time: the same, with its own words.
@@ -182,10 +181,8 @@ TEST_F(TheLinuxDiagnosticRequestService, SamplesOneAtATimeAndRecordsTheRestWitho
                                     second.string() + " -- sleep 10.000\n");
     EXPECT_FALSE(samples[1].contains("report"));
 
-    const auto counters = service->counters();
-    EXPECT_EQ(counters.requests, 201u);
-    EXPECT_EQ(counters.sampled, 2u);
-    EXPECT_EQ(counters.notSampledBusy, 199u);
+    const auto c = service->counters();
+    EXPECT_EQ(std::tie(c.requests, c.sampled, c.notSampledBusy), std::tuple(201u, 2u, 199u));
 }
 
 TEST_F(TheLinuxDiagnosticRequestService, ConfinesPerfAndBoundsItsTimeAndOutput) {
