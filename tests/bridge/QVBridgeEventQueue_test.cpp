@@ -17,8 +17,10 @@ QVBridgeEvent event(Kind kind, std::int64_t id) {
     return e;
 }
 
-std::vector<std::pair<Kind, std::int64_t>> drain(QVBridgeEventQueue& q) {
-    std::vector<std::pair<Kind, std::int64_t>> out;
+using Events = std::vector<std::pair<Kind, std::int64_t>>;
+
+Events drain(QVBridgeEventQueue& q) {
+    Events out;
     QVBridgeEvent e;
     while (q.pop(e, 0ms)) {
         out.emplace_back(e.kind, e.reporterID);
@@ -54,11 +56,10 @@ TEST(QVBridgeEventQueue, AStreamGoneBeforeTheSenderSawItLeavesNothingBehind) {
     q.push(event(Kind::kMessage, 2));
     q.push(event(Kind::kClose, 1));
     EXPECT_EQ(q.messages(), 1u);
-    EXPECT_EQ(drain(q),
-              (std::vector<std::pair<Kind, std::int64_t>>{{Kind::kOpen, 2}, {Kind::kMessage, 2}}));
+    EXPECT_EQ(drain(q), (Events{{Kind::kOpen, 2}, {Kind::kMessage, 2}}));
     // Once the sender took the open, the close must reach it.
     q.push(event(Kind::kClose, 2));
-    EXPECT_EQ(drain(q), (std::vector<std::pair<Kind, std::int64_t>>{{Kind::kClose, 2}}));
+    EXPECT_EQ(drain(q), (Events{{Kind::kClose, 2}}));
 }
 
 TEST(QVBridgeEventQueue, CloseDrainsThenStopsWaiting) {

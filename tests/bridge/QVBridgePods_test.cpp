@@ -40,9 +40,8 @@ TEST(QVBridgePods, FormatOfRawAudioOnly) {
     const auto format =
         QVBridgeParseFormat(spa_format_audio_raw_build(&b, SPA_PARAM_Format, &info));
     ASSERT_TRUE(format);
-    EXPECT_EQ(format->sampleFormat, "S16LE");
-    EXPECT_EQ(format->rate, 44100u);
-    EXPECT_EQ(format->channels, 1u);
+    EXPECT_EQ(std::tie(format->sampleFormat, format->rate, format->channels),
+              std::tuple("S16LE", 44100u, 1u));
     EXPECT_FALSE(QVBridgeParseFormat(nullptr));
 }
 
@@ -81,10 +80,9 @@ TEST(QVBridgePods, ProfileCyclesWithTheirDriverAndFollowers) {
 
     const auto cycles = QVBridgeParseProfile(pod);
     ASSERT_EQ(cycles.size(), 1u);
-    EXPECT_EQ(cycles[0].driverID, 30u);
-    EXPECT_EQ(cycles[0].driverName, "speakers");
-    EXPECT_EQ(cycles[0].xrunCount, 3);
-    EXPECT_EQ(cycles[0].quantum, 1024u);
+    const auto& c = cycles[0];
+    EXPECT_EQ(std::tie(c.driverID, c.driverName, c.xrunCount, c.quantum),
+              std::tuple(30u, "speakers", 3, 1024u));
     ASSERT_EQ(cycles[0].followers.size(), 2u);
     EXPECT_EQ(cycles[0].followers[0].status, kQVBridgeNodeFinished);
     EXPECT_EQ(cycles[0].followers[1].id, 42u);

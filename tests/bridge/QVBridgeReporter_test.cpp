@@ -26,20 +26,11 @@ QVBridgeStreamState playing(bool running = true) {
 std::vector<std::string> shape(const std::vector<QVBridgeEvent>& events) {
     std::vector<std::string> out;
     for (const auto& e : events) {
-        switch (e.kind) {
-            case Kind::kOpen:
-                out.push_back("open " + std::to_string(e.serviceType));
-                break;
-            case Kind::kStart:
-                out.push_back("start");
-                break;
-            case Kind::kClose:
-                out.push_back("close");
-                break;
-            case Kind::kMessage:
-                out.push_back(std::to_string(e.category) + "," + std::to_string(e.type));
-                break;
-        }
+        out.push_back(e.kind == Kind::kOpen    ? "open " + std::to_string(e.serviceType)
+                      : e.kind == Kind::kStart ? "start"
+                      : e.kind == Kind::kClose
+                          ? "close"
+                          : std::to_string(e.category) + "," + std::to_string(e.type));
     }
     return out;
 }

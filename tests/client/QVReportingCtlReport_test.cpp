@@ -1,4 +1,3 @@
-#include <algorithm>
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
@@ -67,35 +66,24 @@ class TheReportData : public ::testing::Test {
         convo(
             100,
             R"("op":"session","session":1,"sessionInfo":{"SessionID":5,"ClientBundleID":"music"},"userInfo":{"ServiceName":"longformaudio_session"})");
-        convo(101,
-              R"("op":"message","session":1,"sessionID":5,"category":4,"type":1,"payload":{})");
+        message(101, 1, 5, 4, 1);
         convo(
             102,
             R"("op":"session","session":2,"sessionInfo":{"SessionID":7,"ClientBundleID":"rec"},"userInfo":{"ServiceName":"telephony_session"})");
-        convo(
-            103,
-            R"("op":"message","session":1,"sessionID":5,"category":7,"type":6,"payload":{"issue_type":"overload"})");
-        convo(110,
-              R"("op":"message","session":1,"sessionID":5,"category":14,"type":11,"payload":{})");
-        convo(110,
-              R"("op":"message","session":1,"sessionID":5,"category":14,"type":11,"payload":{})");
-        convo(110,
-              R"("op":"message","session":1,"sessionID":5,"category":1,"type":11,"payload":{})");
-        convo(
-            110,
-            R"("op":"message","session":1,"sessionID":5,"category":65535,"type":65535,"payload":{})");
+        message(103, 1, 5, 7, 6, R"({"issue_type":"overload"})");
+        message(110, 1, 5, 14, 11);
+        message(110, 1, 5, 14, 11);
+        message(110, 1, 5, 1, 11);
+        message(110, 1, 5, 65535, 65535);
         convo(110, R"("op":"flush","session":1,"sessionID":5)");
-        convo(120,
-              R"("op":"message","session":2,"sessionID":7,"category":3,"type":11,"payload":{})");
+        message(120, 2, 7, 3, 11);
         convo(121, R"("op":"flush","session":2,"sessionID":7)");
         // Second run: session number 1 again, a haptics session that asked for a capture and was
         // never flushed (the daemon was killed).
         convo(
             200,
             R"("op":"session","session":1,"sessionInfo":{"SessionID":9},"userInfo":{"ServiceName":"haptics_session"})");
-        convo(
-            201,
-            R"("op":"message","session":1,"sessionID":9,"category":7,"type":7,"payload":{"issue_type":"silence"})");
+        message(201, 1, 9, 7, 7, R"({"issue_type":"silence"})");
         // Members of the wrong type are passed over, not thrown at.
         convo(203, R"("op":"message","session":"1","category":"Volume","type":null)");
         convo(204, R"("op":"message","session":1,"category":"Volume","type":null,"payload":[])");
@@ -131,6 +119,14 @@ class TheReportData : public ::testing::Test {
     void convo(double time, const std::string& rest) {
         write("convo.jsonl", ++convoSeq_, time, rest);
     }
+    void message(double time, int session, int sessionID, int category, int type,
+                 const char* payload = "{}") {
+        convo(
+            time,
+            fmt::format(
+                R"("op":"message","session":{},"sessionID":{},"category":{},"type":{},"payload":{})",
+                session, sessionID, category, type, payload));
+    }
     void volume(const std::string& file, std::uint64_t seq, double time, const std::string& app,
                 int index, double volume, double seconds, const std::string& device) {
         write(
@@ -152,10 +148,8 @@ TEST_F(TheReportData, GroupsEachSessionsMessagesAcrossDaemonRunsAndSegments) {
     const ReportData data = gather();
     ASSERT_EQ(data.sessions.size(), 3u);
     const auto& music = data.sessions[0];
-    EXPECT_EQ(music.reporterID, 5);
-    EXPECT_EQ(music.application, "music");
-    EXPECT_EQ(music.service, "longformaudio");
-    EXPECT_TRUE(music.stopped);
+    EXPECT_EQ(std::tie(music.reporterID, music.application, music.service, music.stopped),
+              std::tuple(5, "music", "longformaudio", true));
     EXPECT_DOUBLE_EQ(music.end - music.start, 10);
     EXPECT_EQ(music.messages, 2u);  // the mirror's folded summary is not a message
     EXPECT_EQ(QVReportingCtlCountsText(music.derived), "summary, volume stretch x2");
@@ -188,15 +182,13 @@ TEST_F(TheReportData, GroupsEachSessionsMessagesAcrossDaemonRunsAndSegments) {
                           "202 capture  haptics / Playback / EnergyLog",
                       }));
 
-    const auto& analytics = data.sinks.at("analytics");
-    EXPECT_EQ(analytics.segments, 2u);
-    EXPECT_EQ(analytics.lines, 7u);
-    EXPECT_EQ(analytics.firstSeq, 3u);
-    EXPECT_EQ(analytics.lastSeq, 9u);
-    EXPECT_EQ(analytics.linesMissing, 2u);  // 1 and 2
+    // Segments, lines, seqs from and to, missing (1 and 2), unreadable.
+    const auto& a = data.sinks.at("analytics");
+    EXPECT_EQ(
+        std::tie(a.segments, a.lines, a.firstSeq, a.lastSeq, a.linesMissing, a.linesUnreadable),
+        std::tuple(2u, 7u, 3u, 9u, 2u, 1u));
     EXPECT_EQ(data.sinks.at("convo").lines, 15u);
     EXPECT_EQ(data.sinks.at("convo").linesUnreadable, 0u);
-    EXPECT_EQ(analytics.linesUnreadable, 1u);
     EXPECT_DOUBLE_EQ(data.first, 100);
     EXPECT_DOUBLE_EQ(data.last, 204);  // the unflushed session's last message
 }

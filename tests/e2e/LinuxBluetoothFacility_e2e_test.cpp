@@ -12,14 +12,12 @@
 #include <chrono>
 #include <cstdio>
 #include <fstream>
-#include <functional>
-#include <mutex>
 #include <string>
-#include <thread>
 #include <vector>
 
 #include <sdbus-c++/sdbus-c++.h>
 
+#include "fakes/Notes.h"
 #include "fakes/TempDirectory.h"
 #include "fakes/WaitUntil.h"
 
@@ -101,9 +99,14 @@ class PrivateBus {
             mock_->callMethod("PairDevice").onInterface(kMock).withArguments("hci0", device, 0u);
         }
         if (connected) {
-            mock_->callMethod("ConnectDevice").onInterface(kMock).withArguments("hci0", device);
+            setConnected(device, true);
         }
         return path;
+    }
+    void setConnected(const std::string& device, bool connected) {
+        mock_->callMethod(connected ? "ConnectDevice" : "DisconnectDevice")
+            .onInterface(kMock)
+            .withArguments("hci0", device);
     }
 
     // A Device1 object made by hand, with whatever properties a test wants BlueZ to claim.
@@ -132,37 +135,10 @@ class PrivateBus {
     std::unique_ptr<sdbus::IProxy> mock_;
 };
 
-class Lines {
-  public:
-    LinuxBluetoothFacility::LogCallback callback() {
-        return [this](LinuxBluetoothFacility::LogLevel, const std::string& line) {
-            std::lock_guard lock(mutex_);
-            lines_.push_back(line);
-        };
-    }
-    std::size_t count(const std::string& needle) const {
-        std::lock_guard lock(mutex_);
-        std::size_t n = 0;
-        for (const auto& l : lines_) {
-            n += l.find(needle) != std::string::npos ? 1 : 0;
-        }
-        return n;
-    }
-
-    // Every line, for a failure message.
-    std::string all() const {
-        std::lock_guard lock(mutex_);
-        std::string out;
-        for (const auto& l : lines_) {
-            out += l + "\n";
-        }
-        return out;
-    }
-
-  private:
-    mutable std::mutex mutex_;
-    std::vector<std::string> lines_;
-};
+// The facility's log lines, whatever their level.
+LinuxBluetoothFacility::LogCallback noting(test::Notes& notes) {
+    return [&notes](LinuxBluetoothFacility::LogLevel, const std::string& line) { notes.add(line); };
+}
 
 void writeAccessory(const test::TempDirectory& dir, const std::string& address,
                     const std::string& text) {
@@ -198,11 +174,11 @@ TEST(TheLinuxBluetoothFacility, FollowsBlueZAndTheAccessoryDirectory) {
     test::TempDirectory dir("qvaccessories");
     writeAccessory(dir, "00:00:00:00:00:01", kGoodFile);
     writeAccessory(dir, "00:00:00:00:00:02", kGoodFile);
-    Lines log;
-    LinuxBluetoothFacility facility(bus.address, dir.path().string(), log.callback());
+    test::Notes log;
+    LinuxBluetoothFacility facility(bus.address, dir.path().string(), noting(log));
 
     // No BlueZ yet: unavailable, and said so.
-    ASSERT_TRUE(test::waitUntil([&] { return log.count("org.bluez has no owner") == 1; }));
+    ASSERT_TRUE(test::waitUntil([&] { return log.containing("org.bluez has no owner") == 1; }));
     EXPECT_FALSE(facility.available());
     EXPECT_TRUE(facility.pairedDevices().empty());
 
@@ -227,25 +203,20 @@ TEST(TheLinuxBluetoothFacility, FollowsBlueZAndTheAccessoryDirectory) {
     EXPECT_FALSE(devices[2].accessoryInformation.has_value());
 
     // Connection changes arrive as signals.
-    bus.mock()
-        .callMethod("DisconnectDevice")
-        .onInterface(kMock)
-        .withArguments("hci0", "00:00:00:00:00:01");
+    bus.setConnected("00:00:00:00:00:01", false);
     ASSERT_TRUE(test::waitUntil([&] { return !facility.isConnected(first); }));
-    bus.mock()
-        .callMethod("ConnectDevice")
-        .onInterface(kMock)
-        .withArguments("hci0", "00:00:00:00:00:01");
+    bus.setConnected("00:00:00:00:00:01", true);
     ASSERT_TRUE(test::waitUntil([&] { return facility.isConnected(first); }));
 
     // The directory is followed: a file that appears, one that goes bad, one that goes away.
     writeAccessory(dir, "00:00:00:00:00:04", kGoodFile);
     ASSERT_TRUE(test::waitUntil([&] { return hasInformation(facility, "00:00:00:00:00:04"); }))
-        << log.all();
+        << testing::PrintToString(log.lines());
     writeAccessory(dir, "00:00:00:00:00:02", "{\"TELPVersionInfo\": 5, \"CaseInfo\": {}}");
     ASSERT_TRUE(test::waitUntil([&] { return !hasInformation(facility, "00:00:00:00:00:02"); }));
-    EXPECT_EQ(log.count("00:00:00:00:00:02.json refused: its \"TELPVersionInfo\" is not a list"),
-              1u);
+    EXPECT_EQ(
+        log.containing("00:00:00:00:00:02.json refused: its \"TELPVersionInfo\" is not a list"),
+        1u);
     std::filesystem::remove(dir / "00:00:00:00:00:04.json");
     ASSERT_TRUE(test::waitUntil([&] { return !hasInformation(facility, "00:00:00:00:00:04"); }));
 
@@ -277,9 +248,9 @@ TEST(TheLinuxBluetoothFacility, NeverLetsWhatBlueZClaimsNameAFileOutsideItsDirec
     // Files a hostile address could aim at, next to and above the directory.
     std::ofstream(root / "passwd.json") << kGoodFile;
     std::ofstream(dir / "AA:BB:CC:DD:EE:FF.json") << kGoodFile;
-    Lines log;
+    test::Notes log;
     bus.startBlueZ();
-    LinuxBluetoothFacility facility(bus.address, dir.string(), log.callback());
+    LinuxBluetoothFacility facility(bus.address, dir.string(), noting(log));
     ASSERT_TRUE(test::waitUntil([&] { return facility.available(); }));
     bus.mock().callMethod("AddAdapter").onInterface(kMock).withArguments("hci0", "bench");
 
@@ -293,7 +264,7 @@ TEST(TheLinuxBluetoothFacility, NeverLetsWhatBlueZClaimsNameAFileOutsideItsDirec
     raw("/org/bluez/hci0/dev_d", sdbus::Variant(std::uint32_t{7}), sdbus::Variant(true));
     raw("/org/bluez/hci0/dev_e", sdbus::Variant(std::string("AA:BB:CC:DD:EE:FF")),
         sdbus::Variant(std::string("yes")));
-    ASSERT_TRUE(test::waitUntil([&] { return log.count("is not a boolean") == 1; }));
+    ASSERT_TRUE(test::waitUntil([&] { return log.containing("is not a boolean") == 1; }));
     ASSERT_TRUE(test::waitUntil([&] { return facility.pairedDevices().size() == 3; }));
 
     // Only the well-formed address (in any case) has accessory information; the others are
@@ -304,9 +275,10 @@ TEST(TheLinuxBluetoothFacility, NeverLetsWhatBlueZClaimsNameAFileOutsideItsDirec
             << d.identifier;
         EXPECT_TRUE(d.address.empty() || d.address == "AA:BB:CC:DD:EE:FF") << d.address;
     }
-    EXPECT_EQ(log.count("has the address \"../passwd\", which is not a Bluetooth address"), 1u);
-    EXPECT_EQ(log.count("which is not a Bluetooth address"), 1u);
-    EXPECT_EQ(log.count("Address of /org/bluez/hci0/dev_d is not a string"), 1u);
+    EXPECT_EQ(log.containing("has the address \"../passwd\", which is not a Bluetooth address"),
+              1u);
+    EXPECT_EQ(log.containing("which is not a Bluetooth address"), 1u);
+    EXPECT_EQ(log.containing("Address of /org/bluez/hci0/dev_d is not a string"), 1u);
 }
 
 }  // namespace

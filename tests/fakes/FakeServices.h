@@ -67,8 +67,6 @@ class FakeNotificationCenter : public NotificationCenter {
     std::optional<Token> registerNotification(std::string_view name, TaskRunner runner,
                                               Handler handler) override {
         std::lock_guard lock(mutex_);
-        if (failRegistrations)
-            return std::nullopt;
         const Token token = nextToken_++;
         registrations_[token] = {std::string(name), std::move(runner), std::move(handler)};
         return token;
@@ -106,7 +104,6 @@ class FakeNotificationCenter : public NotificationCenter {
         }
     }
 
-    bool failRegistrations = false;
     std::vector<Token> cancelled;
 
   private:

@@ -15,15 +15,13 @@
 #include <fstream>
 #include <functional>
 #include <future>
-#include <limits>
-#include <mutex>
 #include <nlohmann/json.hpp>
-#include <sstream>
 #include <string>
 #include <thread>
 #include <vector>
 
 #include "fakes/FakeClock.h"
+#include "fakes/Notes.h"
 #include "fakes/SinkLines.h"
 #include "fakes/TempDirectory.h"
 #include "fakes/WaitUntil.h"
@@ -38,25 +36,11 @@ using nlohmann::ordered_json;
 class AJsonlSink : public ::testing::Test {
   protected:
     SinkCallbacks recording() {
-        return {[this](std::string_view sink) {
-                    std::lock_guard lock(mutex);
-                    lost.emplace_back(sink);
-                },
-                [this](std::string_view) { ++tornRemoved; },
-                [this](const std::string& message) {
-                    std::lock_guard lock(mutex);
-                    problems.push_back(message);
-                },
+        return {[this](std::string_view sink) { lost.add(sink); },
+                [this](std::string_view) { ++tornRemoved; }, problems.callback(),
                 [this](const std::string&) { ++filesRefused; }};
     }
-    std::size_t lostCount() {
-        std::lock_guard lock(mutex);
-        return lost.size();
-    }
-    std::vector<std::string> problemsSoFar() {
-        std::lock_guard lock(mutex);
-        return problems;
-    }
+    std::size_t lostCount() const { return lost.lines().size(); }
     static std::vector<ordered_json> readLines(const fs::path& path) {
         return test::readSinkLines(path);
     }
@@ -64,9 +48,8 @@ class AJsonlSink : public ::testing::Test {
     test::TempDirectory tmp{"qvsink"};
     const fs::path stateDir = tmp.path() / "state";
     test::FakeClock clock;
-    std::mutex mutex;
-    std::vector<std::string> lost;      // guarded by mutex
-    std::vector<std::string> problems;  // guarded by mutex
+    test::Notes lost;
+    test::Notes problems;
     std::atomic<int> tornRemoved{0};
     std::atomic<int> filesRefused{0};
 };
@@ -95,8 +78,8 @@ TEST_F(AJsonlSink, WritesOneObjectPerLineWithTheTimeAndSeqFirst) {
         EXPECT_EQ(line, ordered_json::parse(i == 0 ? R"({"zeta":1,"nested":{"b":1,"a":2}})"
                                                    : R"({"zeta":2,"text":"bad \uFFFD byte"})"));
     }
-    EXPECT_TRUE(lost.empty());
-    EXPECT_TRUE(problems.empty());
+    EXPECT_EQ(lostCount(), 0u);
+    EXPECT_TRUE(problems.lines().empty());
 }
 
 TEST_F(AJsonlSink, DropsAndCountsLinesWhenItsBufferIsFull) {
@@ -134,10 +117,7 @@ TEST_F(AJsonlSink, DropsAndCountsLinesWhenItsBufferIsFull) {
         received.push_back(line["n"].get<int>());
     }
     EXPECT_EQ(received, (std::vector<int>{1, 2, 6}));
-    const auto reported = problemsSoFar();
-    EXPECT_TRUE(std::any_of(reported.begin(), reported.end(), [](const std::string& p) {
-        return p.find("full") != std::string::npos;
-    }));
+    EXPECT_GE(problems.containing("full"), 1u);
 }
 
 TEST_F(AJsonlSink, ReportsACauseOnceCountsLostLinesAndRecovers) {
@@ -149,8 +129,8 @@ TEST_F(AJsonlSink, ReportsACauseOnceCountsLostLinesAndRecovers) {
     }
     sink.flush();
     EXPECT_EQ(lostCount(), 3u);
-    ASSERT_EQ(problemsSoFar().size(), 1u) << "once, not once per line";
-    EXPECT_NE(problemsSoFar()[0].find("cannot create"), std::string::npos);
+    ASSERT_EQ(problems.lines().size(), 1u) << "once, not once per line";
+    EXPECT_NE(problems.lines()[0].find("cannot create"), std::string::npos);
 
     fs::remove(tmp / "plain");
     sink.append({{"i", 3}});
@@ -159,8 +139,8 @@ TEST_F(AJsonlSink, ReportsACauseOnceCountsLostLinesAndRecovers) {
     const auto lines = readLines(tmp / "plain/sinks/analytics.jsonl");
     ASSERT_EQ(lines.size(), 1u);
     EXPECT_EQ(lines[0]["i"], 3);
-    ASSERT_EQ(problemsSoFar().size(), 2u);
-    EXPECT_NE(problemsSoFar()[1].find("again"), std::string::npos);
+    ASSERT_EQ(problems.lines().size(), 2u);
+    EXPECT_NE(problems.lines()[1].find("again"), std::string::npos);
 }
 
 TEST_F(AJsonlSink, LosesOnlyWhatAFullDiskRefusesAndKeepsLaterLinesWhole) {
@@ -412,7 +392,7 @@ TEST_F(AJsonlSink, RefusesWhatIsNotARegularFileInItsPlaceWithoutBlocking) {
         }
         EXPECT_EQ(lostCount(), 3u);
         EXPECT_EQ(filesRefused, 1) << "said and counted once";
-        const auto reported = problemsSoFar();
+        const auto reported = problems.lines();
         ASSERT_EQ(reported.size(), 1u);
         EXPECT_NE(reported[0].find((sinks / "odd.jsonl").string()), std::string::npos)
             << reported[0];

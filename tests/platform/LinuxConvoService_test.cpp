@@ -3,7 +3,6 @@
 #include <gtest/gtest.h>
 
 #include <condition_variable>
-#include <fstream>
 #include <mutex>
 #include <nlohmann/json.hpp>
 #include <optional>

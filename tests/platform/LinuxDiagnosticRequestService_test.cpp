@@ -9,11 +9,10 @@
 #include <chrono>
 #include <filesystem>
 #include <fstream>
-#include <mutex>
 #include <string>
-#include <thread>
 #include <vector>
 
+#include "fakes/Notes.h"
 #include "fakes/SinkLines.h"
 #include "fakes/TempDirectory.h"
 #include "fakes/WaitUntil.h"
@@ -51,10 +50,7 @@ class TheLinuxDiagnosticRequestService : public ::testing::Test {
         LinuxDiagnosticRequestService::Options o;
         o.spinlogsDirectory = spinlogs;
         o.perf = perf;
-        o.notice = [this](const std::string& m) {
-            std::lock_guard lock(mutex);
-            notices.push_back(m);
-        };
+        o.notice = notices.callback();
         return o;
     }
     std::unique_ptr<LinuxDiagnosticRequestService> make(LinuxDiagnosticRequestService::Options o) {
@@ -90,18 +86,13 @@ class TheLinuxDiagnosticRequestService : public ::testing::Test {
     std::vector<nlohmann::ordered_json> lines(const std::string& op) const {
         return test::readSinkLines(state / "sinks/diagnostics.jsonl", op);
     }
-    std::vector<std::string> noticesSoFar() {
-        std::lock_guard lock(mutex);
-        return notices;
-    }
 
     test::TempDirectory state{"qv-diagnostics"};
     test::TempDirectory tools{"qv-fakeperf"};
     fs::path spinlogs = state / "logs/Audio/Spinlogs";
     LinuxClock clock;
     int scripts = 0;
-    std::mutex mutex;
-    std::vector<std::string> notices;
+    test::Notes notices;
 };
 
 TEST_F(TheLinuxDiagnosticRequestService, RecordsRequestsAndSaysOnceThatPerfIsMissingOrRefused) {
@@ -125,11 +116,10 @@ TEST_F(TheLinuxDiagnosticRequestService, RecordsRequestsAndSaysOnceThatPerfIsMis
     EXPECT_EQ(requests[1]["sampled"], false);
     EXPECT_EQ(requests[1]["reason"], samples[0]["error"]);
     EXPECT_EQ(requests[2]["reason"], "no stack sample was asked for");
-    EXPECT_EQ(noticesSoFar().size(), 1u);
-    const auto counters = service->counters();
-    EXPECT_EQ(counters.sampled, 0u);
-    EXPECT_EQ(counters.notSampledUnavailable, 2u);
-    EXPECT_EQ(counters.notSampledNotAsked, 1u);
+    EXPECT_EQ(notices.lines().size(), 1u);
+    const auto c = service->counters();
+    EXPECT_EQ(std::tie(c.sampled, c.notSampledUnavailable, c.notSampledNotAsked),
+              std::tuple(0u, 2u, 1u));
     EXPECT_FALSE(fs::exists(spinlogs)) << "nothing is made for a sample that cannot be taken";
 
     // perf that refuses at run time: the same, with its own words.
@@ -147,7 +137,7 @@ TEST_F(TheLinuxDiagnosticRequestService, RecordsRequestsAndSaysOnceThatPerfIsMis
     EXPECT_NE(error.find("perf_event_paranoid"), std::string::npos) << error;
     requests = lines("request");
     EXPECT_EQ(requests.back()["reason"], "perf refused: " + error);
-    EXPECT_EQ(noticesSoFar().size(), 2u);
+    EXPECT_EQ(notices.lines().size(), 2u);
 }
 
 TEST_F(TheLinuxDiagnosticRequestService, SamplesOneAtATimeAndRecordsTheRestWithoutQueueing) {
@@ -191,10 +181,8 @@ TEST_F(TheLinuxDiagnosticRequestService, SamplesOneAtATimeAndRecordsTheRestWitho
                                     second.string() + " -- sleep 10.000\n");
     EXPECT_FALSE(samples[1].contains("report"));
 
-    const auto counters = service->counters();
-    EXPECT_EQ(counters.requests, 201u);
-    EXPECT_EQ(counters.sampled, 2u);
-    EXPECT_EQ(counters.notSampledBusy, 199u);
+    const auto c = service->counters();
+    EXPECT_EQ(std::tie(c.requests, c.sampled, c.notSampledBusy), std::tuple(201u, 2u, 199u));
 }
 
 TEST_F(TheLinuxDiagnosticRequestService, ConfinesPerfAndBoundsItsTimeAndOutput) {

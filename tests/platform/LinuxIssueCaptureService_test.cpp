@@ -17,6 +17,7 @@
 
 #include "fakes/FakeClock.h"
 #include "fakes/FakeServices.h"
+#include "fakes/Notes.h"
 #include "fakes/SinkLines.h"
 #include "fakes/TempDirectory.h"
 #include "platform/linux/capture/IssueCaptureCollector.h"
@@ -38,14 +39,8 @@ class ALinuxIssueCaptureService : public ::testing::Test {
                                         SinkCallbacks{}),
             LinuxIssueCaptureService::Options{capturesDirectory.value_or(captures().string()),
                                               (state / "no-journal-here").string(), ::getpid()},
-            LinuxIssueCaptureService::Callbacks{[this](std::string_view reason) {
-                                                    std::lock_guard lock(mutex);
-                                                    refused.emplace_back(reason);
-                                                },
-                                                [this](const std::string& message) {
-                                                    std::lock_guard lock(mutex);
-                                                    problems.push_back(message);
-                                                }});
+            LinuxIssueCaptureService::Callbacks{
+                [this](std::string_view reason) { refused.add(reason); }, problems.callback()});
         reporter = service->createReporter();
     }
 
@@ -99,9 +94,8 @@ class ALinuxIssueCaptureService : public ::testing::Test {
     test::TempDirectory state{"qvicx"};
     test::FakeClock clock;
     test::FakePreferenceStore preferences;
-    std::mutex mutex;
-    std::vector<std::string> refused;
-    std::vector<std::string> problems;
+    test::Notes refused;
+    test::Notes problems;
     std::unique_ptr<LinuxIssueCaptureService> service;
     std::shared_ptr<IssueCaptureReporter> reporter;
 };
@@ -122,9 +116,7 @@ TEST_F(ALinuxIssueCaptureService, KeepsTheDailyLimitOverARollingDayAcrossRestart
     set(LinuxIssueCaptureService::kEnabledKey, false);
     EXPECT_EQ(reason(snapshot(signature("S11"))), kIssueCaptureErrorNotSupported);
 
-    std::lock_guard lock(mutex);
-    EXPECT_EQ(std::count(refused.begin(), refused.end(), "kIssueCaptureErrorDailyLimitExceeded"),
-              3);
+    EXPECT_EQ(std::ranges::count(refused.lines(), "kIssueCaptureErrorDailyLimitExceeded"), 3);
     EXPECT_EQ(std::distance(fs::directory_iterator(captures()), fs::directory_iterator()), 4);
 }
 
@@ -153,8 +145,7 @@ TEST_F(ALinuxIssueCaptureService, TakesOneCapturePerSignatureInTheInterval) {
         EXPECT_EQ(requests[i]["sessionID"], replies[i]["sessionID"]);
         EXPECT_EQ(replies[i]["reply"]["success"], true);
     }
-    std::lock_guard lock(mutex);
-    EXPECT_EQ(std::count(refused.begin(), refused.end(), "kIssueCaptureErrorRequestThrottled"), 3);
+    EXPECT_EQ(std::ranges::count(refused.lines(), "kIssueCaptureErrorRequestThrottled"), 3);
 }
 
 TEST_F(ALinuxIssueCaptureService, RefusesARequestQueuedBehindTheCaptureOfItsSignature) {
@@ -265,9 +256,9 @@ TEST_F(ALinuxIssueCaptureService, RefusesBadParametersAndSurvivesAnUnwritableDir
     start((state / "blocker" / "Captures").string());
     EXPECT_EQ(reason(snapshot(signature("A"))), std::nullopt);
     EXPECT_EQ(reason(snapshot(signature("B"))), std::nullopt);
-    std::lock_guard lock(mutex);
-    ASSERT_EQ(problems.size(), 2u);
-    EXPECT_NE(problems[0].find("cannot make"), std::string::npos) << problems[0];
+    const auto said = problems.lines();
+    ASSERT_EQ(said.size(), 2u);
+    EXPECT_NE(said[0].find("cannot make"), std::string::npos) << said[0];
 }
 
 TEST_F(ALinuxIssueCaptureService, BoundsTheRequestsWaitingForItsThreadAndItsPendingSessions) {
@@ -298,8 +289,7 @@ TEST_F(ALinuxIssueCaptureService, BoundsTheRequestsWaitingForItsThreadAndItsPend
     service->flush();
     EXPECT_EQ(answered.load(), static_cast<int>(LinuxIssueCaptureService::kMaxQueuedRequests));
     EXPECT_EQ(service->pendingSessionCount(), LinuxIssueCaptureService::kMaxPendingSessions);
-    std::lock_guard lock(mutex);
-    EXPECT_EQ(std::count(refused.begin(), refused.end(), "kIssueCaptureErrorServiceUnavailable"),
+    EXPECT_EQ(std::ranges::count(refused.lines(), "kIssueCaptureErrorServiceUnavailable"),
               static_cast<long>(LinuxIssueCaptureService::kMaxQueuedRequests -
                                 LinuxIssueCaptureService::kMaxPendingSessions + 1));
 }

@@ -10,7 +10,6 @@
 #include <nlohmann/json.hpp>
 
 #include <algorithm>
-#include <atomic>
 #include <cstdio>
 #include <filesystem>
 #include <fstream>
@@ -21,6 +20,7 @@
 #include <vector>
 
 #include "fakes/FakeClock.h"
+#include "fakes/Notes.h"
 #include "fakes/SinkLines.h"
 #include "fakes/TempDirectory.h"
 #include "fakes/WaitUntil.h"
@@ -123,10 +123,7 @@ class TheLinuxIssueFilerService : public ::testing::Test {
             LinuxIssueFilerService::Options{.sessionBusAddress = std::move(address),
                                             .notifyTimeout = timeout,
                                             .maxPendingPrompts = maxPending,
-                                            .notice = [this](const std::string& m) {
-                                                std::lock_guard lock(mutex);
-                                                notices.push_back(m);
-                                            }});
+                                            .notice = notices.callback()});
     }
     LinuxIssueFilerService::Completion recorder() {
         return [this](const std::optional<std::string>& error) {
@@ -163,7 +160,7 @@ class TheLinuxIssueFilerService : public ::testing::Test {
     test::TempDirectory state{"qv-issuefiler"};
     test::FakeClock clock;
     std::mutex mutex;
-    std::vector<std::string> notices;
+    test::Notes notices;
     struct Completed {
         std::optional<std::string> error;
         std::thread::id thread;
@@ -193,21 +190,20 @@ TEST_F(TheLinuxIssueFilerService, WithoutASessionBusRecordsTheDraftAndSaysWhyNoP
     service->createDraft(sampleDraft(), "", "again", recorder());
     service->flush();
 
-    const auto drafts = sinkLines("draft");
+    auto drafts = sinkLines("draft");
     ASSERT_EQ(drafts.size(), 2u);
-    const Json& d = drafts[0];
-    EXPECT_EQ(d["draft"], 1);
-    EXPECT_EQ(d["processName"], "vidcalld");
-    EXPECT_EQ(d["displayReason"], "a Vidcall spatial positioning error occurred");
-    EXPECT_EQ(d["title"], "Invalid x/y coordinates during a Vidcall call (ITF)");
-    EXPECT_EQ(d["problemDescription"], "Something went wrong.");
+    drafts[0].erase("time");
+    drafts[0].erase("seq");
     EXPECT_EQ(
-        d["component"],
-        Json({{"name", "Vidcall Core - Callwire"}, {"version", "All"}, {"identifier", 1174093}}));
-    EXPECT_EQ(d["reproducibility"], 6);
-    EXPECT_EQ(d["classification"], 7);
-    EXPECT_EQ(d["diagnosticExtensionIdentifiers"],
-              Json::array({"com.korvane.DiagnosticExtensions.audio"}));
+        drafts[0],
+        Json::parse(
+            R"({"op":"draft","draft":1,"processName":"vidcalld",)"
+            R"("displayReason":"a Vidcall spatial positioning error occurred",)"
+            R"j("title":"Invalid x/y coordinates during a Vidcall call (ITF)",)j"
+            R"("problemDescription":"Something went wrong.","component":{"name":)"
+            R"("Vidcall Core - Callwire","version":"All","identifier":1174093},)"
+            R"("reproducibility":6,"classification":7,)"
+            R"("diagnosticExtensionIdentifiers":["com.korvane.DiagnosticExtensions.audio"]})"));
     EXPECT_EQ(drafts[1]["draft"], 2);
 
     const auto prompts = sinkLines("prompt");
@@ -223,7 +219,7 @@ TEST_F(TheLinuxIssueFilerService, WithoutASessionBusRecordsTheDraftAndSaysWhyNoP
         EXPECT_EQ(c.error, std::nullopt) << "a recorded draft is a created draft";
         EXPECT_NE(c.thread, std::this_thread::get_id());
     }
-    EXPECT_EQ(notices.size(), 1u) << "the cause is told once";
+    EXPECT_EQ(notices.lines().size(), 1u) << "the cause is told once";
 }
 
 TEST_F(TheLinuxIssueFilerService, PromptsThroughTheDesktopNotificationServiceWhenOneRuns) {
@@ -295,8 +291,9 @@ TEST_F(TheLinuxIssueFilerService, GivesUpOnANotificationServiceThatHangsWithoutP
     {
         std::lock_guard lock(mutex);
         EXPECT_EQ(completions.size(), 4u) << "every completion runs once";
-        EXPECT_EQ(notices, (std::vector<std::string>{"issue filer: no prompt shown: " + refused,
-                                                     "issue filer: no prompt shown: " + timedOut}))
+        EXPECT_EQ(notices.lines(),
+                  (std::vector<std::string>{"issue filer: no prompt shown: " + refused,
+                                            "issue filer: no prompt shown: " + timedOut}))
             << "the overflow and the hang, each once";
     }
 

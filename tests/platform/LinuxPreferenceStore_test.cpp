@@ -8,11 +8,11 @@
 #include <filesystem>
 #include <fstream>
 #include <limits>
-#include <mutex>
 #include <set>
 #include <thread>
 #include <vector>
 
+#include "fakes/Notes.h"
 #include "fakes/TempDirectory.h"
 
 namespace qv {
@@ -22,12 +22,6 @@ namespace fs = std::filesystem;
 
 class ALinuxPreferenceStore : public ::testing::Test {
   protected:
-    LinuxPreferenceStore::ErrorCallback recordErrors() {
-        return [this](const std::string& message) {
-            std::lock_guard lock(errorsMutex);
-            errors.push_back(message);
-        };
-    }
     static void writeText(const fs::path& path, const std::string& text) {
         std::ofstream(path, std::ios::binary | std::ios::trunc) << text;
     }
@@ -43,12 +37,11 @@ class ALinuxPreferenceStore : public ::testing::Test {
 
     test::TempDirectory tmp{"qvprefs"};
     const fs::path stateDir = tmp.path() / "state";
-    std::mutex errorsMutex;
-    std::vector<std::string> errors;  // guarded by errorsMutex
+    test::Notes errors;
 };
 
 TEST_F(ALinuxPreferenceStore, WritesAtomicallyAndOthersSeeEveryChangeEvenWithinOneTick) {
-    LinuxPreferenceStore writer(stateDir.string(), recordErrors());
+    LinuxPreferenceStore writer(stateDir.string(), errors.callback());
     const Dictionary entries{{"flag", Value(true)},
                              {"count", Value(std::int64_t{-7})},
                              {"big", Value(std::numeric_limits<std::uint64_t>::max())},
@@ -64,7 +57,7 @@ TEST_F(ALinuxPreferenceStore, WritesAtomicallyAndOthersSeeEveryChangeEvenWithinO
     ASSERT_EQ(::stat((stateDir / "defaults/com.korvane.qvsound.json").c_str(), &info), 0);
     EXPECT_EQ(info.st_mode & 0777, 0644u);
 
-    LinuxPreferenceStore reader(stateDir.string(), recordErrors());
+    LinuxPreferenceStore reader(stateDir.string(), errors.callback());
     const Dictionary read = reader.values("com.korvane.qvsound");
     EXPECT_EQ(read, entries);
     EXPECT_TRUE(std::equal(read.begin(), read.end(), entries.begin(), entries.end(),
@@ -84,21 +77,21 @@ TEST_F(ALinuxPreferenceStore, WritesAtomicallyAndOthersSeeEveryChangeEvenWithinO
     EXPECT_EQ(reader.value("suite", "k"), Value(4));
     EXPECT_TRUE(writer.removeValue("suite", "k"));
     EXPECT_TRUE(reader.values("suite").empty());
-    EXPECT_TRUE(errors.empty());
+    EXPECT_TRUE(errors.lines().empty());
 }
 
 TEST_F(ALinuxPreferenceStore, ReadsMalformedFilesAsEmptyReportsEachVersionOnceAndLeavesThemAlone) {
-    LinuxPreferenceStore store(stateDir.string(), recordErrors());
+    LinuxPreferenceStore store(stateDir.string(), errors.callback());
     const fs::path bad = store.pathForSuite("bad");
     writeText(bad, "{\"k\": 1, oops");
     for (int i = 0; i < 3; ++i) {
         EXPECT_FALSE(store.value("bad", "k"));
     }
-    ASSERT_EQ(errors.size(), 1u);
-    EXPECT_NE(errors[0].find(bad.string() + " is not valid JSON"), std::string::npos) << errors[0];
+    ASSERT_EQ(errors.lines().size(), 1u);
+    EXPECT_NE(errors.lines()[0].find(bad.string() + " is not valid JSON"), std::string::npos);
     fs::last_write_time(bad, fs::last_write_time(bad) - std::chrono::seconds(10));
     EXPECT_TRUE(store.values("bad").empty());
-    EXPECT_EQ(errors.size(), 2u) << "an older time is another version";
+    EXPECT_EQ(errors.lines().size(), 2u) << "an older time is another version";
     // A change would throw the rest of the file away: refused.
     EXPECT_FALSE(store.setValue("bad", "k", Value(2)));
     EXPECT_EQ(fs::file_size(bad), 13u);
@@ -109,7 +102,7 @@ TEST_F(ALinuxPreferenceStore, ReadsMalformedFilesAsEmptyReportsEachVersionOnceAn
     const fs::path nul = store.pathForSuite("nul");
     writeText(nul, std::string(R"({"k": 1})") + '\0' + R"({"k": 2})");
     EXPECT_TRUE(store.values("nul").empty());
-    EXPECT_NE(errors.back().find(nul.string() + " is not valid JSON"), std::string::npos);
+    EXPECT_NE(errors.lines().back().find(nul.string() + " is not valid JSON"), std::string::npos);
     EXPECT_FALSE(store.setValue("nul", "k", Value(3)));
     fs::create_directory(store.pathForSuite("directory"));
     EXPECT_FALSE(store.setValue("directory", "k", Value(1)));
@@ -120,7 +113,7 @@ TEST_F(ALinuxPreferenceStore, ReadsMalformedFilesAsEmptyReportsEachVersionOnceAn
 
 TEST_F(ALinuxPreferenceStore, RefusesWhatIsNotASmallRegularFileOnceWithoutBlockingOrWriting) {
     int refused = 0;
-    LinuxPreferenceStore store(stateDir.string(), recordErrors(), [&] { ++refused; });
+    LinuxPreferenceStore store(stateDir.string(), errors.callback(), [&] { ++refused; });
     writeText(tmp / "elsewhere.json", R"({"k": 1})");
     const struct {
         const char* suite;
@@ -146,15 +139,15 @@ TEST_F(ALinuxPreferenceStore, RefusesWhatIsNotASmallRegularFileOnceWithoutBlocki
             EXPECT_FALSE(store.value(c.suite, "k"));
         }
         EXPECT_EQ(refused, before + 1) << "counted once";
-        EXPECT_NE(errors.back().find(path.string() + " " + c.cause), std::string::npos)
-            << errors.back();
+        EXPECT_NE(errors.lines().back().find(path.string() + " " + c.cause), std::string::npos)
+            << errors.lines().back();
         EXPECT_FALSE(store.setValue(c.suite, "k", Value(2)));
     }
     EXPECT_EQ(fs::file_size(tmp / "elsewhere.json"), 8u) << "not written through the link";
 }
 
 TEST_F(ALinuxPreferenceStore, KeepsHostileSuiteNamesInsideItsDirectoryAndApart) {
-    LinuxPreferenceStore store(stateDir.string(), recordErrors());
+    LinuxPreferenceStore store(stateDir.string(), errors.callback());
     // How each name is escaped is SafeFileName's test; here, that the store escapes them all.
     const std::string names[] = {"../../etc/x", "a/b", "a_b", "..", "", std::string(10000, 'n')};
     for (std::size_t i = 0; i < std::size(names); ++i) {
@@ -172,8 +165,8 @@ TEST_F(ALinuxPreferenceStore, KeepsHostileSuiteNamesInsideItsDirectoryAndApart) 
 
 TEST_F(ALinuxPreferenceStore, LosesNoWriteWhenTwoStoresWriteOneSuiteAtOnce) {
     // Two stores stand for two processes: only the lock on the directory keeps them apart.
-    LinuxPreferenceStore first(stateDir.string(), recordErrors());
-    LinuxPreferenceStore second(stateDir.string(), recordErrors());
+    LinuxPreferenceStore first(stateDir.string(), errors.callback());
+    LinuxPreferenceStore second(stateDir.string(), errors.callback());
     std::vector<std::thread> threads;
     for (int t = 0; t < 4; ++t) {
         threads.emplace_back([&, t] {
@@ -189,7 +182,7 @@ TEST_F(ALinuxPreferenceStore, LosesNoWriteWhenTwoStoresWriteOneSuiteAtOnce) {
     }
     EXPECT_EQ(first.values("shared").size(), 80u);
     EXPECT_EQ(first.values("shared"), second.values("shared"));
-    EXPECT_TRUE(errors.empty());
+    EXPECT_TRUE(errors.lines().empty());
 }
 
 }  // namespace

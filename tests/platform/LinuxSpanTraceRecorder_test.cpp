@@ -14,6 +14,7 @@
 
 #include <fmt/format.h>
 
+#include "fakes/Notes.h"
 #include "fakes/TempDirectory.h"
 
 namespace qv {
@@ -163,18 +164,20 @@ TEST(ALinuxSpanTraceRecorder, RecordsMarkersInAnInstanceOfItsOwnAndAlwaysRemoves
     }
 
     test::TempDirectory dir("qvrecorder");
-    std::vector<std::string> problems;
-    std::mutex problemsMutex;
+    test::Notes problems;
     LinuxSpanTraceRecorder::Options options;
     options.traceDirectory = dir / "raw";
     options.tracefsRoot = tracefs.root();
     options.bufferKbPerCpu = 1024;
     options.maxTraceFiles = 1;
+    // The instance of this run's recording: ours but the one an earlier run left.
+    const auto recording = [&] {
+        auto names = ourInstances(tracefs.root());
+        names.erase(std::remove(names.begin(), names.end(), mine.filename()), names.end());
+        return names;
+    };
     {
-        LinuxSpanTraceRecorder recorder(options, [&](const std::string& p) {
-            std::lock_guard lock(problemsMutex);
-            problems.push_back(p);
-        });
+        LinuxSpanTraceRecorder recorder(options, problems.callback());
         auto delegate = std::make_shared<Delegate>();
         auto session = recorder.createSession(*recorder.configurationFromTemplate(3));
         session->setDelegate(delegate);
@@ -186,8 +189,7 @@ TEST(ALinuxSpanTraceRecorder, RecordsMarkersInAnInstanceOfItsOwnAndAlwaysRemoves
         EXPECT_TRUE(fs::exists(mine));
         EXPECT_TRUE(fs::exists(foreign));
 
-        auto names = ourInstances(tracefs.root());
-        names.erase(std::remove(names.begin(), names.end(), mine.filename()), names.end());
+        const auto names = recording();
         ASSERT_EQ(names.size(), 1u);
         const fs::path instance = instances / names[0];
         // The kernel rounds the size up to whole sub-buffers.
@@ -235,17 +237,13 @@ TEST(ALinuxSpanTraceRecorder, RecordsMarkersInAnInstanceOfItsOwnAndAlwaysRemoves
     // A trace larger than the cap is cut after a whole line, and only the newest trace is kept.
     options.maxTraceBytes = 4096;
     {
-        LinuxSpanTraceRecorder recorder(options, [&](const std::string& p) {
-            std::lock_guard lock(problemsMutex);
-            problems.push_back(p);
-        });
+        LinuxSpanTraceRecorder recorder(options, problems.callback());
         auto delegate = std::make_shared<Delegate>();
         auto session = recorder.createSession(*recorder.configurationFromTemplate(2));
         session->setDelegate(delegate);
         session->start();
         recorder.drain();
-        auto names = ourInstances(tracefs.root());
-        names.erase(std::remove(names.begin(), names.end(), mine.filename()), names.end());
+        const auto names = recording();
         ASSERT_EQ(names.size(), 1u);
         for (int i = 0; i < 200; ++i) {
             writeMarker(instances / names[0] / "trace_marker", fmt::format("qv:many:{}", i));
@@ -256,21 +254,9 @@ TEST(ALinuxSpanTraceRecorder, RecordsMarkersInAnInstanceOfItsOwnAndAlwaysRemoves
         const std::string text = readAll(*delegate->location);
         EXPECT_NE(text.find("\n# qvreportd: trace cut at "), std::string::npos);
         EXPECT_LT(text.size(), 4096u + 200u);
-        std::size_t files = 0;
-        for ([[maybe_unused]] const auto& entry : fs::directory_iterator(dir / "raw")) {
-            ++files;
-        }
-        EXPECT_EQ(files, 1u);
+        EXPECT_EQ(std::distance(fs::directory_iterator(dir / "raw"), {}), 1);
     }
-    {
-        std::lock_guard lock(problemsMutex);
-        EXPECT_NE(std::find_if(problems.begin(), problems.end(),
-                               [](const std::string& p) {
-                                   return p.find("was cut at its cap of 4096 bytes") !=
-                                          std::string::npos;
-                               }),
-                  problems.end());
-    }
+    EXPECT_EQ(problems.containing("was cut at its cap of 4096 bytes"), 1u);
     for (const auto& p : {mine, foreign}) {
         ::rmdir(p.c_str());
     }

@@ -29,12 +29,16 @@ void append(const fs::path& path, const std::string& text) {
     std::ofstream(path, std::ios::app | std::ios::binary) << text;
 }
 
-void appendLines(const fs::path& path, std::uint64_t first, std::uint64_t last) {
+std::string sinkLines(std::uint64_t first, std::uint64_t last) {
     std::string text;
     for (auto seq = first; seq <= last; ++seq) {
         text += sinkLine(seq);
     }
-    append(path, text);
+    return text;
+}
+
+void appendLines(const fs::path& path, std::uint64_t first, std::uint64_t last) {
+    append(path, sinkLines(first, last));
 }
 
 // Every line the reader has now, as seqs.
@@ -164,10 +168,7 @@ TEST_F(SinkSegments, AFollowingReaderFinishesARenamedSegmentThenTakesTheNewCurre
         return ::open(current.c_str(), O_WRONLY | O_APPEND | O_CREAT | O_CLOEXEC, 0644);
     };
     const auto write = [](int fd, std::uint64_t first, std::uint64_t last) {
-        std::string text;
-        for (auto seq = first; seq <= last; ++seq) {
-            text += sinkLine(seq);
-        }
+        const std::string text = sinkLines(first, last);
         ASSERT_EQ(::write(fd, text.data(), text.size()), static_cast<ssize_t>(text.size()));
     };
 

@@ -10,12 +10,6 @@
 
 #include <sdbus-c++/Types.h>
 
-// Exported by libsdbus-c++ 1.2 but declared in its public headers only by later versions: a
-// message that belongs to no bus.
-namespace sdbus {
-PlainMessage createPlainMessage();
-}
-
 namespace qv {
 namespace {
 

@@ -12,11 +12,6 @@
 
 #include "service/QVReportingDBusMessageBytes.h"
 
-// Exported by libsdbus-c++ 1.2 but declared in its public headers only by later versions.
-namespace sdbus {
-PlainMessage createPlainMessage();
-}
-
 namespace qv {
 namespace {
 

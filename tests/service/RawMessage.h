@@ -7,6 +7,12 @@
 
 typedef struct sd_bus_message sd_bus_message;
 
+// Exported by libsdbus-c++ 1.2 but declared in its public headers only by later versions: a
+// message that belongs to no bus.
+namespace sdbus {
+PlainMessage createPlainMessage();
+}
+
 namespace qv {
 
 struct RawMessage : sdbus::Message {

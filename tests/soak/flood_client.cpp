@@ -20,7 +20,6 @@
 #include <unistd.h>
 
 #include <algorithm>
-#include <cerrno>
 #include <cstdint>
 #include <cstdio>
 #include <cstdlib>
@@ -123,14 +122,8 @@ int sessions(const Options& o) {
     const double begin = now();
     for (long i = 0; i < o.count; ++i) {
         // Answers are read by the final call's wait and dropped.
-        sd_bus_message* create = idCall(bus, kCreateReportingSession, o.firstID + i);
-        if (const int r = sd_bus_send(bus, create, nullptr); r < 0)
-            die("send", r);
-        sd_bus_message_unref(create);
-        sd_bus_message* start = idCall(bus, kStartReportingSession, o.firstID + i);
-        if (const int r = sd_bus_send(bus, start, nullptr); r < 0)
-            die("send", r);
-        sd_bus_message_unref(start);
+        sendCall(bus, idCall(bus, kCreateReportingSession, o.firstID + i), true);
+        sendCall(bus, idCall(bus, kStartReportingSession, o.firstID + i), true);
     }
     barrier(bus);
     std::printf("sessions %ld seconds %.3f\n", o.count, now() - begin);
@@ -171,10 +164,7 @@ int sends(const Options& o) {
             r = sd_bus_message_append(m, "ax", 1, o.firstID);
         if (r < 0)
             die("append", r);
-        // A reply is expected and never read.
-        if ((r = sd_bus_send(bus, m, nullptr)) < 0)
-            die("send", r);
-        sd_bus_message_unref(m);
+        sendCall(bus, m, true);  // a reply is expected and never read
     }
     flush(bus);
     std::printf("sent %ld\n", o.count);
