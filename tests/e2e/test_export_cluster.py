@@ -69,7 +69,8 @@ class ClusterTestCase(unittest.TestCase):
         started = time.monotonic()
         self.exporter.wait_caught_up(expected, timeout)
         caught_up = time.monotonic() - started
-        lines = StreamComparison(self.cluster.urls, self.state, list(expected)).check(self)
+        lines = StreamComparison(self.cluster.urls, self.state, list(expected),
+                                 settle=30).check(self)
         self.assertEqual(lines, sum(expected.values()))
         wait_until(lambda: all((self.exporter.status() or {}).get("sinks", {}).get(s, {}).get(
             "cursor") == seq for s, seq in expected.items()), timeout=30, what="the status")
