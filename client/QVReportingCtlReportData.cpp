@@ -290,17 +290,26 @@ class Gatherer {
     }
 
     // A capture names no session: it belongs to the session of its signature's service that
-    // was running when it was asked for.
+    // was running when it was asked for. Its line is written when the capture is taken, which
+    // can be after a session that asked at its stop has ended: then it is the latest session of
+    // the service begun before it.
     void finish() {
         for (std::size_t i = 0; i < captures_.size(); ++i) {
             ReportIssue& capture = captures_[i];
+            ReportSession* owner = nullptr;
             for (auto s = allSessions_.rbegin(); s != allSessions_.rend(); ++s) {
-                if (s->service == captureServices_[i] && s->start <= capture.time &&
-                    (!s->stopped || capture.time <= s->end)) {
-                    ++s->captures;
-                    capture.application = s->application;
+                if (s->service != captureServices_[i] || s->start > capture.time) {
+                    continue;
+                }
+                if (!s->stopped || capture.time <= s->end) {
+                    owner = &*s;
                     break;
                 }
+                owner = owner ? owner : &*s;
+            }
+            if (owner) {
+                ++owner->captures;
+                capture.application = owner->application;
             }
             addIssue(capture.kind, capture.time, capture.application, capture.detail);
         }

@@ -78,6 +78,10 @@ class TheReportData : public ::testing::Test {
         convo(110, R"("op":"flush","session":1,"sessionID":5)");
         message(120, 2, 7, 3, 11);
         convo(121, R"("op":"flush","session":2,"sessionID":7)");
+        // A capture the music session asked for at its stop, written after the stop.
+        write(
+            "issuecapture.jsonl", 1, 111,
+            R"("op":"snapshot","signature":{"type":"longformaudio","subtype":"Playback","subtypeContext":"EnergyLog"})");
         // Second run: session number 1 again, a haptics session that asked for a capture and was
         // never flushed (the daemon was killed).
         convo(
@@ -88,7 +92,7 @@ class TheReportData : public ::testing::Test {
         convo(203, R"("op":"message","session":"1","category":"Volume","type":null)");
         convo(204, R"("op":"message","session":1,"category":"Volume","type":null,"payload":[])");
         write(
-            "issuecapture.jsonl", 1, 202,
+            "issuecapture.jsonl", 2, 202,
             R"("op":"snapshot","signature":{"type":"haptics","subtype":"Playback","subtypeContext":"EnergyLog"})");
         write("mtx.jsonl", 1, 201,
               R"("metric":5963779,"record":"EAMaB3NpbGVuY2UiAjEyKhFjb20uZXhhbXBsZS5yYWNlcg==")");
@@ -153,7 +157,7 @@ TEST_F(TheReportData, GroupsEachSessionsMessagesAcrossDaemonRunsAndSegments) {
     EXPECT_DOUBLE_EQ(music.end - music.start, 10);
     EXPECT_EQ(music.messages, 2u);  // the mirror's folded summary is not a message
     EXPECT_EQ(QVReportingCtlCountsText(music.derived), "summary, volume stretch x2");
-    EXPECT_EQ(QVReportingCtlSessionIssuesText(music), "overload");
+    EXPECT_EQ(QVReportingCtlSessionIssuesText(music), "capture, overload");
     EXPECT_EQ(QVReportingCtlCountsText(data.sessions[1].derived), "input stretch");
     const auto& haptics = data.sessions[2];
     EXPECT_EQ(haptics.service, "haptics");
@@ -178,6 +182,7 @@ TEST_F(TheReportData, GroupsEachSessionsMessagesAcrossDaemonRunsAndSegments) {
     }
     EXPECT_EQ(issues, (std::vector<std::string>{
                           "103 overload music IO.Error, 512 frames",
+                          "111 capture music longformaudio / Playback / EnergyLog",
                           "201 MTX record com.example.racer silence on node 12, 3 s",
                           "202 capture  haptics / Playback / EnergyLog",
                       }));
@@ -201,9 +206,9 @@ TEST_F(TheReportData, KeepsWhatLiesFromSinceUpToUntilAndOneApplication) {
     };
     const Case cases[] = {
         {100, 102, "", 1, 0, 0},           // the session at 102 is left out
-        {102, 200.5, "", 2, 2, 1},         // since is kept, until is not
-        {110, std::nullopt, "", 1, 2, 2},  // stretches from 110, issues at 201 and 202
-        {std::nullopt, std::nullopt, "music", 1, 2, 1},
+        {102, 200.5, "", 2, 2, 2},         // since is kept, until is not
+        {110, std::nullopt, "", 1, 2, 3},  // stretches from 110, issues at 111, 201 and 202
+        {std::nullopt, std::nullopt, "music", 1, 2, 2},
         {std::nullopt, std::nullopt, "nobody", 0, 0, 0},
         {300, std::nullopt, "", 0, 0, 0},
     };
@@ -239,7 +244,7 @@ TEST_F(TheReportData, MakesASelfContainedPageWhosePlotsCarryTheirPoints) {
                                                   {"plot-usage-application", 2},
                                                   {"plot-usage-device", 3},
                                                   {"plot-volume", 3},
-                                                  {"plot-issues", 3}}));
+                                                  {"plot-issues", 4}}));
     // Five inline SVGs whose ids do not collide, and nothing fetched from elsewhere.
     std::set<std::string> ids;
     for (const char quote : {'\'', '"'}) {
