@@ -35,7 +35,6 @@ class FakeConvoService : public ConvoService {
             std::optional<std::vector<std::string>> backends;
             {
                 std::lock_guard lock(service_.mutex_);
-                ++configurationsStarted;
                 if (service_.holdCompletions) {
                     service_.pending_.push_back(std::move(completion));
                     return;
@@ -65,7 +64,6 @@ class FakeConvoService : public ConvoService {
         const Dictionary sessionInfo;
         const Dictionary userInfo;
         std::vector<Sent> sent;
-        int configurationsStarted = 0;
         int flushes = 0;
 
       private:

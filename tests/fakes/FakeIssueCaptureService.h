@@ -64,8 +64,6 @@ class FakeIssueCaptureService : public IssueCaptureService {
     };
 
     std::shared_ptr<IssueCaptureReporter> createReporter() override {
-        std::lock_guard lock(mutex_);
-        ++reportersCreated;
         return std::make_shared<Reporter>(*this);
     }
 
@@ -88,7 +86,6 @@ class FakeIssueCaptureService : public IssueCaptureService {
     bool acceptParameters = true;
 
     // What happened (read under lock() while another thread may answer).
-    int reportersCreated = 0;
     std::vector<Request> requests;
     std::vector<std::string> cancels;
 

@@ -142,8 +142,7 @@ TEST_F(AMemoryLogWorker, ExistsInTestSessionsEverywhereAndInAllSessionsOnInterna
     ASSERT_EQ(test->consumingMessageWorkers().size(), 1u);
     EXPECT_TRUE(test->consumingMessageWorkers()[0]->started());
 
-    QVReportingUtilityTEST_resetInternalBuild();
-    fake.device.internalBuild = true;
+    test::setInternalBuild(fake.device, true);
     auto internal = QVReportingSession::initWithID(fake.platform, 3, {99});
     EXPECT_EQ(internal->workerInstanceCount(), 1u);
 }

@@ -144,8 +144,7 @@ TEST_F(AConvoWorker, HoldsMessagesDuringTheWaitAndForwardsThemInOrderOnceBackend
     }
 
     // An internal build keeps the time stamp; a failed send is one error line.
-    QVReportingUtilityTEST_resetInternalBuild();
-    fake.device.internalBuild = true;
+    test::setInternalBuild(fake.device, true);
     fake.convo.holdCompletions = false;
     auto internal = started(service::kGeneric, 77);
     send(*internal, {{"i", 5}});

@@ -17,6 +17,8 @@
 namespace qv {
 namespace {
 
+using test::send;
+
 class CapableDevice : public test::FakeDeviceInformation {
   public:
     bool hasCapability(std::string_view capability) const override {
@@ -91,10 +93,6 @@ class AnICXWorker : public ::testing::Test {
         }
         return out;
     }
-    static void send(QVReportingSession& s, Dictionary payload, AudioEventCategory c,
-                     AudioEventType t) {
-        s.sendMessage(test::message(std::move(payload), c, t));
-    }
     std::size_t requests() {
         auto lock = fake.issueCapture.lock();
         return fake.issueCapture.requests.size();
@@ -110,8 +108,7 @@ TEST_F(AnICXWorker, ExistsOnInternalBuildsOnlyWithItsDetectorsInOrder) {
     device.internalBuild = false;
     EXPECT_EQ(icx(*make(service::kAlarms)), nullptr);
 
-    QVReportingUtilityTEST_resetInternalBuild();
-    device.internalBuild = true;
+    test::setInternalBuild(device, true);
     auto withHaptics = icx(*make(service::kAlarms));
     ASSERT_NE(withHaptics, nullptr);
     EXPECT_EQ(names(*withHaptics),

@@ -64,8 +64,7 @@ TEST_F(AnIssueFilerWorker, ExistsOnInternalBuildsWithTheBackOffSetAndServesSingl
 
     // A customer build never gets one, setting or not.
     fake.preferences.setValue(Worker::kDefaultsSuite, Worker::kBackOffSecondsKey, 3600);
-    QVReportingUtilityTEST_resetInternalBuild();
-    fake.device.internalBuild = false;
+    test::setInternalBuild(fake.device, false);
     EXPECT_FALSE(workerOf(*started(10)));
 }
 

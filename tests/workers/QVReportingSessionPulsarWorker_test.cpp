@@ -77,13 +77,11 @@ TEST_F(APulsarWorker, ExistsOnlyOnInternalBuildsWithSpinlogsEnabled) {
     EXPECT_FALSE(hasWorker(*started(5)));
 
     setting(Worker::kEnableKey, true);
-    QVReportingUtilityTEST_resetInternalBuild();
-    fake.device.internalBuild = false;
+    test::setInternalBuild(fake.device, false);
     EXPECT_FALSE(hasWorker(*started(6)));
 
     // Single-message sessions are not served.
-    QVReportingUtilityTEST_resetInternalBuild();
-    fake.device.internalBuild = true;
+    test::setInternalBuild(fake.device, true);
     auto single = QVReportingSession::initWithID(fake.platform, 8, {1234});
     single->setIsSingleMessageSession(true);
     single->start();

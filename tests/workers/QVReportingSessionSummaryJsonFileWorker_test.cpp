@@ -20,6 +20,8 @@
 namespace qv {
 namespace {
 
+using test::send;
+
 namespace fs = std::filesystem;
 
 class ASummaryJsonFileWorker : public ::testing::Test {
@@ -33,10 +35,6 @@ class ASummaryJsonFileWorker : public ::testing::Test {
         const Dictionary config{{"KXHostApplicationDisplayID", appName}};
         session->updateConfigurationWithContentsOfConfiguration(&config);
         return session;
-    }
-    static void send(QVReportingSession& session, Dictionary payload, AudioEventCategory c,
-                     AudioEventType t) {
-        session.sendMessage(test::message(std::move(payload), c, t));
     }
     std::vector<fs::path> files() const {
         std::vector<fs::path> found;
@@ -94,8 +92,7 @@ TEST_F(ASummaryJsonFileWorker, ExistsOnlyForTestSessionsOrInternalBuildsAndOnlyW
     fake.device.internalBuild = false;
     EXPECT_FALSE(QVReportingSessionSummaryJsonFileWorker::initWithSession(make(service::kGeneric)));
     EXPECT_TRUE(QVReportingSessionSummaryJsonFileWorker::initWithSession(make(service::kTest)));
-    QVReportingUtilityTEST_resetInternalBuild();
-    fake.device.internalBuild = true;
+    test::setInternalBuild(fake.device, true);
     EXPECT_TRUE(QVReportingSessionSummaryJsonFileWorker::initWithSession(make(service::kGeneric)));
 
     // Every stored message redundant: no file is opened.

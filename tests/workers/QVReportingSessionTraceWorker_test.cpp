@@ -164,15 +164,13 @@ TEST_F(ATraceWorker, RecordsOnlyTestSessionsOnInternalBuildsWithAProbeList) {
     telephony->start();
     telephony->stop();
     // A test session on a customer build.
-    QVReportingUtilityTEST_resetInternalBuild();
-    fake.device.internalBuild = false;
+    test::setInternalBuild(fake.device, false);
     auto customer = make(service::kTest, config());
     customer->start();
     customer->stop();
     EXPECT_TRUE(fake.spanTrace.templatesAsked.empty());
 
-    QVReportingUtilityTEST_resetInternalBuild();
-    fake.device.internalBuild = true;
+    test::setInternalBuild(fake.device, true);
     Dictionary missing = config();
     missing.set(QVReportingThreadlinePlistFilePath, (dir / "absent.plist").string());
     auto noList = make(service::kTest, missing);

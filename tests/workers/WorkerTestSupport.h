@@ -6,6 +6,7 @@
 #include <string>
 #include <vector>
 
+#include "fakes/FakeDeviceInformation.h"
 #include "session/QVReportingSession.h"
 #include "session/QVReportingSessionWorker.h"
 #include "session/QVReportingUtility.h"
@@ -32,9 +33,20 @@ class ScopedWorkerClasses {
     ScopedWorkerClasses& operator=(const ScopedWorkerClasses&) = delete;
 };
 
+// Switches the device's build kind and has the next question read it afresh.
+inline void setInternalBuild(FakeDeviceInformation& device, bool internal) {
+    device.internalBuild = internal;
+    QVReportingUtilityTEST_resetInternalBuild();
+}
+
 inline std::shared_ptr<QVReportingSessionMessage> message(Dictionary payload, AudioEventCategory c,
                                                           AudioEventType t) {
     return std::make_shared<QVReportingSessionMessage>(std::move(payload), c, t);
+}
+
+inline void send(QVReportingSession& session, Dictionary payload, AudioEventCategory c,
+                 AudioEventType t) {
+    session.sendMessage(message(std::move(payload), c, t));
 }
 
 // The session's first worker of class W, or null.
