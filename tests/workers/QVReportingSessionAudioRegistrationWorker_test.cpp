@@ -19,18 +19,7 @@ using Worker = QVReportingSessionAudioRegistrationWorker;
 constexpr std::string_view kSuite = "com.korvane.qvsound.qvreporting.audioreg";
 constexpr const char* kTriggerText = "BT Headphones: qwrT ( b71c ) ( 6402 ), Speaker";
 
-Dictionary accessory(const std::string& key) {
-    Array versions;
-    for (int i = 0; i < 15; ++i) {
-        versions.emplace_back("e" + std::to_string(i) + "-" + key);
-    }
-    versions[1] = "M4801";
-    versions[3] = key;
-    versions[13] = 259200;
-    versions[14] = 259200;
-    return Dictionary{{"TELPVersionInfo", Value(std::move(versions))},
-                      {"CaseInfo", Dictionary{{"CaseInfoVersion", "c"}}}};
-}
+using test::accessory;
 
 // Sets TZ for one test and puts the old zone back after it.
 class ScopedTimeZone {
@@ -166,11 +155,8 @@ TEST_F(AnAudioRegistrationWorker, KeepsTheLastGoodRegistrationWhenAGatheringFail
     session->sendMessage(devices(kTriggerText));
     const auto good = stored("ELRegistrationInfo");
 
-    Dictionary broken = accessory("K2");
-    Array versions = *broken.find("TELPVersionInfo")->asArray();
-    versions[13] = "last week";
-    broken.set("TELPVersionInfo", std::move(versions));
-    fake.bluetooth.addDevice("00:00:00:00:00:02", broken, false);
+    fake.bluetooth.addDevice("00:00:00:00:00:02",
+                             test::withElement(accessory("K2"), 13, "last week"), false);
     fake.clock.advance(61);
     session->sendMessage(devices(kTriggerText));
     EXPECT_TRUE(log->contains("Exception in BT gatherData : element 13 of TELPVersionInfo"));

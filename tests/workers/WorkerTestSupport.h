@@ -39,8 +39,9 @@ inline void setInternalBuild(FakeDeviceInformation& device, bool internal) {
     QVReportingUtilityTEST_resetInternalBuild();
 }
 
-inline std::shared_ptr<QVReportingSessionMessage> message(Dictionary payload, AudioEventCategory c,
-                                                          AudioEventType t) {
+inline std::shared_ptr<QVReportingSessionMessage> message(
+    Dictionary payload, AudioEventCategory c = category::kPlayback,
+    AudioEventType t = type::kStart) {
     return std::make_shared<QVReportingSessionMessage>(std::move(payload), c, t);
 }
 
@@ -94,6 +95,31 @@ inline std::shared_ptr<QVReportingSession> sessionWith(const Platform& platform,
     auto session = QVReportingSession::initWithID(platform, 7, {1});
     session->previousValues() = previous;
     return session;
+}
+
+// Accessory information whose elements name their position and device ("e11-K1"); the model,
+// device key and pairing days sit where the report reads them.
+inline Dictionary accessory(const std::string& key, std::size_t count = 15,
+                            const std::string& model = "M4801") {
+    Array versions;
+    for (std::size_t i = 0; i < count; ++i) {
+        versions.emplace_back("e" + std::to_string(i) + "-" + key);
+    }
+    versions[1] = model;
+    versions[3] = key;
+    if (count > 14) {
+        versions[13] = 259200;  // day 3 of the epoch week
+        versions[14] = 604799;  // day 6
+    }
+    return Dictionary{{"TELPVersionInfo", Value(std::move(versions))},
+                      {"CaseInfo", Dictionary{{"CaseInfoVersion", "case-1"}}}};
+}
+
+inline Dictionary withElement(Dictionary info, std::size_t element, Value value) {
+    Array versions = *info.find("TELPVersionInfo")->asArray();
+    versions[element] = std::move(value);
+    info.set("TELPVersionInfo", std::move(versions));
+    return info;
 }
 
 }  // namespace qv::test
