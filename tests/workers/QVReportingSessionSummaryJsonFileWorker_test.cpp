@@ -36,16 +36,7 @@ class ASummaryJsonFileWorker : public ::testing::Test {
         session->updateConfigurationWithContentsOfConfiguration(&config);
         return session;
     }
-    std::vector<fs::path> files() const {
-        std::vector<fs::path> found;
-        const fs::path directory = logs / "Audio/Reporting";
-        if (fs::exists(directory)) {
-            for (const auto& entry : fs::directory_iterator(directory)) {
-                found.push_back(entry.path());
-            }
-        }
-        return found;
-    }
+    std::vector<fs::path> files() const { return test::filesIn(logs / "Audio/Reporting"); }
 
     test::ScopedWorkerClasses<QVReportingSessionSummaryJsonFileWorker> workerClasses;
     test::TempDirectory logs{"qvsummaryfile"};

@@ -88,14 +88,6 @@ class ATraceWorker : public ::testing::Test {
         recorded->stop();
         return started;
     }
-    std::vector<fs::path> files(const fs::path& directory) const {
-        std::vector<fs::path> found;
-        std::error_code ec;
-        for (const auto& entry : fs::directory_iterator(directory, ec)) {
-            found.push_back(entry.path());
-        }
-        return found;
-    }
     std::vector<std::string> written() const {
         std::vector<std::string> lines;
         for (const auto& file : fake.gaugeData.files) {
@@ -148,7 +140,7 @@ TEST_F(ATraceWorker, RecordsATestSessionAndWritesEveryEventInMillisecondsDepthFi
                              "output milliseconds 0.003000", "decode milliseconds 1000.000000"}));
 
     // Moved to its generated name; the client's application name cannot leave the directory.
-    const auto results = files(dir / "logs/Audio/Traces");
+    const auto results = test::filesIn(dir / "logs/Audio/Traces");
     ASSERT_EQ(results.size(), 1u);
     const std::string name = results[0].filename().string();
     EXPECT_EQ(test::timeStampShape(name), "99999999+999999+9999") << name;
@@ -191,7 +183,7 @@ TEST_F(ATraceWorker, RecordsOnlyTestSessionsOnInternalBuildsWithAProbeList) {
     test->start();
     test->stop();
     EXPECT_EQ(fake.spanTrace.templatesAsked, std::vector<int>{3});
-    EXPECT_EQ(files(dir / "logs/Audio/Traces").size(), 1u);
+    EXPECT_EQ(test::filesIn(dir / "logs/Audio/Traces").size(), 1u);
 }
 
 TEST_F(ATraceWorker, StopsAValidRecordingWhenItsStartIsNotReportedInFifteenSeconds) {
@@ -220,7 +212,7 @@ TEST_F(ATraceWorker, LeavesNoResultsFileWhenTheTraceDoesNotCompleteInThreeMinute
               1u);
     EXPECT_TRUE(fake.threadline.locations.empty());
     EXPECT_TRUE(fake.gaugeData.files.empty());
-    EXPECT_TRUE(files(dir / "logs/Audio/Traces").empty());
+    EXPECT_TRUE(test::filesIn(dir / "logs/Audio/Traces").empty());
 }
 
 TEST_F(ATraceWorker, TakesTheFailurePathsOfTheRecorderWithoutWaitingOrWriting) {
@@ -341,7 +333,7 @@ TEST_F(ATraceWorker, KeepsItsResultsInsideTheDiagnosticLogDirectory) {
     hostile.set(QVReportingThreadlineOutputFileName, "../../etc/results.gdj");
     ASSERT_TRUE(recordOnce(hostile));
     EXPECT_TRUE(log->contains("refusing QVReportingThreadlineOutputFileDirectory: "));
-    const auto results = files(fallback);
+    const auto results = test::filesIn(fallback);
     ASSERT_EQ(results.size(), 1u);
     EXPECT_EQ(results[0].filename(), "%2E.%2F..%2Fetc%2Fresults.gdj");
 }

@@ -2,6 +2,7 @@
 #pragma once
 
 #include <cctype>
+#include <filesystem>
 #include <memory>
 #include <string>
 #include <vector>
@@ -77,6 +78,16 @@ inline std::string timeStampShape(const std::string& fileName) {
         c = std::isdigit(static_cast<unsigned char>(c)) ? '9' : c == '-' ? '+' : c;
     }
     return shape;
+}
+
+// The entries of a directory; none when it does not exist.
+inline std::vector<std::filesystem::path> filesIn(const std::filesystem::path& directory) {
+    std::vector<std::filesystem::path> found;
+    std::error_code ec;
+    for (const auto& entry : std::filesystem::directory_iterator(directory, ec)) {
+        found.push_back(entry.path());
+    }
+    return found;
 }
 
 // A client message at time t ("qvreporting_timestamp"; none when t is null).
