@@ -58,9 +58,7 @@ class AnAudioRegistrationWorker : public ::testing::Test {
     }
 
     std::shared_ptr<QVReportingSession> started(ReporterID id = 7) {
-        auto s = QVReportingSession::initWithID(fake.platform, id, {1234});
-        s->start();
-        return s;
+        return test::makeSession(fake.platform, {.id = id, .start = true});
     }
     // Each one differs from the last, so the session never drops it as redundant.
     std::shared_ptr<QVReportingSessionMessage> devices(const char* text) {
@@ -199,10 +197,10 @@ TEST_F(AnAudioRegistrationWorker, PublishesDevicesSeenInTheLastEightDaysAsWeekNu
     const double now = fake.clock.now();  // Wednesday 31 January 2024, week 5
     storeRegistration({now - 691200, now - 691201, now - 3600});
     dueNow();
-    auto session = QVReportingSession::initWithID(fake.platform, 77, {1234});
-    const Dictionary configuration{{"HostApplicationDisplayID", "com.example.app"}};
-    session->updateConfigurationWithContentsOfConfiguration(&configuration);
-    session->start();
+    auto session = test::makeSession(
+        fake.platform, {.id = 77,
+                        .configuration = {{{"HostApplicationDisplayID", "com.example.app"}}},
+                        .start = true});
     session->stop();
 
     ASSERT_EQ(fake.convo.sessions.size(), 1u);
@@ -270,8 +268,7 @@ TEST_F(AnAudioRegistrationWorker, ReschedulesADueStopThatPublishesNothing) {
         platform.preferences.setValue(kSuite, "ELRegistrationInfo",
                                       Dictionary{{"splunk", c.registration}});
         platform.preferences.setValue(kSuite, "AudioRegistrationNextInvocationEpoch", now - 1);
-        auto session = QVReportingSession::initWithID(platform.platform, 7, {1});
-        session->start();
+        auto session = test::makeSession(platform.platform, {.pids = {1}, .start = true});
         session->stop();
         EXPECT_TRUE(log->contains(c.logged));
         if (c.next) {

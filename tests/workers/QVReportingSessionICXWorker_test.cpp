@@ -76,12 +76,12 @@ class AnICXWorker : public ::testing::Test {
     std::shared_ptr<QVReportingSession> make(AudioServiceType serviceType, ReporterID id = 7,
                                              std::vector<std::int64_t> pids = {1234},
                                              bool single = false) {
-        auto session = QVReportingSession::initWithID(platform, id, std::move(pids));
-        session->setServiceType(serviceType);
-        session->setClientProcessName("alarmd");
-        session->setIsSingleMessageSession(single);
-        session->start();
-        return session;
+        return test::makeSession(platform, {.id = id,
+                                            .pids = std::move(pids),
+                                            .serviceType = serviceType,
+                                            .processName = "alarmd",
+                                            .single = single,
+                                            .start = true});
     }
     static std::shared_ptr<QVReportingSessionICXWorker> icx(const QVReportingSession& session) {
         return test::workerOf<QVReportingSessionICXWorker>(session);

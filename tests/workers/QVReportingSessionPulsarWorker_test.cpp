@@ -41,11 +41,10 @@ class APulsarWorker : public ::testing::Test {
         fake.preferences.setValue(Worker::kDefaultsSuite, key, value);
     }
     std::shared_ptr<QVReportingSession> started(ReporterID id = 7) {
-        auto session = QVReportingSession::initWithID(fake.platform, id, {1234});
-        const Dictionary config{{"KXHostApplicationDisplayID", "com.example.daw"}};
-        session->updateConfigurationWithContentsOfConfiguration(&config);
-        session->start();
-        return session;
+        return test::makeSession(
+            fake.platform, {.id = id,
+                            .configuration = {{{"KXHostApplicationDisplayID", "com.example.daw"}}},
+                            .start = true});
     }
     static bool hasWorker(const QVReportingSession& session) {
         return session.workerInstanceCount() == 1;
@@ -82,10 +81,8 @@ TEST_F(APulsarWorker, ExistsOnlyOnInternalBuildsWithSpinlogsEnabled) {
 
     // Single-message sessions are not served.
     test::setInternalBuild(fake.device, true);
-    auto single = QVReportingSession::initWithID(fake.platform, 8, {1234});
-    single->setIsSingleMessageSession(true);
-    single->start();
-    EXPECT_FALSE(hasWorker(*single));
+    EXPECT_FALSE(
+        hasWorker(*test::makeSession(fake.platform, {.id = 8, .single = true, .start = true})));
 }
 
 TEST_F(APulsarWorker, RequestsAQualifyingOverloadAtMostEveryTenSecondsThenNotifies) {

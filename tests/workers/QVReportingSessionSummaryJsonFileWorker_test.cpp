@@ -30,11 +30,10 @@ class ASummaryJsonFileWorker : public ::testing::Test {
 
     std::shared_ptr<QVReportingSession> make(AudioServiceType serviceType,
                                              const std::string& appName = "com.example.rec") {
-        auto session = QVReportingSession::initWithID(fake.platform, 42, {1234});
-        session->setServiceType(serviceType);
-        const Dictionary config{{"KXHostApplicationDisplayID", appName}};
-        session->updateConfigurationWithContentsOfConfiguration(&config);
-        return session;
+        return test::makeSession(fake.platform,
+                                 {.id = 42,
+                                  .serviceType = serviceType,
+                                  .configuration = {{{"KXHostApplicationDisplayID", appName}}}});
     }
     std::vector<fs::path> files() const { return test::filesIn(logs / "Audio/Reporting"); }
 

@@ -64,10 +64,8 @@ class ATraceWorker : public ::testing::Test {
         model.secondsPerTick = 1e-6;
     }
     std::shared_ptr<QVReportingSession> make(AudioServiceType type, Dictionary config) {
-        auto session = QVReportingSession::initWithID(fake.platform, 7, {1234});
-        session->setServiceType(type);
-        session->updateConfigurationWithContentsOfConfiguration(&config);
-        return session;
+        return test::makeSession(fake.platform,
+                                 {.serviceType = type, .configuration = std::move(config)});
     }
     Dictionary config() const {
         return {{"KXHostApplicationDisplayID", "../com.example/player"},

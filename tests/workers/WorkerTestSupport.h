@@ -4,6 +4,7 @@
 #include <cctype>
 #include <filesystem>
 #include <memory>
+#include <optional>
 #include <string>
 #include <vector>
 
@@ -99,6 +100,31 @@ inline std::shared_ptr<QVReportingSessionMessage> at(Value t, Dictionary payload
 }
 inline std::shared_ptr<QVReportingSessionMessage> set(Value t, const char* key, Value v) {
     return at(t, {{key, v}});
+}
+
+// A session set up as a client's calls would: only what is given is set, in this order.
+struct SessionSetup {
+    ReporterID id = 7;
+    std::vector<std::int64_t> pids = {1234};
+    std::optional<AudioServiceType> serviceType = std::nullopt;
+    std::optional<Dictionary> configuration = std::nullopt;
+    const char* processName = nullptr;
+    bool single = false;
+    bool start = false;
+};
+inline std::shared_ptr<QVReportingSession> makeSession(const Platform& platform, SessionSetup s) {
+    auto session = QVReportingSession::initWithID(platform, s.id, std::move(s.pids));
+    if (s.serviceType)
+        session->setServiceType(*s.serviceType);
+    if (s.configuration)
+        session->updateConfigurationWithContentsOfConfiguration(&*s.configuration);
+    if (s.processName)
+        session->setClientProcessName(s.processName);
+    if (s.single)
+        session->setIsSingleMessageSession(true);
+    if (s.start)
+        session->start();
+    return session;
 }
 
 inline std::shared_ptr<QVReportingSession> sessionWith(const Platform& platform,
