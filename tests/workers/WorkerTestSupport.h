@@ -9,6 +9,7 @@
 #include <vector>
 
 #include "fakes/FakeDeviceInformation.h"
+#include "fakes/MemoryLogSink.h"
 #include "session/QVReportingSession.h"
 #include "session/QVReportingSessionWorker.h"
 #include "session/QVReportingUtility.h"
@@ -50,6 +51,19 @@ inline std::shared_ptr<QVReportingSessionMessage> message(
 inline void send(QVReportingSession& session, Dictionary payload, AudioEventCategory c,
                  AudioEventType t) {
     session.sendMessage(message(std::move(payload), c, t));
+}
+
+// What a category logged, each text after its "%25s:%-5d " prefix (file name, colon, line number
+// in five columns, blank); every such line must be an error.
+inline std::vector<std::string> errorTexts(const MemoryLogSink& log, std::string_view category) {
+    std::vector<std::string> texts;
+    for (const auto& line : log.lines()) {
+        if (line.category == category) {
+            EXPECT_EQ(line.level, LogLevel::Error) << line.text;
+            texts.push_back(line.text.substr(line.text.find(".cpp:") + 5 + 6));
+        }
+    }
+    return texts;
 }
 
 // The session's first worker of class W, or null.
