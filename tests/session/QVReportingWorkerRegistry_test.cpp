@@ -103,9 +103,7 @@ class Workers : public ::testing::Test {
     }
     void TearDown() override { QVReportingWorkerRegistry::TEST_reset({}); }
     std::shared_ptr<QVReportingSession> make(bool single = false) {
-        auto s = QVReportingSession::initWithID(fake.platform, 9, {77});
-        s->setIsSingleMessageSession(single);
-        return s;
+        return test::makeSession(fake.platform, {.id = 9, .pids = {77}, .single = single});
     }
 
     test::FakePlatform fake;

@@ -4,7 +4,6 @@
 
 #include <chrono>
 #include <cmath>
-#include <limits>
 #include <memory>
 #include <vector>
 

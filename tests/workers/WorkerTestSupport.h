@@ -1,6 +1,8 @@
 // Helpers shared by the tests of sessions and their workers.
 #pragma once
 
+#include <gtest/gtest.h>
+
 #include <cctype>
 #include <filesystem>
 #include <memory>
