@@ -64,7 +64,6 @@ class FakeIssueCaptureService : public IssueCaptureService {
     };
 
     std::shared_ptr<IssueCaptureReporter> createReporter() override {
-        std::lock_guard lock(mutex_);
         return std::make_shared<Reporter>(*this);
     }
 

@@ -98,10 +98,8 @@ class AMemoryLogWorker : public ::testing::Test {
     void TearDown() override { Worker::TEST_resetRateLimit(); }
 
     std::shared_ptr<QVReportingSession> testSession(ReporterID id = 3) {
-        auto session = QVReportingSession::initWithID(fake.platform, id, {99});
-        session->setServiceType(service::kTest);
-        session->start();
-        return session;
+        return test::makeSession(
+            fake.platform, {.id = id, .pids = {99}, .serviceType = service::kTest, .start = true});
     }
     static std::shared_ptr<QVReportingSessionMessage> request(AudioEventType t = type::kMemoryLog) {
         return std::make_shared<QVReportingSessionMessage>(Dictionary{{"why", "leak"}},
@@ -130,9 +128,8 @@ TEST_F(AMemoryLogWorker, ExistsInTestSessionsEverywhereAndInAllSessionsOnInterna
     // Made with the session only where it applies then; a test session gets it at start, when
     // its service type is known.
     fake.device.internalBuild = false;
-    auto alarms = QVReportingSession::initWithID(fake.platform, 1, {99});
-    alarms->setServiceType(service::kAlarms);
-    alarms->start();
+    auto alarms = test::makeSession(
+        fake.platform, {.id = 1, .pids = {99}, .serviceType = service::kAlarms, .start = true});
     EXPECT_EQ(alarms->workerInstanceCount(), 0u);
 
     auto test = QVReportingSession::initWithID(fake.platform, 2, {99});
@@ -142,8 +139,7 @@ TEST_F(AMemoryLogWorker, ExistsInTestSessionsEverywhereAndInAllSessionsOnInterna
     ASSERT_EQ(test->consumingMessageWorkers().size(), 1u);
     EXPECT_TRUE(test->consumingMessageWorkers()[0]->started());
 
-    QVReportingUtilityTEST_resetInternalBuild();
-    fake.device.internalBuild = true;
+    test::setInternalBuild(fake.device, true);
     auto internal = QVReportingSession::initWithID(fake.platform, 3, {99});
     EXPECT_EQ(internal->workerInstanceCount(), 1u);
 }

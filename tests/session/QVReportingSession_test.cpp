@@ -11,26 +11,21 @@
 #include "fakes/FakePlatform.h"
 #include "fakes/MemoryLogSink.h"
 #include "session/QVReportingStats.h"
-#include "session/QVReportingWorkerRegistry.h"
+#include "workers/WorkerTestSupport.h"
 
 namespace qv {
 namespace {
 
-std::shared_ptr<QVReportingSessionMessage> msg(Dictionary payload,
-                                               AudioEventCategory c = category::kPlayback,
-                                               AudioEventType t = type::kStart) {
-    return std::make_shared<QVReportingSessionMessage>(std::move(payload), c, t);
-}
+using test::message;
 
 class ASession : public ::testing::Test {
   protected:
-    void SetUp() override { QVReportingWorkerRegistry::TEST_reset({}); }
-    void TearDown() override { QVReportingWorkerRegistry::TEST_reset({}); }
     std::shared_ptr<QVReportingSession> make(ReporterID id = 42) {
         return QVReportingSession::initWithID(fake.platform, id, {1234});
     }
     double now() const { return fake.clock.now(); }
 
+    test::ScopedWorkerClasses<> workerClasses;  // none
     test::FakePlatform fake;
 };
 
@@ -46,7 +41,7 @@ TEST_F(ASession, ReplacesStaleOrUnreadableTimestampsAndKeepsRecentAndFutureOnes)
     cases.emplace_back(std::nan(""), true);
     cases.emplace_back(Value(), true);
     for (const auto& [sent, replaced] : cases) {
-        auto m = msg({{"n", sent.description()}});
+        auto m = message({{"n", sent.description()}});
         if (!sent.isNull()) {
             m->message().set("qvreporting_timestamp", sent);
         }
@@ -64,8 +59,8 @@ TEST_F(ASession, ReplacesStaleOrUnreadableTimestampsAndKeepsRecentAndFutureOnes)
 
 TEST_F(ASession, CleansBlankKeysTagsAndNamesTheApplication) {
     auto s = make();
-    auto m = msg({{"a_b", "underscore"}, {"a b", "blank"}}, category::kPrefixDSP | category::kSetup,
-                 type::kStart);
+    auto m = message({{"a_b", "underscore"}, {"a b", "blank"}},
+                     category::kPrefixDSP | category::kSetup, type::kStart);
     s->sendMessage(m);
     const Dictionary& p = m->message();
     EXPECT_EQ(*p.find("a_b"), Value("blank"));  // the blank form wins
@@ -77,7 +72,7 @@ TEST_F(ASession, CleansBlankKeysTagsAndNamesTheApplication) {
     Dictionary config{{"KXHostApplicationDisplayID", "com.example.player"}};
     s->updateConfigurationWithContentsOfConfiguration(&config);
     for (const std::string sent : {"Unknown", "com.example.other"}) {
-        auto named = msg({{"HostApplicationDisplayID", sent}});
+        auto named = message({{"HostApplicationDisplayID", sent}});
         s->sendMessage(named);
         EXPECT_EQ(*named->message().find("HostApplicationDisplayID"),
                   Value(sent == "Unknown" ? "com.example.player" : sent));
@@ -86,11 +81,11 @@ TEST_F(ASession, CleansBlankKeysTagsAndNamesTheApplication) {
 
 TEST_F(ASession, IgnoresUptimesAndTimeForRedundancyStoresNoRepeatsAndEmptiesTheStoreOnStop) {
     auto s = make(7);
-    s->sendMessage(msg({{"v", 1}, {"processuptime_ms", 5}, {"qvreporting_timestamp", now()}}));
-    auto repeat = msg({{"v", 1.0},
-                       {"processuptime_ms", 9},
-                       {"systemuptime_sec", 3},
-                       {"qvreporting_timestamp", now() + 5}});
+    s->sendMessage(message({{"v", 1}, {"processuptime_ms", 5}, {"qvreporting_timestamp", now()}}));
+    auto repeat = message({{"v", 1.0},
+                           {"processuptime_ms", 9},
+                           {"systemuptime_sec", 3},
+                           {"qvreporting_timestamp", now() + 5}});
     s->sendMessage(repeat);
     EXPECT_TRUE(repeat->isRedundant());
     EXPECT_EQ(s->messages().size(), 1u);
@@ -104,12 +99,12 @@ TEST_F(ASession, IgnoresUptimesAndTimeForRedundancyStoresNoRepeatsAndEmptiesTheS
     EXPECT_EQ(*started.find("reporterid"), Value(7));
     EXPECT_EQ(*started.find("running_at_start"), Value("NO"));
 
-    s->sendMessage(msg({{"b", 2}}));
+    s->sendMessage(message({{"b", 2}}));
     s->stop();
     EXPECT_TRUE(s->messages().empty());
     // A restarted session begins empty: a message equal to one before the stop is new again.
     s->start();
-    auto again = msg({{"b", 2}});
+    auto again = message({{"b", 2}});
     s->sendMessage(again);
     EXPECT_FALSE(again->isRedundant());
 }
@@ -126,18 +121,18 @@ TEST_F(ASession, RemembersABoundedNumberOfDistinctKeysAndKeepsUpdatingKnownOnes)
     for (std::size_t i = 0; i < kMax - 10; ++i) {
         many.set(fmt::format("k{}", i), 0);
     }
-    s->sendMessage(msg(many));  // stamping adds four keys: six places are left
+    s->sendMessage(message(many));  // stamping adds four keys: six places are left
     ASSERT_EQ(s->previousValues().size(), kMax - 6);
     Dictionary more{{"k0", 1}};
     for (int i = 0; i < 20; ++i) {
         more.set("new" + std::to_string(i), i);
     }
-    s->sendMessage(msg(more));
+    s->sendMessage(message(more));
     EXPECT_EQ(s->previousValues().size(), kMax);
     EXPECT_EQ(*s->previousValues().find("k0"), Value(1));
     EXPECT_TRUE(s->previousValues().contains("new5"));
     EXPECT_FALSE(s->previousValues().contains("new6"));
-    s->sendMessage(msg({{"k1", 2}, {"later", 1}}));
+    s->sendMessage(message({{"k1", 2}, {"later", 1}}));
     EXPECT_EQ(*s->previousValues().find("k1"), Value(2));
     EXPECT_EQ(stats.dump().find("previous_values_dropped")->longLongValue(), 15);
     EXPECT_EQ(log->count("new keys are no longer remembered"), 1u);
@@ -170,8 +165,8 @@ TEST_F(ASession, FindsTheSameRedundancyAsASearchOfTheStoreUnderRandomTraffic) {
                          {"qvreporting_timestamp", now() - static_cast<double>(rng() % 100)}};
             if (rng() % 4 == 0)
                 p.set("extra", "x");
-            auto m = msg(std::move(p), static_cast<AudioEventCategory>(rng() % 4 + 9),
-                         static_cast<AudioEventType>(rng() % 3 + 5));
+            auto m = message(std::move(p), static_cast<AudioEventCategory>(rng() % 4 + 9),
+                             static_cast<AudioEventType>(rng() % 3 + 5));
             // The reference compares the payload as the session will have cleaned it.
             auto probe = m->copy();
             QVReportingSession::addMissingDates(*probe, fake.clock);

@@ -87,11 +87,7 @@ class TestProducer final : public QVReportingSessionWorkerProducerProtocol,
 // A class whose workers cannot be made: the registry must skip it.
 const QVReportingWorkerClass kNoFactory{"TestWithoutInit", true, false, true, true, false, nullptr};
 
-std::shared_ptr<QVReportingSessionMessage> msg(Dictionary payload,
-                                               AudioEventCategory c = category::kPlayback,
-                                               AudioEventType t = type::kStart) {
-    return std::make_shared<QVReportingSessionMessage>(std::move(payload), c, t);
-}
+using test::message;
 
 class Workers : public ::testing::Test {
   protected:
@@ -107,9 +103,7 @@ class Workers : public ::testing::Test {
     }
     void TearDown() override { QVReportingWorkerRegistry::TEST_reset({}); }
     std::shared_ptr<QVReportingSession> make(bool single = false) {
-        auto s = QVReportingSession::initWithID(fake.platform, 9, {77});
-        s->setIsSingleMessageSession(single);
-        return s;
+        return test::makeSession(fake.platform, {.id = 9, .pids = {77}, .single = single});
     }
 
     test::FakePlatform fake;
@@ -119,7 +113,7 @@ TEST_F(Workers, StartConsumersFirstAndStopProducersFirstSoDerivedMessagesReachCo
     auto s = make();
     ASSERT_EQ(s->messageWorkers().size(), 1u);  // the start-on-init consumer, made at creation
     switches.onProducerStop = [](QVReportingSession& session) {
-        session.sendMessage(msg({{"derived", 1}}, category::kVolume, type::kSummary));
+        session.sendMessage(message({{"derived", 1}}, category::kVolume, type::kSummary));
     };
     s->start();
     EXPECT_EQ(s->workerInstanceCount(), 3u);
@@ -145,9 +139,9 @@ TEST_F(Workers, DeliverRedundantMessagesOnlyToWorkersThatAskAndHonourDestination
     auto s = make();
     s->start();
     journal.clear();
-    s->sendMessage(msg({{"a", 1}}));
-    s->sendMessage(msg({{"a", 1}}));  // redundant
-    auto addressed = msg({{"b", 1}}, category::kOrbit, type::kSummary);
+    s->sendMessage(message({{"a", 1}}));
+    s->sendMessage(message({{"a", 1}}));  // redundant
+    auto addressed = message({{"b", 1}}, category::kOrbit, type::kSummary);
     addressed->setDestinationWorkers({&makeWorkerClass<TestOnInitConsumer>()});
     s->sendMessage(addressed);
     EXPECT_EQ(journal, (Journal{
@@ -168,7 +162,7 @@ TEST_F(Workers, SkipClassesThatRefuseTheSessionOrSingleMessagesAndRetryWorkersTh
     ASSERT_TRUE(failed);
     EXPECT_FALSE(failed->started());
     journal.clear();
-    s->sendMessage(msg({{"a", 1}}));
+    s->sendMessage(message({{"a", 1}}));
     EXPECT_EQ(journal, (Journal{"handle:TestOnInitConsumer:PlaybackStart"}));
     switches.consumerStarts = true;
     s->stop();
@@ -186,16 +180,16 @@ TEST_F(Workers, JudgeRedundancyAfterTheStopSortAgainstTheNewestByTime) {
     const double now = fake.clock.now();
     std::vector<bool> redundancy;
     switches.onProducerStop = [&](QVReportingSession& session) {
-        auto a = msg({{"v", 1}, {"qvreporting_timestamp", now}});
-        auto b = msg({{"v", 2}, {"qvreporting_timestamp", now}});
+        auto a = message({{"v", 1}, {"qvreporting_timestamp", now}});
+        auto b = message({{"v", 2}, {"qvreporting_timestamp", now}});
         session.sendMessage(a);
         session.sendMessage(b);
         redundancy = {a->isRedundant(), b->isRedundant()};
     };
     auto s = make();
     s->start();
-    s->sendMessage(msg({{"v", 1}, {"qvreporting_timestamp", now - 10}}));
-    s->sendMessage(msg({{"v", 2}, {"qvreporting_timestamp", now - 20}}));
+    s->sendMessage(message({{"v", 1}, {"qvreporting_timestamp", now - 10}}));
+    s->sendMessage(message({{"v", 2}, {"qvreporting_timestamp", now - 20}}));
     s->stop();
     EXPECT_EQ(redundancy, (std::vector<bool>{true, false}));
 }

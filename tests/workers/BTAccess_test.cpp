@@ -1,6 +1,5 @@
 #include "workers/backends/BTAccess.h"
 
-#include <fmt/format.h>
 #include <gtest/gtest.h>
 
 #include <string>
@@ -15,32 +14,9 @@ namespace {
 
 constexpr std::string_view kSuite = "com.korvane.qvsound.qvreporting.audioreg";
 
-// Accessory information whose elements name their position and device ("e11-K1"); the model,
-// device key and pairing days sit where the report reads them.
-Dictionary accessory(const std::string& key, std::size_t count = 15,
-                     const std::string& model = "M4801") {
-    Array versions;
-    for (std::size_t i = 0; i < count; ++i) {
-        versions.emplace_back(fmt::format("e{}-{}", i, key));
-    }
-    versions[1] = model;
-    versions[3] = key;
-    if (count > 14) {
-        versions[13] = 259200;  // day 3 of the epoch week
-        versions[14] = 604799;  // day 6
-    }
-    return Dictionary{{"TELPVersionInfo", Value(std::move(versions))},
-                      {"CaseInfo", Dictionary{{"CaseInfoVersion", "case-1"}}}};
-}
-
-Dictionary withElement(Dictionary info, std::size_t element, Value value) {
-    Array versions = *info.find("TELPVersionInfo")->asArray();
-    versions[element] = std::move(value);
-    info.set("TELPVersionInfo", std::move(versions));
-    return info;
-}
-
+using test::accessory;
 using test::keysOf;
+using test::withElement;
 
 class ABTAccess : public ::testing::Test {
   protected:

@@ -19,18 +19,7 @@ using Worker = QVReportingSessionAudioRegistrationWorker;
 constexpr std::string_view kSuite = "com.korvane.qvsound.qvreporting.audioreg";
 constexpr const char* kTriggerText = "BT Headphones: qwrT ( b71c ) ( 6402 ), Speaker";
 
-Dictionary accessory(const std::string& key) {
-    Array versions;
-    for (int i = 0; i < 15; ++i) {
-        versions.emplace_back("e" + std::to_string(i) + "-" + key);
-    }
-    versions[1] = "M4801";
-    versions[3] = key;
-    versions[13] = 259200;
-    versions[14] = 259200;
-    return Dictionary{{"TELPVersionInfo", Value(std::move(versions))},
-                      {"CaseInfo", Dictionary{{"CaseInfoVersion", "c"}}}};
-}
+using test::accessory;
 
 // Sets TZ for one test and puts the old zone back after it.
 class ScopedTimeZone {
@@ -69,9 +58,7 @@ class AnAudioRegistrationWorker : public ::testing::Test {
     }
 
     std::shared_ptr<QVReportingSession> started(ReporterID id = 7) {
-        auto s = QVReportingSession::initWithID(fake.platform, id, {1234});
-        s->start();
-        return s;
+        return test::makeSession(fake.platform, {.id = id, .start = true});
     }
     // Each one differs from the last, so the session never drops it as redundant.
     std::shared_ptr<QVReportingSessionMessage> devices(const char* text) {
@@ -166,11 +153,8 @@ TEST_F(AnAudioRegistrationWorker, KeepsTheLastGoodRegistrationWhenAGatheringFail
     session->sendMessage(devices(kTriggerText));
     const auto good = stored("ELRegistrationInfo");
 
-    Dictionary broken = accessory("K2");
-    Array versions = *broken.find("TELPVersionInfo")->asArray();
-    versions[13] = "last week";
-    broken.set("TELPVersionInfo", std::move(versions));
-    fake.bluetooth.addDevice("00:00:00:00:00:02", broken, false);
+    fake.bluetooth.addDevice("00:00:00:00:00:02",
+                             test::withElement(accessory("K2"), 13, "last week"), false);
     fake.clock.advance(61);
     session->sendMessage(devices(kTriggerText));
     EXPECT_TRUE(log->contains("Exception in BT gatherData : element 13 of TELPVersionInfo"));
@@ -213,10 +197,10 @@ TEST_F(AnAudioRegistrationWorker, PublishesDevicesSeenInTheLastEightDaysAsWeekNu
     const double now = fake.clock.now();  // Wednesday 31 January 2024, week 5
     storeRegistration({now - 691200, now - 691201, now - 3600});
     dueNow();
-    auto session = QVReportingSession::initWithID(fake.platform, 77, {1234});
-    const Dictionary configuration{{"HostApplicationDisplayID", "com.example.app"}};
-    session->updateConfigurationWithContentsOfConfiguration(&configuration);
-    session->start();
+    auto session = test::makeSession(
+        fake.platform, {.id = 77,
+                        .configuration = {{{"HostApplicationDisplayID", "com.example.app"}}},
+                        .start = true});
     session->stop();
 
     ASSERT_EQ(fake.convo.sessions.size(), 1u);
@@ -284,8 +268,7 @@ TEST_F(AnAudioRegistrationWorker, ReschedulesADueStopThatPublishesNothing) {
         platform.preferences.setValue(kSuite, "ELRegistrationInfo",
                                       Dictionary{{"splunk", c.registration}});
         platform.preferences.setValue(kSuite, "AudioRegistrationNextInvocationEpoch", now - 1);
-        auto session = QVReportingSession::initWithID(platform.platform, 7, {1});
-        session->start();
+        auto session = test::makeSession(platform.platform, {.pids = {1}, .start = true});
         session->stop();
         EXPECT_TRUE(log->contains(c.logged));
         if (c.next) {

@@ -75,10 +75,9 @@ TEST_F(AConvoWorker, DescribesTheSessionToTheServiceByServiceTypeConfigurationAn
     const Dictionary configuration{
         {"KXHostApplicationDisplayID", "com.example.app"}, {"ServiceName", "mine"}, {"n", 7}};
     auto configured = started(service::kTelephony, 44, &configuration);
-    auto single = QVReportingSession::initWithID(fake.platform, 1, {1});
-    single->setServiceType(service::kAlerts);
-    single->setIsSingleMessageSession(true);
-    single->start();
+    auto single = test::makeSession(
+        fake.platform,
+        {.id = 1, .pids = {1}, .serviceType = service::kAlerts, .single = true, .start = true});
     run();
     ASSERT_EQ(fake.convo.sessions.size(), 4u);
 
@@ -144,8 +143,7 @@ TEST_F(AConvoWorker, HoldsMessagesDuringTheWaitAndForwardsThemInOrderOnceBackend
     }
 
     // An internal build keeps the time stamp; a failed send is one error line.
-    QVReportingUtilityTEST_resetInternalBuild();
-    fake.device.internalBuild = true;
+    test::setInternalBuild(fake.device, true);
     fake.convo.holdCompletions = false;
     auto internal = started(service::kGeneric, 77);
     send(*internal, {{"i", 5}});

@@ -28,16 +28,6 @@ class AnEnergyLogWorker : public ::testing::Test {
         AudioEventCategory c = category::kGeneric) {
         return test::message(std::move(payload), c, t);
     }
-    static std::vector<std::string> energyLogLines(test::MemoryLogSink& log) {
-        std::vector<std::string> lines;
-        for (const auto& line : log.lines()) {
-            if (line.category == "qvrp") {
-                EXPECT_EQ(line.level, LogLevel::Error);
-                lines.push_back(line.text.substr(line.text.find(".cpp:") + 5 + 6));
-            }
-        }
-        return lines;
-    }
 
     test::ScopedWorkerClasses<QVReportingSessionEnergyLogWorker> workerClasses;
     test::FakePlatform fake;
@@ -76,7 +66,7 @@ TEST_F(AnEnergyLogWorker, RebuildsOneMessageIntoUpToThreeRecordsInAFixedOrder) {
                                      t));
     }
     EXPECT_TRUE(fake.energyLog.events().empty());
-    EXPECT_TRUE(energyLogLines(*log).empty());
+    EXPECT_TRUE(test::errorTexts(*log, "qvrp").empty());
 }
 
 TEST_F(AnEnergyLogWorker, GivesStatusOneOnlyForTheExactStringEngineOn) {
@@ -129,7 +119,7 @@ TEST_F(AnEnergyLogWorker, TreatsAMissingOrUnknownAppNameAndTimestampDifferentlyP
             status.set("ApplicationName", c.clientStatusName);
         }
         EXPECT_EQ(events[1].payload, status) << c.what;
-        EXPECT_EQ(energyLogLines(*log),
+        EXPECT_EQ(test::errorTexts(*log, "qvrp"),
                   (std::vector<std::string>{"failed to get app name for energylog",
                                             "failed to get QVReporting timestamp for energylog"}))
             << c.what;

@@ -17,6 +17,8 @@
 namespace qv {
 namespace {
 
+using test::send;
+
 class CapableDevice : public test::FakeDeviceInformation {
   public:
     bool hasCapability(std::string_view capability) const override {
@@ -74,12 +76,12 @@ class AnICXWorker : public ::testing::Test {
     std::shared_ptr<QVReportingSession> make(AudioServiceType serviceType, ReporterID id = 7,
                                              std::vector<std::int64_t> pids = {1234},
                                              bool single = false) {
-        auto session = QVReportingSession::initWithID(platform, id, std::move(pids));
-        session->setServiceType(serviceType);
-        session->setClientProcessName("alarmd");
-        session->setIsSingleMessageSession(single);
-        session->start();
-        return session;
+        return test::makeSession(platform, {.id = id,
+                                            .pids = std::move(pids),
+                                            .serviceType = serviceType,
+                                            .processName = "alarmd",
+                                            .single = single,
+                                            .start = true});
     }
     static std::shared_ptr<QVReportingSessionICXWorker> icx(const QVReportingSession& session) {
         return test::workerOf<QVReportingSessionICXWorker>(session);
@@ -90,10 +92,6 @@ class AnICXWorker : public ::testing::Test {
             out.emplace_back(i->className());
         }
         return out;
-    }
-    static void send(QVReportingSession& s, Dictionary payload, AudioEventCategory c,
-                     AudioEventType t) {
-        s.sendMessage(test::message(std::move(payload), c, t));
     }
     std::size_t requests() {
         auto lock = fake.issueCapture.lock();
@@ -110,8 +108,7 @@ TEST_F(AnICXWorker, ExistsOnInternalBuildsOnlyWithItsDetectorsInOrder) {
     device.internalBuild = false;
     EXPECT_EQ(icx(*make(service::kAlarms)), nullptr);
 
-    QVReportingUtilityTEST_resetInternalBuild();
-    device.internalBuild = true;
+    test::setInternalBuild(device, true);
     auto withHaptics = icx(*make(service::kAlarms));
     ASSERT_NE(withHaptics, nullptr);
     EXPECT_EQ(names(*withHaptics),

@@ -22,10 +22,8 @@ class AnIssueFilerWorker : public ::testing::Test {
     }
 
     std::shared_ptr<QVReportingSession> started(ReporterID id = 7) {
-        auto session = QVReportingSession::initWithID(fake.platform, id, {1234});
-        session->setClientProcessName("vidcalld");
-        session->start();
-        return session;
+        return test::makeSession(fake.platform,
+                                 {.id = id, .processName = "vidcalld", .start = true});
     }
     static std::shared_ptr<Worker> workerOf(const QVReportingSession& session) {
         return test::workerOf<Worker>(session);
@@ -53,9 +51,7 @@ TEST_F(AnIssueFilerWorker, ExistsOnInternalBuildsWithTheBackOffSetAndServesSingl
 
     // A setting written as text still gives a worker, with its leading number.
     fake.preferences.setValue(Worker::kDefaultsSuite, Worker::kBackOffSecondsKey, "60 seconds");
-    auto single = QVReportingSession::initWithID(fake.platform, 8, {1234});
-    single->setIsSingleMessageSession(true);
-    single->start();
+    auto single = test::makeSession(fake.platform, {.id = 8, .single = true, .start = true});
     ASSERT_TRUE(workerOf(*single));
     EXPECT_EQ(workerOf(*single)->backOffTime(), 60.0);
 
@@ -64,8 +60,7 @@ TEST_F(AnIssueFilerWorker, ExistsOnInternalBuildsWithTheBackOffSetAndServesSingl
 
     // A customer build never gets one, setting or not.
     fake.preferences.setValue(Worker::kDefaultsSuite, Worker::kBackOffSecondsKey, 3600);
-    QVReportingUtilityTEST_resetInternalBuild();
-    fake.device.internalBuild = false;
+    test::setInternalBuild(fake.device, false);
     EXPECT_FALSE(workerOf(*started(10)));
 }
 

@@ -4,7 +4,6 @@
 
 #include <chrono>
 #include <cmath>
-#include <limits>
 #include <memory>
 #include <vector>
 
@@ -41,11 +40,10 @@ class APulsarWorker : public ::testing::Test {
         fake.preferences.setValue(Worker::kDefaultsSuite, key, value);
     }
     std::shared_ptr<QVReportingSession> started(ReporterID id = 7) {
-        auto session = QVReportingSession::initWithID(fake.platform, id, {1234});
-        const Dictionary config{{"KXHostApplicationDisplayID", "com.example.daw"}};
-        session->updateConfigurationWithContentsOfConfiguration(&config);
-        session->start();
-        return session;
+        return test::makeSession(
+            fake.platform, {.id = id,
+                            .configuration = {{{"KXHostApplicationDisplayID", "com.example.daw"}}},
+                            .start = true});
     }
     static bool hasWorker(const QVReportingSession& session) {
         return session.workerInstanceCount() == 1;
@@ -77,17 +75,13 @@ TEST_F(APulsarWorker, ExistsOnlyOnInternalBuildsWithSpinlogsEnabled) {
     EXPECT_FALSE(hasWorker(*started(5)));
 
     setting(Worker::kEnableKey, true);
-    QVReportingUtilityTEST_resetInternalBuild();
-    fake.device.internalBuild = false;
+    test::setInternalBuild(fake.device, false);
     EXPECT_FALSE(hasWorker(*started(6)));
 
     // Single-message sessions are not served.
-    QVReportingUtilityTEST_resetInternalBuild();
-    fake.device.internalBuild = true;
-    auto single = QVReportingSession::initWithID(fake.platform, 8, {1234});
-    single->setIsSingleMessageSession(true);
-    single->start();
-    EXPECT_FALSE(hasWorker(*single));
+    test::setInternalBuild(fake.device, true);
+    EXPECT_FALSE(
+        hasWorker(*test::makeSession(fake.platform, {.id = 8, .single = true, .start = true})));
 }
 
 TEST_F(APulsarWorker, RequestsAQualifyingOverloadAtMostEveryTenSecondsThenNotifies) {

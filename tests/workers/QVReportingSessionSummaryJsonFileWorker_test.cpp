@@ -20,6 +20,8 @@
 namespace qv {
 namespace {
 
+using test::send;
+
 namespace fs = std::filesystem;
 
 class ASummaryJsonFileWorker : public ::testing::Test {
@@ -28,26 +30,12 @@ class ASummaryJsonFileWorker : public ::testing::Test {
 
     std::shared_ptr<QVReportingSession> make(AudioServiceType serviceType,
                                              const std::string& appName = "com.example.rec") {
-        auto session = QVReportingSession::initWithID(fake.platform, 42, {1234});
-        session->setServiceType(serviceType);
-        const Dictionary config{{"KXHostApplicationDisplayID", appName}};
-        session->updateConfigurationWithContentsOfConfiguration(&config);
-        return session;
+        return test::makeSession(fake.platform,
+                                 {.id = 42,
+                                  .serviceType = serviceType,
+                                  .configuration = {{{"KXHostApplicationDisplayID", appName}}}});
     }
-    static void send(QVReportingSession& session, Dictionary payload, AudioEventCategory c,
-                     AudioEventType t) {
-        session.sendMessage(test::message(std::move(payload), c, t));
-    }
-    std::vector<fs::path> files() const {
-        std::vector<fs::path> found;
-        const fs::path directory = logs / "Audio/Reporting";
-        if (fs::exists(directory)) {
-            for (const auto& entry : fs::directory_iterator(directory)) {
-                found.push_back(entry.path());
-            }
-        }
-        return found;
-    }
+    std::vector<fs::path> files() const { return test::filesIn(logs / "Audio/Reporting"); }
 
     test::ScopedWorkerClasses<QVReportingSessionSummaryJsonFileWorker> workerClasses;
     test::TempDirectory logs{"qvsummaryfile"};
@@ -94,8 +82,7 @@ TEST_F(ASummaryJsonFileWorker, ExistsOnlyForTestSessionsOrInternalBuildsAndOnlyW
     fake.device.internalBuild = false;
     EXPECT_FALSE(QVReportingSessionSummaryJsonFileWorker::initWithSession(make(service::kGeneric)));
     EXPECT_TRUE(QVReportingSessionSummaryJsonFileWorker::initWithSession(make(service::kTest)));
-    QVReportingUtilityTEST_resetInternalBuild();
-    fake.device.internalBuild = true;
+    test::setInternalBuild(fake.device, true);
     EXPECT_TRUE(QVReportingSessionSummaryJsonFileWorker::initWithSession(make(service::kGeneric)));
 
     // Every stored message redundant: no file is opened.

@@ -22,9 +22,8 @@ constexpr const char* kSummaryEvent = "com.korvane.qvsound.Session_Generic.Summa
 class ASummaryWorker : public ::testing::Test {
   protected:
     void SetUp() override {
-        session = QVReportingSession::initWithID(fake.platform, 21, {1234});
-        session->setServiceType(service::kLongFormAudio);
-        session->start();
+        session = test::makeSession(
+            fake.platform, {.id = 21, .serviceType = service::kLongFormAudio, .start = true});
     }
 
     void send(Dictionary payload, AudioEventCategory c = category::kGeneric,
@@ -101,8 +100,7 @@ TEST_F(ASummaryWorker, ForwardsWhatTheStoreBudgetsLeaveUnstoredAndSaysHowMany) {
     EXPECT_EQ(log->count("store budget used up: session 21"), 1u) << "one warning a run";
 
     // The daemon-wide budget holds for every session.
-    auto other = QVReportingSession::initWithID(fake.platform, 22, {1});
-    other->start();
+    auto other = test::makeSession(fake.platform, {.id = 22, .pids = {1}, .start = true});
     stats.setStoreBudgets(std::numeric_limits<std::size_t>::max(), stats.storeBytes());
     other->sendMessage(std::make_shared<QVReportingSessionMessage>(
         Dictionary{{"x", 1}}, category::kGeneric, type::kGeneric));

@@ -64,10 +64,8 @@ class ATraceWorker : public ::testing::Test {
         model.secondsPerTick = 1e-6;
     }
     std::shared_ptr<QVReportingSession> make(AudioServiceType type, Dictionary config) {
-        auto session = QVReportingSession::initWithID(fake.platform, 7, {1234});
-        session->setServiceType(type);
-        session->updateConfigurationWithContentsOfConfiguration(&config);
-        return session;
+        return test::makeSession(fake.platform,
+                                 {.serviceType = type, .configuration = std::move(config)});
     }
     Dictionary config() const {
         return {{"KXHostApplicationDisplayID", "../com.example/player"},
@@ -87,14 +85,6 @@ class ATraceWorker : public ::testing::Test {
         const bool started = recorded->start();
         recorded->stop();
         return started;
-    }
-    std::vector<fs::path> files(const fs::path& directory) const {
-        std::vector<fs::path> found;
-        std::error_code ec;
-        for (const auto& entry : fs::directory_iterator(directory, ec)) {
-            found.push_back(entry.path());
-        }
-        return found;
     }
     std::vector<std::string> written() const {
         std::vector<std::string> lines;
@@ -148,7 +138,7 @@ TEST_F(ATraceWorker, RecordsATestSessionAndWritesEveryEventInMillisecondsDepthFi
                              "output milliseconds 0.003000", "decode milliseconds 1000.000000"}));
 
     // Moved to its generated name; the client's application name cannot leave the directory.
-    const auto results = files(dir / "logs/Audio/Traces");
+    const auto results = test::filesIn(dir / "logs/Audio/Traces");
     ASSERT_EQ(results.size(), 1u);
     const std::string name = results[0].filename().string();
     EXPECT_EQ(test::timeStampShape(name), "99999999+999999+9999") << name;
@@ -164,15 +154,13 @@ TEST_F(ATraceWorker, RecordsOnlyTestSessionsOnInternalBuildsWithAProbeList) {
     telephony->start();
     telephony->stop();
     // A test session on a customer build.
-    QVReportingUtilityTEST_resetInternalBuild();
-    fake.device.internalBuild = false;
+    test::setInternalBuild(fake.device, false);
     auto customer = make(service::kTest, config());
     customer->start();
     customer->stop();
     EXPECT_TRUE(fake.spanTrace.templatesAsked.empty());
 
-    QVReportingUtilityTEST_resetInternalBuild();
-    fake.device.internalBuild = true;
+    test::setInternalBuild(fake.device, true);
     Dictionary missing = config();
     missing.set(QVReportingThreadlinePlistFilePath, (dir / "absent.plist").string());
     auto noList = make(service::kTest, missing);
@@ -193,7 +181,7 @@ TEST_F(ATraceWorker, RecordsOnlyTestSessionsOnInternalBuildsWithAProbeList) {
     test->start();
     test->stop();
     EXPECT_EQ(fake.spanTrace.templatesAsked, std::vector<int>{3});
-    EXPECT_EQ(files(dir / "logs/Audio/Traces").size(), 1u);
+    EXPECT_EQ(test::filesIn(dir / "logs/Audio/Traces").size(), 1u);
 }
 
 TEST_F(ATraceWorker, StopsAValidRecordingWhenItsStartIsNotReportedInFifteenSeconds) {
@@ -222,7 +210,7 @@ TEST_F(ATraceWorker, LeavesNoResultsFileWhenTheTraceDoesNotCompleteInThreeMinute
               1u);
     EXPECT_TRUE(fake.threadline.locations.empty());
     EXPECT_TRUE(fake.gaugeData.files.empty());
-    EXPECT_TRUE(files(dir / "logs/Audio/Traces").empty());
+    EXPECT_TRUE(test::filesIn(dir / "logs/Audio/Traces").empty());
 }
 
 TEST_F(ATraceWorker, TakesTheFailurePathsOfTheRecorderWithoutWaitingOrWriting) {
@@ -343,7 +331,7 @@ TEST_F(ATraceWorker, KeepsItsResultsInsideTheDiagnosticLogDirectory) {
     hostile.set(QVReportingThreadlineOutputFileName, "../../etc/results.gdj");
     ASSERT_TRUE(recordOnce(hostile));
     EXPECT_TRUE(log->contains("refusing QVReportingThreadlineOutputFileDirectory: "));
-    const auto results = files(fallback);
+    const auto results = test::filesIn(fallback);
     ASSERT_EQ(results.size(), 1u);
     EXPECT_EQ(results[0].filename(), "%2E.%2F..%2Fetc%2Fresults.gdj");
 }
