@@ -94,7 +94,7 @@ class AccessoryTestCase(unittest.TestCase):
     def start_daemon(self, paired, *extra):
         self.daemon = Daemon(self.bus, self.state, "--bluez-bus", self.bus.address,
                              "--accessory-dir", self.accessories, *extra)
-        wait_until(lambda: f"BlueZ: org.bluez is " in self.daemon.log_text()
+        wait_until(lambda: "BlueZ: org.bluez is " in self.daemon.log_text()
                    and f"{paired} paired of" in self.daemon.log_text(),
                    what="the daemon to read BlueZ")
 
