@@ -22,6 +22,8 @@ using qv::exporter::QVReportingExportNatsError;
 // one while the server says more are pending.
 constexpr int kQuietMs = 2000;
 constexpr int kStalledMs = 30000;
+// New reading consumers made for one read that stalls before it ends.
+constexpr int kStallRestarts = 2;
 // JetStream requests (stream information, making the reading consumer): a cluster that has just
 // lost a node answers slowly.
 constexpr int kRequestWaitMs = 20000;
@@ -98,27 +100,35 @@ class Stream {
     // where policy says: for as long as the process runs with follow, else until expected
     // messages came and the server says none is left. The reading consumer may sit on a replica
     // still catching up, which counts none left before it has them all: expected (what the
-    // leader holds; 0 when not known) is waited for.
+    // leader holds; 0 when not known) is waited for. A consumer made while a cluster comes back
+    // can stop short of what the leader holds; reading all of it then goes on with a new
+    // consumer from the next message, a few times before giving up.
     template <typename OnMessage>
     void read(const std::string& filter, jsDeliverPolicy policy, bool follow,
               std::uint64_t expected, OnMessage&& onMessage) const {
         if (!follow && expected == 0 && messages() == 0) {
             return;
         }
-        jsSubOptions sub;
-        jsSubOptions_Init(&sub);
-        sub.Stream = name_.c_str();
-        sub.Config.DeliverPolicy = policy;
-        sub.Ordered = true;  // no acknowledgements; the library starts it again after a gap
-        natsSubscription* subscription = nullptr;
-        jsErrCode code = static_cast<jsErrCode>(0);
-        if (const natsStatus s =
-                js_SubscribeSync(&subscription, js_.get(), filter.c_str(), nullptr, &sub, &code);
-            s != NATS_OK) {
-            throw Failure{"cannot read " + name_ + ": " + QVReportingExportNatsError(s)};
-        }
-        std::unique_ptr<natsSubscription, void (*)(natsSubscription*)> owner(
-            subscription, natsSubscription_Destroy);
+        std::uint64_t nextStreamSeq = 0;  // after the last message delivered; 0: none yet
+        auto subscribe = [&] {
+            jsSubOptions sub;
+            jsSubOptions_Init(&sub);
+            sub.Stream = name_.c_str();
+            sub.Config.DeliverPolicy = nextStreamSeq ? js_DeliverByStartSequence : policy;
+            sub.Config.OptStartSeq = nextStreamSeq;
+            sub.Ordered = true;  // no acknowledgements; the library starts it again after a gap
+            natsSubscription* subscription = nullptr;
+            jsErrCode code = static_cast<jsErrCode>(0);
+            if (const natsStatus s = js_SubscribeSync(&subscription, js_.get(), filter.c_str(),
+                                                      nullptr, &sub, &code);
+                s != NATS_OK) {
+                throw Failure{"cannot read " + name_ + ": " + QVReportingExportNatsError(s)};
+            }
+            return std::unique_ptr<natsSubscription, void (*)(natsSubscription*)>(
+                subscription, natsSubscription_Destroy);
+        };
+        auto subscription = subscribe();
+        int restarts = 0;
         std::uint64_t pending = 0;  // after the last message, as the server counted
         std::uint64_t delivered = 0;
         for (;;) {
@@ -127,10 +137,16 @@ class Stream {
             // catching up (a cluster that lost a node), and is waited out.
             const bool more = pending > 0 || delivered < expected;
             const int wait = more ? kStalledMs : kQuietMs;
-            const natsStatus s = natsSubscription_NextMsg(&msg, subscription, wait);
+            const natsStatus s = natsSubscription_NextMsg(&msg, subscription.get(), wait);
             if (s == NATS_TIMEOUT) {
                 std::cout.flush();
                 if (follow) {
+                    continue;
+                }
+                if (more && policy == js_DeliverAll && restarts < kStallRestarts) {
+                    ++restarts;
+                    subscription.reset();
+                    subscription = subscribe();
                     continue;
                 }
                 if (more) {
@@ -147,6 +163,7 @@ class Stream {
             jsMsgMetaData* meta = nullptr;
             if (natsMsg_GetMetaData(&meta, msg) == NATS_OK) {
                 pending = meta->NumPending;
+                nextStreamSeq = meta->Sequence.Stream + 1;
             }
             jsMsgMetaData_Destroy(meta);
             natsMsg_Destroy(msg);
