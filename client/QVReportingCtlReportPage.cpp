@@ -9,6 +9,7 @@
 #include <fmt/format.h>
 
 #include "QVReportingCtlSupport.h"
+#include "values/Markup.h"
 
 namespace qv::client {
 
@@ -277,37 +278,9 @@ td.n, td.t { white-space: nowrap; }
 tr.warn td { background: #fde8e8; }
 )";
 
-}  // namespace
-
-std::string QVReportingCtlEscapeHTML(const std::string& text) {
-    std::string out;
-    out.reserve(text.size());
-    for (const char c : text) {
-        switch (c) {
-            case '&':
-                out += "&amp;";
-                break;
-            case '<':
-                out += "&lt;";
-                break;
-            case '>':
-                out += "&gt;";
-                break;
-            case '"':
-                out += "&quot;";
-                break;
-            default:
-                out += c;
-        }
-    }
-    return out;
-}
-
-namespace {
-
 // The sessions, the latest last.
 std::string sessionsSection(const ReportData& data) {
-    const auto h = QVReportingCtlEscapeHTML;
+    const auto h = QVReportingEscapeMarkup;
     std::string page = "<section>\n<h2>Sessions</h2>\n";
     const std::size_t from =
         data.sessions.size() > kMaxTableSessions ? data.sessions.size() - kMaxTableSessions : 0;
@@ -335,7 +308,7 @@ std::string sessionsSection(const ReportData& data) {
 
 // The guardrail counters, and what the sink files hold.
 std::string countersSection(const ReportData& data, const ReportCounters& counters) {
-    const auto h = QVReportingCtlEscapeHTML;
+    const auto h = QVReportingEscapeMarkup;
     std::string page = "<section>\n<h2>Guardrail counters</h2>\n";
     if (counters.stats.is_object()) {
         page += fmt::format(
@@ -377,7 +350,7 @@ std::string countersSection(const ReportData& data, const ReportCounters& counte
 std::string QVReportingCtlRenderReportPage(const ReportData& data, const std::string& stateDir,
                                            const ReportCounters& counters, double generated,
                                            const std::string& gnuplotProgram) {
-    const auto h = QVReportingCtlEscapeHTML;
+    const auto h = QVReportingEscapeMarkup;
     std::vector<Plot> plots;
     plots.push_back(sessionsPlot(data));
     std::map<std::string, ReportUsage> byApplication, byDevice;

@@ -33,7 +33,4 @@ std::string QVReportingCtlRenderReportPage(const ReportData& data, const std::st
                                            const ReportCounters& counters, double generated,
                                            const std::string& gnuplotProgram = "gnuplot");
 
-// Text made safe for HTML.
-std::string QVReportingCtlEscapeHTML(const std::string& text);
-
 }  // namespace qv::client

@@ -10,6 +10,7 @@
 #include <systemd/sd-bus.h>
 
 #include "platform/linux/system/ErrnoText.h"
+#include "values/Markup.h"
 #include "values/Utf8.h"
 
 namespace qv {
@@ -38,28 +39,6 @@ std::string validUtf8(std::string_view text) {
         } else {
             out.append(text.substr(i, n));
             i += n;
-        }
-    }
-    return out;
-}
-
-// Notification bodies may be read as simple markup; text from clients is shown as text.
-std::string escapeMarkup(std::string_view text) {
-    std::string out;
-    out.reserve(text.size());
-    for (char c : text) {
-        switch (c) {
-            case '&':
-                out += "&amp;";
-                break;
-            case '<':
-                out += "&lt;";
-                break;
-            case '>':
-                out += "&gt;";
-                break;
-            default:
-                out += c;
         }
     }
     return out;
@@ -251,7 +230,8 @@ void LinuxIssueFilerService::createDraft(const IssueDraft& draft, std::string_vi
     prompt.summary = validUtf8(draft.title);
     const std::string process =
         processName.empty() ? std::string("a process") : std::string(processName);
-    prompt.body = escapeMarkup(validUtf8(
+    // Bodies may be read as simple markup; text from clients is shown as text.
+    prompt.body = QVReportingEscapeMarkup(validUtf8(
         fmt::format("{}: {}. A bug report draft is waiting to be filed.", process, displayReason)));
     prompt.completion = answer;
     prompt.error = error;
