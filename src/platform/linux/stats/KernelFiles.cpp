@@ -165,30 +165,6 @@ bool naturalLess(const std::string& a, const std::string& b) {
     return a.size() - i < b.size() - j;
 }
 
-// Entries of a directory whose names start with prefix followed by digits only, in natural
-// order; empty when the directory cannot be read.
-std::vector<std::string> numberedEntries(const std::string& dir, std::string_view prefix) {
-    std::vector<std::string> names;
-    DIR* d = ::opendir(dir.c_str());
-    if (d == nullptr) {
-        return names;
-    }
-    while (const dirent* e = ::readdir(d)) {
-        const std::string_view name = e->d_name;
-        if (name.size() <= prefix.size() || name.substr(0, prefix.size()) != prefix) {
-            continue;
-        }
-        const std::string_view digits = name.substr(prefix.size());
-        if (std::all_of(digits.begin(), digits.end(),
-                        [](unsigned char c) { return std::isdigit(c); })) {
-            names.emplace_back(name);
-        }
-    }
-    ::closedir(d);
-    std::sort(names.begin(), names.end(), naturalLess);
-    return names;
-}
-
 std::vector<std::string> allEntries(const std::string& dir) {
     std::vector<std::string> names;
     DIR* d = ::opendir(dir.c_str());
@@ -203,6 +179,18 @@ std::vector<std::string> allEntries(const std::string& dir) {
     }
     ::closedir(d);
     std::sort(names.begin(), names.end(), naturalLess);
+    return names;
+}
+
+// Entries of a directory whose names start with prefix followed by digits only, in natural
+// order; empty when the directory cannot be read.
+std::vector<std::string> numberedEntries(const std::string& dir, std::string_view prefix) {
+    std::vector<std::string> names = allEntries(dir);
+    std::erase_if(names, [&](const std::string& name) {
+        return name.size() <= prefix.size() || !name.starts_with(prefix) ||
+               !std::all_of(name.begin() + static_cast<std::ptrdiff_t>(prefix.size()), name.end(),
+                            [](unsigned char c) { return std::isdigit(c); });
+    });
     return names;
 }
 
