@@ -45,12 +45,7 @@ class Reader : public QVReportingPayloadMeter {
         if (!ok(sd_bus_message_read_basic(m_, type, &v))) {
             return false;
         }
-        if constexpr (std::is_same_v<T, std::uint8_t> || std::is_same_v<T, std::uint16_t> ||
-                      std::is_same_v<T, std::uint32_t>) {
-            out = std::int64_t{v};
-        } else {
-            out = v;
-        }
+        out = QVReportingDBusScalarValue(v);
         return charge(cost);
     }
     // sd-bus refuses strings D-Bus allows (noncharacters): noted for a second reading.

@@ -18,8 +18,10 @@
 // one keeps for the next time); a message must only be touched by one thread.
 #pragma once
 
+#include <cstdint>
 #include <optional>
 #include <string>
+#include <type_traits>
 #include <vector>
 
 #include "service/QVReportingError.h"
@@ -59,5 +61,17 @@ bool QVReportingReadRest(sd_bus_message* message, const QVReportingDecodeResult&
 int QVReportingAppendVariant(sd_bus_message* message, const Value& value);
 // Appends an a{sv}.
 int QVReportingAppendDictionary(sd_bus_message* message, const Dictionary& dictionary);
+
+// A fixed-size D-Bus value as a payload value: the unsigned integers narrower than 64 bits (y, q,
+// u) widen to signed 64-bit; the others keep their type.
+template <typename T>
+Value QVReportingDBusScalarValue(T v) {
+    if constexpr (std::is_same_v<T, std::uint8_t> || std::is_same_v<T, std::uint16_t> ||
+                  std::is_same_v<T, std::uint32_t>) {
+        return Value(std::int64_t{v});
+    } else {
+        return Value(v);
+    }
+}
 
 }  // namespace qv

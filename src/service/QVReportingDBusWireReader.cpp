@@ -107,12 +107,7 @@ class Reader : public QVReportingPayloadMeter {
         if (!in_.fixed(v)) {
             return truncated();
         }
-        if constexpr (std::is_same_v<T, std::uint8_t> || std::is_same_v<T, std::uint16_t> ||
-                      std::is_same_v<T, std::uint32_t>) {
-            out = std::int64_t{v};
-        } else {
-            out = v;
-        }
+        out = QVReportingDBusScalarValue(v);
         return charge(cost);
     }
     bool readString(char type, std::string& out);
