@@ -20,4 +20,14 @@ bool writeAll(int fd, std::string_view data) {
     return true;
 }
 
+int syncAndClose(int fd, int error) {
+    if (error == 0 && ::fsync(fd) != 0) {
+        error = errno;
+    }
+    if (::close(fd) != 0 && error == 0) {
+        error = errno;
+    }
+    return error;
+}
+
 }  // namespace qv

@@ -234,13 +234,7 @@ class CaptureFile {
     int close() {
         if (fd_ >= 0) {
             drain();
-            // On disk before a manifest is renamed into place.
-            if (error_ == 0 && ::fsync(fd_) != 0) {
-                error_ = errno;
-            }
-            if (::close(fd_) != 0 && error_ == 0) {
-                error_ = errno;
-            }
+            error_ = syncAndClose(fd_, error_);  // on disk before a manifest is renamed in
             fd_ = -1;
         }
         return error_;

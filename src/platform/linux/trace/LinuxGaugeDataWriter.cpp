@@ -66,13 +66,7 @@ class LinuxGaugeDataFile final : public GaugeDataFile {
         }
         pending_ += count_ > 0 ? "\n]}\n" : "]}\n";
         writePending();
-        // On disk before the caller renames it into place.
-        if (error_ == 0 && ::fsync(fd_) != 0) {
-            error_ = errno;
-        }
-        if (::close(fd_) != 0 && error_ == 0) {
-            error_ = errno;
-        }
+        error_ = syncAndClose(fd_, error_);
         fd_ = -1;
         return error_;
     }
