@@ -1,6 +1,7 @@
 #include "service/QVReportingDBusWireReader.h"
 
 #include "service/QVReportingDBusWireText.h"
+#include "values/Utf8.h"
 
 #include <fmt/format.h>
 
@@ -149,7 +150,7 @@ bool Reader::readString(char type, std::string& out) {
     if (text.find('\0') != std::string_view::npos) {
         return malformed("holds a string with a NUL byte");
     }
-    if (type == 's' && !dbuswire::isValidUtf8(text)) {
+    if (type == 's' && !QVReportingIsValidUtf8(text)) {
         return malformed("holds a string that is not valid UTF-8");
     }
     if (type == 'o' && !dbuswire::isValidObjectPath(text)) {

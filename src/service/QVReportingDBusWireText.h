@@ -1,7 +1,7 @@
-// The texts a D-Bus message carries, checked as D-Bus defines them: strings are UTF-8 (no overlong
-// forms, no surrogates, nothing past U+10FFFF; noncharacters are characters like any other),
-// object paths are "/" or slash-separated words, signatures are complete types nested at most 32
-// arrays and 32 structs deep, at most 255 bytes.
+// The texts a D-Bus message carries, checked as D-Bus defines them: object paths are "/" or
+// slash-separated words, signatures are complete types nested at most 32 arrays and 32 structs
+// deep, at most 255 bytes. Its strings are UTF-8 as QVReportingIsValidUtf8 checks it
+// (values/Utf8.h), noncharacters included.
 //
 // Thread safety: no state.
 #pragma once
@@ -16,6 +16,5 @@ bool isBasicType(char code);
 std::size_t completeTypeLength(std::string_view sig);
 bool isValidSignature(std::string_view sig);
 bool isValidObjectPath(std::string_view path);
-bool isValidUtf8(std::string_view text);
 
 }  // namespace qv::dbuswire
