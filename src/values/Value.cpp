@@ -3,6 +3,7 @@
 #include <fmt/format.h>
 
 #include <algorithm>
+#include <bit>
 #include <charconv>
 #include <cmath>
 #include <ctime>
@@ -430,6 +431,21 @@ std::string QVReportingValueText(const Value* value) {
         return *s;
     }
     return value->description();
+}
+
+bool Value::sameAs(const Value& other) const {
+    if (v_.index() != other.v_.index()) {
+        return false;
+    }
+    const auto bits = [](double d) { return std::bit_cast<std::uint64_t>(d); };
+    if (const double* d = std::get_if<double>(&v_)) {
+        return bits(*d) == bits(std::get<double>(other.v_));
+    }
+    if (const Date* d = std::get_if<Date>(&v_)) {
+        return bits(d->secondsSince1970) == bits(std::get<Date>(other.v_).secondsSince1970);
+    }
+    // Shared containers compare as pointers here.
+    return v_ == other.v_;
 }
 
 Value Value::deepCopy() const {

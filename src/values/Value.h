@@ -99,6 +99,9 @@ class Value {
     // boxed number is); a string never equals a number; containers compare element by element.
     bool operator==(const Value& other) const;
     bool operator!=(const Value& other) const { return !(*this == other); }
+    // Stricter than ==: the same kind holding the same bits (so 1 is not 1.0, nor 0.0 -0.0), and
+    // containers only when they are the very same object. What prints the same, cheaply.
+    bool sameAs(const Value& other) const;
 
     // The printed form used in log lines and message descriptions.
     std::string description() const;

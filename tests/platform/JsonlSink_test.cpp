@@ -26,6 +26,7 @@
 #include "fakes/TempDirectory.h"
 #include "fakes/WaitUntil.h"
 #include "platform/SinkSegments.h"
+#include "values/ValueJson.h"
 
 namespace qv {
 namespace {
@@ -80,6 +81,38 @@ TEST_F(AJsonlSink, WritesOneObjectPerLineWithTheTimeAndSeqFirst) {
     }
     EXPECT_EQ(lostCount(), 0u);
     EXPECT_TRUE(problems.lines().empty());
+}
+
+// Analytics events go out twice with equal payloads, and the sink reuses the last payload's
+// text: only for one that prints the same, never for one that is merely equal.
+TEST_F(AJsonlSink, WritesEachPayloadAsItIsWhenItEqualsTheLastOne) {
+    const Dictionary inner{{"k", "v"}};
+    const std::vector<Dictionary> payloads{
+        {{"n", 1}, {"in", inner}},
+        {{"n", 1}, {"in", inner}},
+        {{"n", 1.0}, {"in", inner}},
+        {{"n", true}, {"in", inner}},
+        {{"in", inner}, {"n", 1}},
+        {{"n", 1}, {"in", Dictionary{{"k", "w"}}}},
+        {{"n", 0.0}},
+        {{"n", -0.0}},
+    };
+    {
+        JsonlSink sink(stateDir.string(), "analytics", clock, recording());
+        for (const auto& payload : payloads) {
+            EXPECT_TRUE(sink.append({{"payload", payload}}));
+        }
+    }
+    std::ifstream in(stateDir / "sinks" / "analytics.jsonl");
+    std::string line;
+    for (const auto& payload : payloads) {
+        ASSERT_TRUE(std::getline(in, line));
+        std::string expected = ",\"payload\":";
+        ASSERT_TRUE(QVReportingAppendJsonText(expected, Value(payload)));
+        const auto at = line.find(",\"payload\":");
+        ASSERT_NE(at, std::string::npos) << line;
+        EXPECT_EQ(line.substr(at), expected + "}");
+    }
 }
 
 TEST_F(AJsonlSink, DropsAndCountsLinesWhenItsBufferIsFull) {

@@ -121,6 +121,7 @@ JsonlSink::JsonlSink(std::string stateDir, std::string name, const Clock& clock,
           BoundedWriter<Line>::kBatches, capacity_,
           [this](std::deque<Line>& lines) { writeBatch(lines); })) {
     writer_->setMaxBytes(kMaxQueuedBytes);
+    writer_->setLinger(kLinger);
     std::lock_guard lock(gSinksMutex);
     gSinks.push_back(this);
 }
@@ -180,7 +181,7 @@ void JsonlSink::formatLine(std::string& out, const Line& line, std::uint64_t seq
         out += ',';
         valid = QVReportingAppendJsonString(out, key) && valid;
         out += ':';
-        valid = valid && QVReportingAppendJsonText(out, value);
+        valid = valid && appendMember(out, value);
         if (!valid) {
             break;
         }
@@ -199,6 +200,29 @@ void JsonlSink::formatLine(std::string& out, const Line& line, std::uint64_t seq
         out += '}';
     }
     out += '\n';
+}
+
+bool JsonlSink::appendMember(std::string& out, const Value& value) {
+    const Dictionary* dictionary = value.asDictionary();
+    if (!dictionary) {
+        return QVReportingAppendJsonText(out, value);
+    }
+    if (const Dictionary* last = lastDictionary_.asDictionary();
+        last && last->size() == dictionary->size() &&
+        std::equal(last->begin(), last->end(), dictionary->begin(),
+                   [](const auto& a, const auto& b) {
+                       return a.first == b.first && a.second.sameAs(b.second);
+                   })) {
+        out += lastDictionaryText_;
+        return true;
+    }
+    const std::size_t start = out.size();
+    if (!QVReportingAppendJsonText(out, value)) {
+        return false;
+    }
+    lastDictionary_ = value;
+    lastDictionaryText_.assign(out, start);
+    return true;
 }
 
 void JsonlSink::writeBatch(std::deque<Line>& lines) {
@@ -248,6 +272,7 @@ void JsonlSink::writeBatch(std::deque<Line>& lines) {
     if (pending > 0) {
         writeText(text_, pending);
     }
+    lastDictionary_ = Value();  // nor a payload, which may be large
     // A burst's buffer is not kept for the quiet that follows.
     if (text_.capacity() > kMaxWriteBytes * 2) {
         std::string().swap(text_);

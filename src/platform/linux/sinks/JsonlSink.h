@@ -87,6 +87,9 @@ class JsonlSink {
     // Memory the lines held for the sink's thread may take (as their values estimate it), so
     // that a flood of large messages cannot queue gigabytes for a disk that falls behind.
     static constexpr std::size_t kMaxQueuedBytes = std::size_t{16} << 20;
+    // How long the sink's thread gathers lines before it writes them: a few milliseconds of delay
+    // on disk, against a wake-up of the thread for every line under load.
+    static constexpr std::chrono::microseconds kLinger{2000};
 
     // name must be a plain file name (the daemon names its sinks); it is made safe all the same.
     // Nothing is opened yet: the first line makes the directory and opens the file.
@@ -128,6 +131,8 @@ class JsonlSink {
     void writeBatch(std::deque<Line>& lines);
     // Appends the line's JSON text, with seq, and its line feed to out.
     void formatLine(std::string& out, const Line& line, std::uint64_t seq);
+    // Appends a member's JSON text to out; false when it holds text that is not UTF-8.
+    bool appendMember(std::string& out, const Value& value);
     // Writes text, which holds `lines` whole lines; on failure they are lost and their seqs go
     // to the next lines.
     void writeText(const std::string& text, std::size_t lines);
@@ -162,6 +167,10 @@ class JsonlSink {
     bool tailChecked_ = false;     // sink's thread only: the file's end was looked at
     bool tornByUs_ = false;        // sink's thread only: our last write ended inside a line
     std::string text_;             // sink's thread only: lines being written
+    // Sink's thread only, for one batch: the dictionary member last written and its text. An
+    // analytics event goes out under two names with equal payloads, one line after the other.
+    Value lastDictionary_;
+    std::string lastDictionaryText_;
     bool threadPrepared_ = false;  // sink's thread only: its priority lowered
     // Sink's thread only: the segment being written.
     std::uint64_t nextSeq_ = 1;
