@@ -11,10 +11,8 @@
 #include <string>
 #include <vector>
 
-#include "fakes/FakeClock.h"
 #include "fakes/TempDirectory.h"
 #include "platform/SinkSegments.h"
-#include "platform/linux/sinks/JsonlSink.h"
 
 namespace qv {
 namespace {
@@ -78,49 +76,6 @@ TEST(ADiskBudget, RemovesTheOldestClosedSegmentsFirstKeepingEachSinksOrderAndCou
             fs::remove(entry.path());
         }
     }
-}
-
-TEST(ADiskBudget, KeepsTheClosedSegmentsOfSinksThatShareItWithinIt) {
-    test::TempDirectory tmp{"qvbudget"};
-    test::FakeClock clock;
-    const fs::path sinks = tmp.path() / "sinks";
-    std::map<std::string, std::uint64_t> expired;
-    auto budget = std::make_shared<DiskBudget>(
-        "sinks", 600, DiskBudget::closedSinkSegmentsIn(sinks),
-        DiskBudget::Callbacks{[&](std::string_view sink, std::uint64_t bytes) {
-                                  expired[std::string(sink)] += bytes;
-                              },
-                              nullptr});
-    {
-        const SinkSegmentPolicy policy{200, 1e9, budget};
-        JsonlSink a(tmp.path().string(), "a", clock, {}, JsonlSink::kDefaultCapacity, policy);
-        JsonlSink b(tmp.path().string(), "b", clock, {}, JsonlSink::kDefaultCapacity, policy);
-        for (int i = 0; i < 40; ++i) {
-            (i % 4 == 0 ? b : a).append({{"i", i}});
-            a.flush();
-            b.flush();
-        }
-    }
-    std::uint64_t closedBytes = 0;
-    std::uint64_t allBytes = 0;
-    for (const auto& entry : fs::directory_iterator(sinks)) {
-        allBytes += entry.file_size();
-        if (entry.path().filename().string().find(".0") != std::string::npos) {
-            closedBytes += entry.file_size();
-        }
-    }
-    EXPECT_LE(closedBytes, 600u);
-    EXPECT_GT(closedBytes, 300u) << "only what the budget needs is removed";
-    EXPECT_GT(expired["a"], 0u);
-    // Every byte written is either on disk or counted as expired. That the oldest lines went,
-    // and only they, is the table above's and the end-to-end SegmentsAndBudgets test's.
-    std::uint64_t written = 0;
-    for (int i = 0; i < 40; ++i) {
-        // {"time":1706707501.0,"seq":N,"i":I}\n
-        written += 34 + std::to_string(i % 4 == 0 ? i / 4 + 1 : i - i / 4).size() +
-                   std::to_string(i).size();
-    }
-    EXPECT_EQ(allBytes + expired["a"] + expired["b"], written);
 }
 
 }  // namespace

@@ -1,11 +1,9 @@
 #include "platform/linux/capture/LinuxIssueFilerService.h"
 
-#include <fcntl.h>
 #include <gtest/gtest.h>
 #include <signal.h>
 #include <sys/socket.h>
 #include <sys/un.h>
-#include <sys/wait.h>
 #include <unistd.h>
 #include <nlohmann/json.hpp>
 
@@ -58,38 +56,19 @@ int listeningSocket(const fs::path& path) {
 }
 
 // A program started for the test, with its standard output readable line by line; killed when
-// the object goes.
+// the object goes. The shell says its own pid, which exec hands on to the program.
 class Spawned {
   public:
-    explicit Spawned(std::vector<std::string> argv) {
-        int fds[2];
-        if (::pipe2(fds, O_CLOEXEC) != 0) {
-            return;
-        }
-        pid_ = ::fork();
-        if (pid_ == 0) {
-            ::dup2(fds[1], 1);
-            // dbus-daemon complains that it may not raise its descriptor limit here.
-            const int quiet = ::open("/dev/null", O_WRONLY);
-            ::dup2(quiet, 2);
-            std::vector<char*> args;
-            for (auto& a : argv) {
-                args.push_back(a.data());
-            }
-            args.push_back(nullptr);
-            ::execv(args[0], args.data());
-            ::_exit(127);
-        }
-        ::close(fds[1]);
-        out_ = ::fdopen(fds[0], "r");
-    }
+    explicit Spawned(const std::string& command)
+        // dbus-daemon complains that it may not raise its descriptor limit here.
+        : out_(::popen(("echo $$; exec " + command + " 2>/dev/null").c_str(), "re")),
+          pid_(std::atoi(readLine().c_str())) {}
     ~Spawned() {
         if (pid_ > 0) {
             ::kill(pid_, SIGKILL);
-            ::waitpid(pid_, nullptr, 0);
         }
         if (out_ != nullptr) {
-            ::fclose(out_);
+            ::pclose(out_);
         }
     }
     Spawned(const Spawned&) = delete;
@@ -107,8 +86,8 @@ class Spawned {
     }
 
   private:
-    pid_t pid_ = -1;
-    FILE* out_ = nullptr;
+    FILE* out_;
+    pid_t pid_;
 };
 
 class TheLinuxIssueFilerService : public ::testing::Test {
@@ -141,8 +120,8 @@ class TheLinuxIssueFilerService : public ::testing::Test {
             std::system("/usr/bin/python3 -c 'import dbus, gi' 2>/dev/null") != 0) {
             return std::nullopt;
         }
-        bus = std::make_unique<Spawned>(std::vector<std::string>{
-            "/usr/bin/dbus-daemon", "--session", "--nofork", "--print-address=1"});
+        bus =
+            std::make_unique<Spawned>("/usr/bin/dbus-daemon --session --nofork --print-address=1");
         std::string address = bus->readLine();
         if (address.empty()) {
             return std::nullopt;
@@ -151,9 +130,9 @@ class TheLinuxIssueFilerService : public ::testing::Test {
     }
     bool startNotifications(const std::string& address, const std::string& mode) {
         const fs::path script = fs::path(QV_SOURCE_DIR) / "tests/e2e/notification_server.py";
-        server = std::make_unique<Spawned>(
-            std::vector<std::string>{"/usr/bin/python3", script.string(), address,
-                                     (state / "notified.jsonl").string(), mode});
+        server =
+            std::make_unique<Spawned>("/usr/bin/python3 '" + script.string() + "' '" + address +
+                                      "' '" + (state / "notified.jsonl").string() + "' " + mode);
         return server->readLine() == "ready";
     }
 

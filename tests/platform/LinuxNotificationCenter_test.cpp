@@ -56,28 +56,17 @@ TEST(ALinuxNotificationCenter, KeepsStatesByNameAndRunsOnlyLiveHandlersThroughTh
     EXPECT_FALSE(center.registerNotification("x", inlineRunner(), {}));
 }
 
-TEST(ALinuxNotificationCenter, TellsThePostObserverAfterEveryPostAndLetsHandlersPostAgain) {
+// That the bus hears of every post, watched or not, is the end-to-end PulsarOverloads test's (its
+// dropped-spinlog signal, which no one watches); here, that a cleared observer hears no more.
+TEST(ALinuxNotificationCenter, TellsThePostObserverOfEveryPostUntilItIsCleared) {
     LinuxNotificationCenter center;
     std::vector<std::pair<std::string, std::uint64_t>> observed;
     center.setPostObserver(
         [&](const std::string& name, std::uint64_t state) { observed.emplace_back(name, state); });
-    // A handler posting from inside a post must not deadlock; the outer observer call comes last.
-    std::vector<std::uint64_t> seenByHandler;
-    ASSERT_TRUE(center.registerNotification("ringer", inlineRunner(), [&](Token t) {
-        seenByHandler.push_back(*center.getState(t));
-        if (seenByHandler.size() == 1) {
-            center.post("echo", 7);
-        }
-    }));
-    center.post("ringer", 1);
     center.post("nobody", 5);
-    EXPECT_EQ(seenByHandler, std::vector<std::uint64_t>{1});
-    EXPECT_EQ(observed, (std::vector<std::pair<std::string, std::uint64_t>>{
-                            {"echo", 7}, {"ringer", 1}, {"nobody", 5}}));
-
     center.setPostObserver({});
-    center.post("ringer", 0);
-    EXPECT_EQ(observed.size(), 3u);
+    center.post("nobody", 0);
+    EXPECT_EQ(observed, (std::vector<std::pair<std::string, std::uint64_t>>{{"nobody", 5}}));
 }
 
 TEST(ALinuxNotificationCenter, StaysConsistentUnderConcurrentPostsRegistrationsAndCancels) {

@@ -80,30 +80,19 @@ TEST_F(ALinuxPreferenceStore, WritesAtomicallyAndOthersSeeEveryChangeEvenWithinO
     EXPECT_TRUE(errors.lines().empty());
 }
 
+// That a malformed file reads as empty, is reported once naming it and is never written over
+// is the preference_store fuzz target's; here, what it cannot make: another version of the file,
+// then a good one, and a directory in a suite's place.
 TEST_F(ALinuxPreferenceStore, ReadsMalformedFilesAsEmptyReportsEachVersionOnceAndLeavesThemAlone) {
     LinuxPreferenceStore store(stateDir.string(), errors.callback());
     const fs::path bad = store.pathForSuite("bad");
     writeText(bad, "{\"k\": 1, oops");
-    for (int i = 0; i < 3; ++i) {
-        EXPECT_FALSE(store.value("bad", "k"));
-    }
+    EXPECT_FALSE(store.value("bad", "k"));
     ASSERT_EQ(errors.lines().size(), 1u);
     EXPECT_NE(errors.lines()[0].find(bad.string() + " is not valid JSON"), std::string::npos);
     fs::last_write_time(bad, fs::last_write_time(bad) - std::chrono::seconds(10));
     EXPECT_TRUE(store.values("bad").empty());
     EXPECT_EQ(errors.lines().size(), 2u) << "an older time is another version";
-    // A change would throw the rest of the file away: refused.
-    EXPECT_FALSE(store.setValue("bad", "k", Value(2)));
-    EXPECT_EQ(fs::file_size(bad), 13u);
-
-    writeText(store.pathForSuite("deep"), std::string(100000, '[') + std::string(100000, ']'));
-    EXPECT_TRUE(store.values("deep").empty());
-    // The JSON parser stops at a NUL byte: what follows one must not go unread.
-    const fs::path nul = store.pathForSuite("nul");
-    writeText(nul, std::string(R"({"k": 1})") + '\0' + R"({"k": 2})");
-    EXPECT_TRUE(store.values("nul").empty());
-    EXPECT_NE(errors.lines().back().find(nul.string() + " is not valid JSON"), std::string::npos);
-    EXPECT_FALSE(store.setValue("nul", "k", Value(3)));
     fs::create_directory(store.pathForSuite("directory"));
     EXPECT_FALSE(store.setValue("directory", "k", Value(1)));
     writeText(bad, R"({"k": 5, "ok": true})");
