@@ -75,15 +75,5 @@ TEST(QVBridgeEventQueue, CloseDrainsThenStopsWaiting) {
     EXPECT_FALSE(q.pop(e, std::chrono::hours(24)));
 }
 
-TEST(QVBridgeEventQueue, APopperWakesForAPushFromAnotherThread) {
-    QVBridgeStats stats;
-    QVBridgeEventQueue q(8, stats);
-    std::thread pusher([&] { q.push(event(Kind::kMessage, 9)); });
-    QVBridgeEvent e;
-    EXPECT_TRUE(q.pop(e, 30s));
-    EXPECT_EQ(e.reporterID, 9);
-    pusher.join();
-}
-
 }  // namespace
 }  // namespace qv::bridge

@@ -45,7 +45,8 @@ TEST(QVBridgePods, FormatOfRawAudioOnly) {
     EXPECT_FALSE(QVBridgeParseFormat(nullptr));
 }
 
-TEST(QVBridgePods, ProfileCyclesWithTheirDriverAndFollowers) {
+// The followers' blocks (which stream overran) are the end-to-end Xruns test's, with a slow client.
+TEST(QVBridgePods, ProfileCyclesWithTheirDriverXrunsAndQuantum) {
     const spa_fraction rate = SPA_FRACTION(1, 48000);
     const spa_fraction latency = SPA_FRACTION(1024, 48000);
     std::uint8_t buffer[4096];
@@ -66,12 +67,6 @@ TEST(QVBridgePods, ProfileCyclesWithTheirDriverAndFollowers) {
     spa_pod_builder_add_struct(&b, SPA_POD_Int(30), SPA_POD_String("speakers"), SPA_POD_Long(0),
                                SPA_POD_Long(0), SPA_POD_Long(0), SPA_POD_Long(0), SPA_POD_Int(3),
                                SPA_POD_Fraction(&latency));
-    for (int id : {41, 42}) {
-        spa_pod_builder_prop(&b, SPA_PROFILER_followerBlock, 0);
-        spa_pod_builder_add_struct(&b, SPA_POD_Int(id), SPA_POD_String("stream"), SPA_POD_Long(0),
-                                   SPA_POD_Long(0), SPA_POD_Long(0), SPA_POD_Long(0),
-                                   SPA_POD_Int(id == 41 ? 3 : 1), SPA_POD_Fraction(&latency));
-    }
     spa_pod_builder_pop(&b, &object);
     // An object without a driver block is no cycle.
     spa_pod_builder_push_object(&b, &object, SPA_TYPE_OBJECT_Profiler, 0);
@@ -83,10 +78,6 @@ TEST(QVBridgePods, ProfileCyclesWithTheirDriverAndFollowers) {
     const auto& c = cycles[0];
     EXPECT_EQ(std::tie(c.driverID, c.driverName, c.xrunCount, c.quantum),
               std::tuple(30u, "speakers", 3, 1024u));
-    ASSERT_EQ(cycles[0].followers.size(), 2u);
-    EXPECT_EQ(cycles[0].followers[0].status, kQVBridgeNodeFinished);
-    EXPECT_EQ(cycles[0].followers[1].id, 42u);
-    EXPECT_EQ(cycles[0].followers[1].status, 1);
 }
 
 }  // namespace

@@ -111,12 +111,5 @@ TEST(AReplayScriptParser, RefusesLinesNestedTooDeepWithoutExhaustingTheStack) {
     EXPECT_EQ(std::get<QVReportingReplayError>(result).line, 2u);
 }
 
-TEST(AReplayScriptParser, NumbersLinesPassingBlankOnesAndStopsAtTheFirstBadOne) {
-    std::istringstream script("{\"op\":\"create\",\"id\":5}\n\n   \r\n{\"op\":\"stop\"}\n");
-    auto result = QVReportingParseReplayScript(script);
-    ASSERT_TRUE(std::holds_alternative<QVReportingReplayError>(result));
-    EXPECT_EQ(std::get<QVReportingReplayError>(result).line, 4u);
-}
-
 }  // namespace
 }  // namespace qv::client

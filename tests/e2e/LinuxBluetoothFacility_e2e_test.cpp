@@ -150,14 +150,6 @@ void writeAccessory(const test::TempDirectory& dir, const std::string& address,
 const char* kGoodFile =
     R"({"TELPVersionInfo": ["a", "M4801", "c", "KEY"], "CaseInfo": {"CaseInfoVersion": "1"}})";
 
-std::vector<std::string> addresses(const std::vector<BluetoothPairedDevice>& devices) {
-    std::vector<std::string> out;
-    for (const auto& d : devices) {
-        out.push_back(d.address);
-    }
-    return out;
-}
-
 // Whether the facility lists the device of that address with accessory information.
 bool hasInformation(const BluetoothFacility& facility, const std::string& address) {
     for (const auto& d : facility.pairedDevices()) {
@@ -189,18 +181,12 @@ TEST(TheLinuxBluetoothFacility, FollowsBlueZAndTheAccessoryDirectory) {
     bus.addDevice("00:00:00:00:00:02", true, false);
     bus.addDevice("00:00:00:00:00:03", false, false);  // seen but not paired
     bus.addDevice("00:00:00:00:00:04", true, false);   // paired, no accessory file
+    // Which devices are listed, in which order and with which files, the accessory report's
+    // end-to-end test checks; the listed connection flags, which the daemon never reads, here.
     ASSERT_TRUE(test::waitUntil([&] { return facility.pairedDevices().size() == 3; }));
-    auto devices = facility.pairedDevices();
-    EXPECT_EQ(
-        addresses(devices),
-        (std::vector<std::string>{"00:00:00:00:00:01", "00:00:00:00:00:02", "00:00:00:00:00:04"}))
-        << "object-path order";
-    EXPECT_EQ(devices[0].identifier, first);
+    const auto devices = facility.pairedDevices();
     EXPECT_TRUE(devices[0].connected);
     EXPECT_FALSE(devices[1].connected);
-    ASSERT_TRUE(devices[0].accessoryInformation.has_value());
-    EXPECT_EQ(devices[0].accessoryInformation->find("TELPVersionInfo")->asArray()->size(), 4u);
-    EXPECT_FALSE(devices[2].accessoryInformation.has_value());
 
     // Connection changes arrive as signals.
     bus.setConnected("00:00:00:00:00:01", false);

@@ -31,6 +31,19 @@ class TwoClients(DaemonTestCase):
         wait_until(lambda: self.daemon.events("com.korvane.telephony.Generic.Generic")
                    and self.daemon.events("com.korvane.haptics.Generic.Generic"),
                    what="the broadcast in both sessions")
+        # Addressed, it reaches the named session alone (0 and unknown IDs are skipped); the
+        # shared session is only for messages that nothing running takes.
+        a.send({"addressed": True}, GENERIC_CATEGORY, GENERIC_TYPE, [0, 2002, 999])
+        a.send({"last": True}, GENERIC_CATEGORY, GENERIC_TYPE)
+
+        def sent(service):  # each session's messages reach the sink in order
+            return [next(k for k in ("broadcast", "addressed", "last") if k in e["payload"])
+                    for e in self.daemon.events(f"com.korvane.{service}.Generic.Generic")]
+        wait_until(lambda: sent("telephony")[-1:] == sent("haptics")[-1:] == ["last"],
+                   what="the last broadcast in both sessions")
+        self.assertEqual(sent("telephony"), ["broadcast", "last"])
+        self.assertEqual(sent("haptics"), ["broadcast", "addressed", "last"])
+        self.assertNotIn("Creating singleMessageSession", self.daemon.log_text())
 
     def test_a_client_killed_mid_session_has_its_sessions_stopped_and_its_uptime_recorded(self):
         script = f"""

@@ -91,20 +91,6 @@ class AService : public ::testing::Test {
     Answer ignored;
 };
 
-TEST_F(AService, RoutesMessagesToEveryStartedSessionOrToTheNamedOnesAcrossClients) {
-    makeService();
-    auto a = connect(100), b = connect(200);
-    auto s1 = startedSession(*a, 11), s2 = startedSession(*b, 22);
-    send(*b, {{"broadcast", 1}});
-    EXPECT_TRUE(holds(*s1, "broadcast"));
-    EXPECT_TRUE(holds(*s2, "broadcast"));
-    send(*a, {{"addressed", 1}}, {0, 22, 999});  // 0 and unknown IDs are skipped
-    EXPECT_FALSE(holds(*s1, "addressed"));
-    EXPECT_TRUE(holds(*s2, "addressed"));
-    EXPECT_EQ(service->singleMessageSession(), nullptr);
-    EXPECT_FALSE(lastSendError);
-}
-
 TEST_F(AService, RunsTheSingleMessageSessionFromFirstUseUntilMoreThanFiveIdleSeconds) {
     makeService();
     auto a = connect(100);

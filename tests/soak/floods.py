@@ -27,7 +27,7 @@ PAYLOAD_BYTES_PER_SECOND = 2 << 20
 
 
 class Flooder:
-    """qv_flood_client in one mode; it prints one line when its flood is in, then waits."""
+    """qv_soak_client in a flood mode; it prints one line when its flood is in, then waits."""
 
     def __init__(self, binary, bus, mode, *args):
         self.process = subprocess.Popen([binary, "--address", bus.address, mode, *args],
@@ -65,7 +65,7 @@ def probe_figures(process):
 def run(soak):
     sizes = FULL_SIZES if soak.args.full else SHORT_SIZES
     c = soak.checks
-    binary = soak.args.flood_client
+    binary = soak.args.client
     log(f"== floods: {sizes}")
     bus = Bus(soak.new_dir("floods-bus"))
     try:

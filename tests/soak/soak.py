@@ -9,8 +9,8 @@ read-only or holds garbage.
 The short form (the default, what CI runs) runs every scenario once with a few clients; --full
 runs 50 clients of 10^4 messages each and repeats the stop and kill scenarios. The daemon should
 be the asan-ubsan build (scripts/soak builds it): it runs with detect_leaks=1 and abort_on_error=1
-and every one of its logs is searched for sanitizer reports. The load comes from qv_soak_client
-(tests/soak/soak_client.cpp), one process per client.
+and every one of its logs is searched for sanitizer reports. The load and the floods come from
+qv_soak_client (tests/soak/soak_client.cpp), one process per client.
 
 Scenarios:
   churn    clients killed with SIGKILL at random points while their start calls are held; their
@@ -639,8 +639,6 @@ def main():
                                                          "qvreportd"))
     parser.add_argument("--client", default=os.path.join(SOURCE_DIR, "build", "asan-ubsan",
                                                          "tests", "qv_soak_client"))
-    parser.add_argument("--flood-client", default=os.path.join(SOURCE_DIR, "build", "asan-ubsan",
-                                                               "tests", "qv_flood_client"))
     parser.add_argument("--workdir", default=None, help="where the work directory is made")
     parser.add_argument("--keep", action="store_true", help="keep logs and state directories")
     parser.add_argument("--skip-mounts", action="store_true",
@@ -661,7 +659,7 @@ def main():
             env = dict(os.environ, QV_SOAK_MOUNT_NAMESPACE="1")
             os.execvpe("unshare", ["unshare", "--mount", "--propagation", "private",
                                    sys.executable, *sys.argv, "--seed", str(args.seed)], env)
-    for path in (args.daemon, args.client, args.flood_client):
+    for path in (args.daemon, args.client):
         if not os.access(path, os.X_OK):
             parser.error(f"{path} is not built (scripts/soak builds it)")
     soak = Soak(args, FULL if args.full else SHORT)

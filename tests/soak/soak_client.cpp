@@ -1,165 +1,284 @@
-// One client of the fault soak (tests/soak/soak.py): a bus connection that creates its sessions,
-// starts them (the start replies stay held until the sessions stop), sends its messages with many
-// calls in flight, then stops and destroys its sessions. A python client cannot keep dozens of
-// these busy on two cores; this one costs the machine little beside the daemon.
+// The fault soak's client (tests/soak/soak.py, floods.py), on sd-bus itself: it must keep many
+// calls in flight, or send tens of thousands without waiting for any answer, which a blocking
+// binding cannot, and cost the machine little beside the daemon.
 //
-//   qv_soak_client --address ADDR --first-id ID [--sessions N] [--messages N] [--depth N]
-//                  [--padding BYTES] [--progress N] [--answers FILE] [--keep-sessions]
+//   qv_soak_client --address ADDR [MODE] [--first-id ID] [--sessions N] [--messages N]
+//                  [--depth N] [--padding BYTES] [--progress N] [--answers FILE]
+//                  [--keep-sessions] [--count N] [--bytes N] [--seconds S]
 //
-// Every message goes to one session (round robin) and carries "soak_rid" and "soak_seq" (its
-// number within that session), so the sink's lines can be matched to the calls. Each session is
-// configured with "HostApplicationDisplayID" "soak.<ID>", which the daemon stamps into every
-// message and into the session's summary.
-//
-// On stdout, one line each: "started" once every session runs, "progress N" every 500 answered
-// calls (--progress N), then "done answered=N errors=N gone=0|1". --answers FILE gets one line per
-// call answered without error, "RID SEQ MONOTONIC_NS" (the time the answer arrived,
-// CLOCK_MONOTONIC), written when the client ends; --keep-sessions leaves the sessions running at
-// the end and waits to be killed. When the daemon leaves the bus mid-way (calls answered with
-// errors), the client stops sending, lets the calls in flight end, writes what it has and exits 0.
+// Modes:
+//   load      (the default) creates --sessions sessions, configured with
+//             "HostApplicationDisplayID" "soak.<ID>", starts them (the start replies stay held),
+//             sends --messages messages round robin, --depth calls in flight, each carrying
+//             "soak_rid" and "soak_seq" (its number within its session), then stops and destroys
+//             the sessions (--keep-sessions: leaves them running and waits to be killed). Prints
+//             "started" once every session runs, "progress N" every --progress answered calls,
+//             then "done answered=N errors=N gone=0|1"; --answers FILE gets "RID SEQ MONOTONIC_NS"
+//             per call answered without error. When the daemon leaves the bus mid-way (calls
+//             answered with errors), it stops sending, lets the calls in flight end, writes what
+//             it has and exits 0.
+//   sessions  creates and starts --count sessions, every call in flight at once; prints
+//             "sessions N seconds S" once a final call, queued behind them all, answers
+//   held      starts one session, then sends --count more starts of it without expecting replies
+//             (by the rules never answered); prints "held N" once a final call answers
+//   sends     sends --count messages of --bytes of text each to one started session (every
+//             payload different) and never reads the answers; prints "sent N" when all are
+//             written, then waits to be killed
+//   probe     calls ReporterIDValid, then the bus's own GetId, every 10 ms for --seconds; prints
+//             "probe calls=N refused=N daemon p50_ms=X p99_ms=X max_ms=X; bus itself ..."
 #include <poll.h>
 #include <time.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cstdint>
 #include <cstdio>
 #include <cstdlib>
+#include <cstring>
+#include <functional>
 #include <map>
-#include <memory>
 #include <string>
 #include <vector>
 
-#include <sdbus-c++/sdbus-c++.h>
+#include <systemd/sd-bus.h>
 
 #include "QVReportingDBusNames.h"
 
 namespace {
 
-using Payload = std::map<std::string, sdbus::Variant>;
+using namespace qv::dbus;
 
 struct Options {
     std::string address;
-    std::int64_t firstID = 0;
-    int sessions = 1;
-    std::int64_t messages = 1000;  // in all, spread over the sessions
+    std::string mode = "load";
+    std::int64_t firstID = 1;
+    long sessions = 1;
+    long messages = 1000;  // in all, spread over the sessions
     std::size_t depth = 32;
     std::size_t padding = 0;
-    std::int64_t progressEvery = 500;
+    long progressEvery = 500;
     std::string answersFile;
     bool keepSessions = false;
+    long count = 1000;
+    long bytes = 600 * 1024;
+    double seconds = 5;
 };
 
-struct Answer {
-    std::int64_t rid;
-    std::int64_t seq;
-    std::int64_t nanos;
-};
+[[noreturn]] void die(const char* what, int r) {
+    std::fprintf(stderr, "soak client: %s: %s\n", what, std::strerror(-r));
+    std::exit(1);
+}
 
-std::int64_t monotonicNanos() {
+std::int64_t nanos() {
     timespec ts{};
     clock_gettime(CLOCK_MONOTONIC, &ts);
     return static_cast<std::int64_t>(ts.tv_sec) * 1000000000 + ts.tv_nsec;
 }
 
-bool parse(int argc, char** argv, Options& o) {
-    for (int i = 1; i < argc; ++i) {
-        const std::string a = argv[i];
-        const bool hasValue = i + 1 < argc;
-        if (a == "--address" && hasValue) {
-            o.address = argv[++i];
-        } else if (a == "--first-id" && hasValue) {
-            o.firstID = std::atoll(argv[++i]);
-        } else if (a == "--sessions" && hasValue) {
-            o.sessions = std::atoi(argv[++i]);
-        } else if (a == "--messages" && hasValue) {
-            o.messages = std::atoll(argv[++i]);
-        } else if (a == "--depth" && hasValue) {
-            o.depth = static_cast<std::size_t>(std::atoll(argv[++i]));
-        } else if (a == "--padding" && hasValue) {
-            o.padding = static_cast<std::size_t>(std::atoll(argv[++i]));
-        } else if (a == "--progress" && hasValue) {
-            o.progressEvery = std::atoll(argv[++i]);
-        } else if (a == "--answers" && hasValue) {
-            o.answersFile = argv[++i];
-        } else if (a == "--keep-sessions") {
-            o.keepSessions = true;
-        } else {
-            return false;
-        }
-    }
-    return !o.address.empty() && o.firstID > 0 && o.sessions > 0 && o.messages >= 0 &&
-           o.depth > 0 && o.progressEvery > 0;
+double now() {
+    return static_cast<double>(nanos()) / 1e9;
 }
 
-class SoakClient {
-  public:
-    explicit SoakClient(const Options& options)
-        : options_(options),
-          connection_(sdbus::createSessionBusConnectionWithAddress(options.address)),
-          proxy_(sdbus::createProxy(*connection_, qv::dbus::kBusName, qv::dbus::kObjectPath)),
-          padding_(options.padding, 'p'),
-          nextSeq_(static_cast<std::size_t>(options.sessions), 0) {
-        answers_.reserve(static_cast<std::size_t>(options.messages));
-    }
+sd_bus* connect(const std::string& address) {
+    sd_bus* bus = nullptr;
+    int r = sd_bus_new(&bus);
+    if (r >= 0)
+        r = sd_bus_set_address(bus, address.c_str());
+    if (r >= 0)
+        r = sd_bus_set_bus_client(bus, 1);
+    if (r >= 0)
+        r = sd_bus_start(bus);
+    if (r < 0)
+        die("connect", r);
+    return bus;
+}
 
-    void beginSessions() {
-        for (int s = 0; s < options_.sessions; ++s) {
-            const std::int64_t rid = options_.firstID + s;
-            callBool(qv::dbus::kCreateReportingSession, rid);
-            auto configure =
-                proxy_->createMethodCall(qv::dbus::kInterface, qv::dbus::kSetConfiguration);
-            configure << Payload{{"HostApplicationDisplayID",
-                                  sdbus::Variant("soak." + std::to_string(rid))}}
-                      << rid;
-            proxy_->callMethod(configure);
-            auto start =
-                proxy_->createMethodCall(qv::dbus::kInterface, qv::dbus::kStartReportingSession);
-            start << rid;
-            // Answered only when the session stops; the handle keeps the callback alive.
-            heldStarts_.push_back(proxy_->callMethod(
-                start, [](sdbus::MethodReply&, const sdbus::Error*) {},
-                std::uint64_t{3600} * 1000000));
+sd_bus_message* newCall(sd_bus* bus, const char* member) {
+    sd_bus_message* m = nullptr;
+    const int r =
+        sd_bus_message_new_method_call(bus, &m, kBusName, kObjectPath, kInterface, member);
+    if (r < 0)
+        die("new call", r);
+    return m;
+}
+
+// Sends a call whose reply is not waited for; expectReply false marks it as wanting none.
+void sendCall(sd_bus* bus, sd_bus_message* m, bool expectReply) {
+    if (!expectReply)
+        sd_bus_message_set_expect_reply(m, 0);
+    const int r = sd_bus_send(bus, m, nullptr);
+    sd_bus_message_unref(m);
+    if (r < 0)
+        die("send", r);
+}
+
+sd_bus_message* idCall(sd_bus* bus, const char* member, std::int64_t id) {
+    sd_bus_message* m = newCall(bus, member);
+    const int r = sd_bus_message_append(m, "x", id);
+    if (r < 0)
+        die("append", r);
+    return m;
+}
+
+// Waits for the call's answer; an error ends the client.
+void callOrDie(sd_bus* bus, sd_bus_message* m) {
+    sd_bus_error error = SD_BUS_ERROR_NULL;
+    sd_bus_message* reply = nullptr;
+    if (sd_bus_call(bus, m, 600 * 1000000ull, &error, &reply) < 0) {
+        std::fprintf(stderr, "soak client: %s: %s: %s\n", sd_bus_message_get_member(m),
+                     error.name ? error.name : "", error.message ? error.message : "");
+        std::exit(1);
+    }
+    sd_bus_message_unref(m);
+    sd_bus_message_unref(reply);
+}
+
+// A call answered after everything the client sent before it (the daemon serves one client's
+// calls in order): its answer means the daemon has taken in all of them.
+void barrier(sd_bus* bus) {
+    callOrDie(bus, idCall(bus, kReporterIDValid, 0));
+}
+
+void flush(sd_bus* bus) {
+    const int r = sd_bus_flush(bus);
+    if (r < 0)
+        die("flush", r);
+}
+
+// Dispatches what has arrived; with wait, first waits up to 100 ms for something to.
+void pump(sd_bus* bus, bool wait) {
+    int r = 0;
+    while ((r = sd_bus_process(bus, nullptr)) > 0) {
+    }
+    if (r >= 0 && wait && (r = sd_bus_wait(bus, 100000)) >= 0) {
+        while ((r = sd_bus_process(bus, nullptr)) > 0) {
+        }
+    }
+    if (r < 0)
+        die("process", r);
+}
+
+class LoadClient {
+  public:
+    explicit LoadClient(const Options& options)
+        : o_(options),
+          bus_(connect(options.address)),
+          padding_(options.padding, 'p'),
+          nextSeq_(static_cast<std::size_t>(options.sessions), 0) {}
+
+    int run() {
+        for (long s = 0; s < o_.sessions; ++s) {
+            const std::int64_t rid = o_.firstID + s;
+            callOrDie(bus_, idCall(bus_, kCreateReportingSession, rid));
+            sd_bus_message* configure = newCall(bus_, kSetConfiguration);
+            const std::string app = "soak." + std::to_string(rid);
+            if (const int r = sd_bus_message_append(
+                    configure, "a{sv}x", 1, "HostApplicationDisplayID", "s", app.c_str(), rid);
+                r < 0)
+                die("append", r);
+            callOrDie(bus_, configure);
+            // Answered only when the session stops. Without a callback sd-bus would mark the
+            // call as wanting no reply.
+            sd_bus_message* start = idCall(bus_, kStartReportingSession, rid);
+            auto ignore = [](sd_bus_message*, void*, sd_bus_error*) { return 0; };
+            if (const int r =
+                    sd_bus_call_async(bus_, nullptr, start, ignore, nullptr, 3600 * 1000000ull);
+                r < 0)
+                die("start", r);
+            sd_bus_message_unref(start);
         }
         // Calls of one connection are handled in order: once this is answered, every start ran.
-        auto all = proxy_->createMethodCall(qv::dbus::kInterface, qv::dbus::kGetAllReporters);
-        proxy_->callMethod(all);
+        callOrDie(bus_, newCall(bus_, kGetAllReporters));
         std::printf("started\n");
         std::fflush(stdout);
-    }
 
-    void sendAll() {
-        std::int64_t sent = 0;
-        while (!gone_ && (sent < options_.messages || inFlight_ > 0)) {
-            while (!gone_ && inFlight_ < options_.depth && sent < options_.messages) {
-                send(static_cast<std::size_t>(sent % options_.sessions));
+        long sent = 0;
+        while (!gone_ && (sent < o_.messages || inFlight_ > 0)) {
+            while (!gone_ && inFlight_ < o_.depth && sent < o_.messages) {
+                send(static_cast<std::size_t>(sent % o_.sessions));
                 ++sent;
             }
-            pump(true);
+            pump(bus_, true);
         }
         // The daemon is gone: the calls still out end with errors from the bus.
-        while (inFlight_ > 0) {
-            pump(true);
+        while (inFlight_ > 0)
+            pump(bus_, true);
+        writeAnswers();
+        if (!gone_ && !o_.keepSessions) {
+            for (long s = 0; s < o_.sessions; ++s) {
+                callOrDie(bus_, idCall(bus_, kStopReportingSession, o_.firstID + s));
+                callOrDie(bus_, idCall(bus_, kDestroyReportingSession, o_.firstID + s));
+            }
+            pump(bus_, false);
         }
+        std::printf("done answered=%zu errors=%ld gone=%d\n", answers_.size(), errors_,
+                    gone_ ? 1 : 0);
+        std::fflush(stdout);
+        while (o_.keepSessions)
+            pump(bus_, true);
+        return 0;
     }
 
-    void endSessions() {
-        if (gone_ || options_.keepSessions) {
-            return;
+  private:
+    struct Call {
+        LoadClient* client;
+        std::int64_t rid;
+        std::int64_t seq;
+    };
+    struct Answer {
+        std::int64_t rid;
+        std::int64_t seq;
+        std::int64_t nanos;
+    };
+
+    void send(std::size_t session) {
+        const std::int64_t rid = o_.firstID + static_cast<std::int64_t>(session);
+        const std::int64_t seq = nextSeq_[session]++;
+        sd_bus_message* m = newCall(bus_, kSendMessage);
+        // Playback/Start (category 4, type 1), addressed to this session alone.
+        int r = sd_bus_message_append(m, "a{sv}", padding_.empty() ? 5 : 6, "soak_rid", "x", rid,
+                                      "soak_seq", "x", seq, "session_output_running", "b", 1,
+                                      "route", "s", "BuiltInSpeaker", "latency_ms", "d", 11.6,
+                                      "padding", "s", padding_.c_str());
+        if (r >= 0)
+            r = sd_bus_message_append(m, "uqax", 4u, std::uint16_t{1}, 1, rid);
+        if (r >= 0)
+            r = sd_bus_call_async(bus_, nullptr, m, &LoadClient::answered, new Call{this, rid, seq},
+                                  120 * 1000000ull);
+        sd_bus_message_unref(m);
+        if (r < 0)
+            die("send", r);
+        ++inFlight_;
+    }
+
+    static int answered(sd_bus_message* reply, void* data, sd_bus_error*) {
+        const Call call = *static_cast<Call*>(data);
+        delete static_cast<Call*>(data);
+        LoadClient& c = *call.client;
+        --c.inFlight_;
+        if (sd_bus_message_is_method_error(reply, nullptr)) {
+            ++c.errors_;
+            // Anything but a refusal of this one call means the daemon went away.
+            const char* name = sd_bus_message_get_error(reply)->name;
+            if (std::strcmp(name, kErrorLimitsExceeded) != 0 &&
+                std::strcmp(name, kErrorInvalidArgs) != 0)
+                c.gone_ = true;
+            return 0;
         }
-        for (int s = 0; s < options_.sessions; ++s) {
-            callBool(qv::dbus::kStopReportingSession, options_.firstID + s);
-            callBool(qv::dbus::kDestroyReportingSession, options_.firstID + s);
+        c.answers_.push_back(Answer{call.rid, call.seq, nanos()});
+        if (static_cast<long>(c.answers_.size()) % c.o_.progressEvery == 0) {
+            std::printf("progress %zu\n", c.answers_.size());
+            std::fflush(stdout);
         }
-        pump(false);
+        return 0;
     }
 
     void writeAnswers() const {
-        if (options_.answersFile.empty()) {
+        if (o_.answersFile.empty())
             return;
-        }
-        std::FILE* f = std::fopen(options_.answersFile.c_str(), "w");
+        std::FILE* f = std::fopen(o_.answersFile.c_str(), "w");
         if (!f) {
-            std::perror(options_.answersFile.c_str());
+            std::perror(o_.answersFile.c_str());
             return;
         }
         for (const Answer& a : answers_) {
@@ -169,118 +288,161 @@ class SoakClient {
         std::fclose(f);
     }
 
-    void report() const {
-        std::printf("done answered=%zu errors=%llu gone=%d\n", answers_.size(),
-                    static_cast<unsigned long long>(errors_), gone_ ? 1 : 0);
-        std::fflush(stdout);
-    }
-
-    void waitToBeKilled() {
-        if (!options_.keepSessions) {
-            return;
-        }
-        for (;;) {
-            pump(true);
-        }
-    }
-
-  private:
-    void send(std::size_t session) {
-        const std::int64_t rid = options_.firstID + static_cast<std::int64_t>(session);
-        const std::int64_t seq = nextSeq_[session]++;
-        Payload payload{
-            {"soak_rid", sdbus::Variant(rid)},
-            {"soak_seq", sdbus::Variant(seq)},
-            {"session_output_running", sdbus::Variant(true)},
-            {"route", sdbus::Variant(std::string("BuiltInSpeaker"))},
-            {"latency_ms", sdbus::Variant(11.6)},
-        };
-        if (!padding_.empty()) {
-            payload.emplace("padding", sdbus::Variant(padding_));
-        }
-        auto m = proxy_->createMethodCall(qv::dbus::kInterface, qv::dbus::kSendMessage);
-        // Playback/Start (category 4, type 1), addressed to this session alone.
-        m << payload << std::uint32_t{4} << std::uint16_t{1} << std::vector<std::int64_t>{rid};
-        ++inFlight_;
-        proxy_->callMethod(
-            m,
-            [this, rid, seq](sdbus::MethodReply&, const sdbus::Error* error) {
-                --inFlight_;
-                if (error) {
-                    ++errors_;
-                    // Anything but a refusal of this one call means the daemon went away.
-                    const std::string name = error->getName();
-                    if (name != qv::dbus::kErrorLimitsExceeded &&
-                        name != qv::dbus::kErrorInvalidArgs) {
-                        gone_ = true;
-                    }
-                    return;
-                }
-                answers_.push_back(Answer{rid, seq, monotonicNanos()});
-                if (static_cast<std::int64_t>(answers_.size()) % options_.progressEvery == 0) {
-                    std::printf("progress %zu\n", answers_.size());
-                    std::fflush(stdout);
-                }
-            },
-            std::uint64_t{120} * 1000000);
-    }
-
-    void callBool(const char* member, std::int64_t rid) {
-        auto m = proxy_->createMethodCall(qv::dbus::kInterface, member);
-        m << rid;
-        proxy_->callMethod(m);
-    }
-
-    // Dispatches what has arrived; with wait, first waits up to 100 ms for something to.
-    void pump(bool wait) {
-        while (connection_->processPendingRequest()) {
-        }
-        if (!wait) {
-            return;
-        }
-        const auto data = connection_->getEventLoopPollData();
-        pollfd fd{data.fd, data.events, 0};
-        ::poll(&fd, 1, 100);
-        while (connection_->processPendingRequest()) {
-        }
-    }
-
-    const Options options_;
-    std::unique_ptr<sdbus::IConnection> connection_;
-    std::unique_ptr<sdbus::IProxy> proxy_;
+    const Options o_;
+    sd_bus* bus_;
     const std::string padding_;
     std::vector<std::int64_t> nextSeq_;
-    std::vector<sdbus::PendingAsyncCall> heldStarts_;
     std::vector<Answer> answers_;
     std::size_t inFlight_ = 0;
-    std::uint64_t errors_ = 0;
+    long errors_ = 0;
     bool gone_ = false;
 };
+
+int sessions(const Options& o) {
+    sd_bus* bus = connect(o.address);
+    const double begin = now();
+    for (long i = 0; i < o.count; ++i) {
+        // Answers are read by the final call's wait and dropped.
+        sendCall(bus, idCall(bus, kCreateReportingSession, o.firstID + i), true);
+        sendCall(bus, idCall(bus, kStartReportingSession, o.firstID + i), true);
+    }
+    barrier(bus);
+    std::printf("sessions %ld seconds %.3f\n", o.count, now() - begin);
+    std::fflush(stdout);
+    pause();  // the sessions live as long as the connection
+    return 0;
+}
+
+int held(const Options& o) {
+    sd_bus* bus = connect(o.address);
+    sendCall(bus, idCall(bus, kCreateReportingSession, o.firstID), false);
+    sendCall(bus, idCall(bus, kStartReportingSession, o.firstID), false);
+    for (long i = 0; i < o.count; ++i) {
+        sendCall(bus, idCall(bus, kStartReportingSession, o.firstID), false);
+        if (i % 1024 == 0)
+            flush(bus);
+    }
+    barrier(bus);
+    std::printf("held %ld\n", o.count);
+    std::fflush(stdout);
+    pause();
+    return 0;
+}
+
+int sends(const Options& o) {
+    sd_bus* bus = connect(o.address);
+    sendCall(bus, idCall(bus, kCreateReportingSession, o.firstID), false);
+    sendCall(bus, idCall(bus, kStartReportingSession, o.firstID), false);
+    std::string text(static_cast<std::size_t>(o.bytes), 'x');
+    for (long i = 0; i < o.count; ++i) {
+        std::snprintf(text.data(), 20, "%019ld", i);  // every payload different
+        text[19] = 'x';
+        sd_bus_message* m = newCall(bus, kSendMessage);
+        int r = sd_bus_message_append(m, "a{sv}", 1, "blob", "s", text.c_str());
+        if (r >= 0)
+            r = sd_bus_message_append(m, "uqax", 4u, std::uint16_t{1}, 1, o.firstID);
+        if (r < 0)
+            die("append", r);
+        sendCall(bus, m, true);  // a reply is expected and never read
+    }
+    flush(bus);
+    std::printf("sent %ld\n", o.count);
+    std::fflush(stdout);
+    pause();
+    return 0;
+}
+
+// Times one call and waits until it is answered; false when it was answered with an error.
+bool timedCall(sd_bus* bus, sd_bus_message* m, std::vector<double>& waits) {
+    sd_bus_error error = SD_BUS_ERROR_NULL;
+    sd_bus_message* reply = nullptr;
+    const double t = now();
+    const int r = sd_bus_call(bus, m, 120 * 1000000ull, &error, &reply);
+    waits.push_back((now() - t) * 1000);
+    sd_bus_message_unref(m);
+    sd_bus_message_unref(reply);
+    sd_bus_error_free(&error);
+    return r >= 0;
+}
+
+std::string percentiles(std::vector<double> waits) {
+    std::sort(waits.begin(), waits.end());
+    auto at = [&](double q) {
+        return waits.empty() ? 0.0 : waits[static_cast<std::size_t>(q * (waits.size() - 1))];
+    };
+    char text[128];
+    std::snprintf(text, sizeof text, "p50_ms=%.2f p99_ms=%.2f max_ms=%.2f", at(0.5), at(0.99),
+                  waits.empty() ? 0.0 : waits.back());
+    return text;
+}
+
+// Alternates a call to the daemon with one to the bus itself (GetId, answered by the broker): the
+// second is the baseline, what any client of this bus waits whatever the daemon does.
+int probe(const Options& o) {
+    sd_bus* bus = connect(o.address);
+    std::vector<double> daemonWaits, brokerWaits;
+    long refused = 0;
+    const double end = now() + o.seconds;
+    while (now() < end) {
+        refused += timedCall(bus, idCall(bus, kReporterIDValid, 1), daemonWaits) ? 0 : 1;
+        sd_bus_message* getId = nullptr;
+        if (const int r = sd_bus_message_new_method_call(bus, &getId, "org.freedesktop.DBus",
+                                                         "/org/freedesktop/DBus",
+                                                         "org.freedesktop.DBus", "GetId");
+            r < 0) {
+            die("new call", r);
+        }
+        timedCall(bus, getId, brokerWaits);
+        usleep(10000);
+    }
+    std::printf("probe calls=%zu refused=%ld daemon %s; bus itself %s\n", daemonWaits.size(),
+                refused, percentiles(daemonWaits).c_str(), percentiles(brokerWaits).c_str());
+    return 0;
+}
 
 }  // namespace
 
 int main(int argc, char** argv) {
-    Options options;
-    if (!parse(argc, argv, options)) {
-        std::fprintf(stderr,
-                     "usage: %s --address ADDR --first-id ID [--sessions N] [--messages N] "
-                     "[--depth N] [--padding BYTES] [--progress N] [--answers FILE] "
-                     "[--keep-sessions]\n",
-                     argv[0]);
+    Options o;
+    const std::map<std::string, std::function<void(const std::string&)>> set{
+        {"--address", [&](const std::string& v) { o.address = v; }},
+        {"--first-id", [&](const std::string& v) { o.firstID = std::stoll(v); }},
+        {"--sessions", [&](const std::string& v) { o.sessions = std::stol(v); }},
+        {"--messages", [&](const std::string& v) { o.messages = std::stol(v); }},
+        {"--depth", [&](const std::string& v) { o.depth = std::stoul(v); }},
+        {"--padding", [&](const std::string& v) { o.padding = std::stoul(v); }},
+        {"--progress", [&](const std::string& v) { o.progressEvery = std::stol(v); }},
+        {"--answers", [&](const std::string& v) { o.answersFile = v; }},
+        {"--count", [&](const std::string& v) { o.count = std::stol(v); }},
+        {"--bytes", [&](const std::string& v) { o.bytes = std::stol(v); }},
+        {"--seconds", [&](const std::string& v) { o.seconds = std::stod(v); }},
+    };
+    for (int i = 1; i < argc; ++i) {
+        const std::string a = argv[i];
+        if (a == "--keep-sessions") {
+            o.keepSessions = true;
+        } else if (a.rfind("--", 0) != 0) {
+            o.mode = a;
+        } else if (set.count(a) && i + 1 < argc) {
+            set.at(a)(argv[++i]);
+        } else {
+            std::fprintf(stderr, "soak client: unknown option %s, or no value\n", a.c_str());
+            return 2;
+        }
+    }
+    if (o.address.empty() || o.sessions <= 0 || o.depth == 0 || o.progressEvery <= 0) {
+        std::fprintf(stderr, "soak client: --address is required, and counts must be positive\n");
         return 2;
     }
-    try {
-        SoakClient client(options);
-        client.beginSessions();
-        client.sendAll();
-        client.writeAnswers();
-        client.endSessions();
-        client.report();
-        client.waitToBeKilled();
-    } catch (const sdbus::Error& e) {
-        std::fprintf(stderr, "soak client %lld: %s: %s\n", static_cast<long long>(options.firstID),
-                     e.getName().c_str(), e.getMessage().c_str());
-        return 1;
+    const std::map<std::string, std::function<int(const Options&)>> modes{
+        {"load", [](const Options& options) { return LoadClient(options).run(); }},
+        {"sessions", sessions},
+        {"held", held},
+        {"sends", sends},
+        {"probe", probe}};
+    if (!modes.count(o.mode)) {
+        std::fprintf(stderr, "soak client: unknown mode '%s'\n", o.mode.c_str());
+        return 2;
     }
-    return 0;
+    return modes.at(o.mode)(o);
 }
