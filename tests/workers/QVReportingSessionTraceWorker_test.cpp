@@ -336,20 +336,5 @@ TEST_F(ATraceWorker, KeepsItsResultsInsideTheDiagnosticLogDirectory) {
     EXPECT_EQ(results[0].filename(), "%2E.%2F..%2Fetc%2Fresults.gdj");
 }
 
-TEST_F(ATraceWorker, TakesCallbacksFromTheRecordersThreadWhileTheQueueWaits) {
-    // The real semaphore, and a recorder that answers from threads of its own.
-    QVReportingWorkerRegistry::TEST_reset({&makeWorkerClass<Worker>()});
-    fake.spanTrace.startAnswer = test::FakeSpanTraceRecorder::Answer::FromThread;
-    fake.spanTrace.stopAnswer = test::FakeSpanTraceRecorder::Answer::FromThread;
-    for (int run = 0; run < 3; ++run) {
-        auto session = make(service::kTest, config());
-        session->start();
-        session->stop();
-    }
-    fake.spanTrace.joinThreads();
-    EXPECT_EQ(fake.gaugeData.files.size(), 3u);
-    EXPECT_EQ(written().size(), 12u);
-}
-
 }  // namespace
 }  // namespace qv
