@@ -1,13 +1,7 @@
 #include "monitoring/QVReportingDriverUtility.h"
 
-#include <gtest/gtest.h>
-
 #include <limits>
-#include <string>
-#include <vector>
 
-#include "fakes/FakePlatform.h"
-#include "fakes/MemoryLogSink.h"
 #include "monitoring/QVReportingSessionDriverSnapshotWorker.h"
 #include "workers/WorkerTestSupport.h"
 #include "workers/backends/QVReportingSessionMetricsHubWorker.h"

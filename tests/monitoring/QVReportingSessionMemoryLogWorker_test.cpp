@@ -1,12 +1,5 @@
 #include "monitoring/QVReportingSessionMemoryLogWorker.h"
 
-#include <gtest/gtest.h>
-
-#include <string>
-#include <vector>
-
-#include "fakes/FakePlatform.h"
-#include "fakes/MemoryLogSink.h"
 #include "session/QVReportingStats.h"
 #include "workers/WorkerTestSupport.h"
 

@@ -1,12 +1,5 @@
 #include "workers/backends/BTAccess.h"
 
-#include <gtest/gtest.h>
-
-#include <string>
-#include <vector>
-
-#include "fakes/FakePlatform.h"
-#include "fakes/MemoryLogSink.h"
 #include "workers/WorkerTestSupport.h"
 
 namespace qv {

@@ -1,14 +1,9 @@
 #include "workers/backends/QVReportingSessionAudioRegistrationWorker.h"
 
-#include <gtest/gtest.h>
-
 #include <cstdlib>
 #include <ctime>
-#include <string>
 #include <thread>
 
-#include "fakes/FakePlatform.h"
-#include "fakes/MemoryLogSink.h"
 #include "workers/WorkerTestSupport.h"
 #include "workers/backends/BaseUnit.h"
 

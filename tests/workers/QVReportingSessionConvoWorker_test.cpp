@@ -1,13 +1,7 @@
 #include "workers/backends/QVReportingSessionConvoWorker.h"
 
-#include <gtest/gtest.h>
-
-#include <string>
 #include <thread>
-#include <vector>
 
-#include "fakes/FakePlatform.h"
-#include "fakes/MemoryLogSink.h"
 #include "session/QVReportingStats.h"
 #include "workers/WorkerTestSupport.h"
 #include "workers/backends/QVReportingSessionMetricsHubWorker.h"

@@ -1,13 +1,7 @@
 #include "workers/backends/QVReportingSessionEnergyLogWorker.h"
 
-#include <gtest/gtest.h>
-
 #include <cmath>
-#include <string>
-#include <vector>
 
-#include "fakes/FakePlatform.h"
-#include "fakes/MemoryLogSink.h"
 #include "workers/WorkerTestSupport.h"
 
 namespace qv {

@@ -1,12 +1,5 @@
 #include "workers/diagnostics/QVReportingSessionICXWorker.h"
 
-#include <gtest/gtest.h>
-
-#include <string>
-#include <vector>
-
-#include "fakes/FakePlatform.h"
-#include "fakes/MemoryLogSink.h"
 #include "platform/IssueCaptureService.h"
 #include "workers/WorkerTestSupport.h"
 #include "workers/diagnostics/QVReportingICXWorkerInstanceAlarmLowRMS.h"

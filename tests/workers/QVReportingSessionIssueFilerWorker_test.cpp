@@ -1,12 +1,5 @@
 #include "workers/diagnostics/QVReportingSessionIssueFilerWorker.h"
 
-#include <gtest/gtest.h>
-
-#include <memory>
-#include <string>
-
-#include "fakes/FakePlatform.h"
-#include "fakes/MemoryLogSink.h"
 #include "workers/WorkerTestSupport.h"
 
 namespace qv {

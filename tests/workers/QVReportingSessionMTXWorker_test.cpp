@@ -1,14 +1,9 @@
 #include "workers/backends/QVReportingSessionMTXWorker.h"
 
-#include <gtest/gtest.h>
-
 #include <cmath>
 #include <cstdint>
 #include <limits>
-#include <string>
-#include <vector>
 
-#include "fakes/FakePlatform.h"
 #include "workers/WorkerTestSupport.h"
 #include "workers/backends/mtx/AudioIssueDetected.h"
 

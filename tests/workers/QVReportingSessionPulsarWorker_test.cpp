@@ -1,14 +1,8 @@
 #include "workers/diagnostics/QVReportingSessionPulsarWorker.h"
 
-#include <gtest/gtest.h>
-
 #include <chrono>
 #include <cmath>
-#include <memory>
-#include <vector>
 
-#include "fakes/FakePlatform.h"
-#include "fakes/MemoryLogSink.h"
 #include "workers/WorkerTestSupport.h"
 
 namespace qv {

@@ -1,14 +1,8 @@
 #include "workers/diagnostics/QVReportingSessionTraceWorker.h"
 
-#include <gtest/gtest.h>
-
 #include <fstream>
-#include <string>
-#include <vector>
 
 #include "fakes/FakeClockSemaphore.h"
-#include "fakes/FakePlatform.h"
-#include "fakes/MemoryLogSink.h"
 #include "fakes/TempDirectory.h"
 #include "workers/WorkerTestSupport.h"
 
