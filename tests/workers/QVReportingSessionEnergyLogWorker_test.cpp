@@ -50,15 +50,9 @@ TEST_F(AnEnergyLogWorker, RebuildsOneMessageIntoUpToThreeRecordsInAFixedOrder) {
     EXPECT_EQ(*events[0].payload.find("TimestampEnd"), Value(stamp));
     EXPECT_EQ(events[1].payload.find("Status")->kind(), Value::Kind::Int);
 
-    // None of the keys, or another type holding them all: nothing, and no log line.
+    // None of the keys: nothing, and no log line. (Another type: the sink's end-to-end test.)
     fake.energyLog.clear();
     session->sendMessage(message({{"EngineOnTimeX", 1}, {"enginestate", "EngineOn"}}));
-    for (AudioEventType t : {type::kGeneric, type::kIssueDetector, AudioEventType{9}}) {
-        session->sendMessage(message({{"EngineOnTime", 1},
-                                      {"EngineState", "EngineOn"},
-                                      {"Haptic_Active_Hardware_Time_Seconds", 2}},
-                                     t));
-    }
     EXPECT_TRUE(fake.energyLog.events().empty());
     EXPECT_TRUE(test::errorTexts(*log, "qvrp").empty());
 }
