@@ -24,11 +24,10 @@ class AConvoWorker : public ::testing::Test {
     void TearDown() override { run(); }
 
     std::shared_ptr<QVReportingSession> started(AudioServiceType type, ReporterID id = 42,
-                                                const Dictionary* configuration = nullptr) {
-        auto s = QVReportingSession::initWithID(fake.platform, id, {1234});
-        s->setServiceType(type);
-        s->updateConfigurationWithContentsOfConfiguration(configuration);
-        s->start();
+                                                std::optional<Dictionary> configuration = {}) {
+        auto s = test::makeSession(
+            fake.platform,
+            {.id = id, .serviceType = type, .configuration = configuration, .start = true});
         run();
         return s;
     }
@@ -68,7 +67,7 @@ TEST_F(AConvoWorker, DescribesTheSessionToTheServiceByServiceTypeConfigurationAn
     auto apiUsage = started(service::kAPIUsage, 43);
     const Dictionary configuration{
         {"KXHostApplicationDisplayID", "com.example.app"}, {"ServiceName", "mine"}, {"n", 7}};
-    auto configured = started(service::kTelephony, 44, &configuration);
+    auto configured = started(service::kTelephony, 44, configuration);
     auto single = test::makeSession(
         fake.platform,
         {.id = 1, .pids = {1}, .serviceType = service::kAlerts, .single = true, .start = true});

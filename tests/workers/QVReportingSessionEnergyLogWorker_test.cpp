@@ -10,12 +10,11 @@ namespace {
 class AnEnergyLogWorker : public ::testing::Test {
   protected:
     std::shared_ptr<QVReportingSession> make(const char* appName) {
-        auto session = QVReportingSession::initWithID(fake.platform, 7, {1234});
-        if (appName != nullptr) {
-            const Dictionary config{{"KXHostApplicationDisplayID", appName}};
-            session->updateConfigurationWithContentsOfConfiguration(&config);
-        }
-        return session;
+        return test::makeSession(
+            fake.platform,
+            {.configuration =
+                 appName ? std::optional<Dictionary>({{"KXHostApplicationDisplayID", appName}})
+                         : std::nullopt});
     }
     static std::shared_ptr<QVReportingSessionMessage> message(
         Dictionary payload, AudioEventType t = type::kEnergyLog,

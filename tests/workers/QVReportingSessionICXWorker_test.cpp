@@ -11,14 +11,6 @@ namespace {
 
 using test::send;
 
-class CapableDevice : public test::FakeDeviceInformation {
-  public:
-    bool hasCapability(std::string_view capability) const override {
-        return haptics && capability == "haptics";
-    }
-    bool haptics = true;
-};
-
 // A detector of the test's own, to drive the counting rule with any thresholds: interested in
 // messages that hold "probe", it records each fire.
 struct ProbeSettings {
@@ -60,7 +52,8 @@ class AnICXWorker : public ::testing::Test {
     void SetUp() override {
         QVReportingICXSharedStates::TEST_reset();
         QVReportingICXWorkerInstanceSSSLeaks::TEST_resetLastRequest();
-        device.internalBuild = true;
+        fake.device.internalBuild = true;
+        fake.device.haptics = true;
         Probe::fires = 0;
     }
     void TearDown() override { QVReportingICXSharedStates::TEST_reset(); }
@@ -68,12 +61,12 @@ class AnICXWorker : public ::testing::Test {
     std::shared_ptr<QVReportingSession> make(AudioServiceType serviceType, ReporterID id = 7,
                                              std::vector<std::int64_t> pids = {1234},
                                              bool single = false) {
-        return test::makeSession(platform, {.id = id,
-                                            .pids = std::move(pids),
-                                            .serviceType = serviceType,
-                                            .processName = "alarmd",
-                                            .single = single,
-                                            .start = true});
+        return test::makeSession(fake.platform, {.id = id,
+                                                 .pids = std::move(pids),
+                                                 .serviceType = serviceType,
+                                                 .processName = "alarmd",
+                                                 .single = single,
+                                                 .start = true});
     }
     static std::shared_ptr<QVReportingSessionICXWorker> icx(const QVReportingSession& session) {
         return test::workerOf<QVReportingSessionICXWorker>(session);
@@ -92,15 +85,13 @@ class AnICXWorker : public ::testing::Test {
 
     test::ScopedWorkerClasses<QVReportingSessionICXWorker> workerClasses;
     test::FakePlatform fake;
-    CapableDevice device;
-    Platform platform = fake.with({.device = &device});
 };
 
 TEST_F(AnICXWorker, ExistsOnInternalBuildsOnlyWithItsDetectorsInOrder) {
-    device.internalBuild = false;
+    fake.device.internalBuild = false;
     EXPECT_EQ(icx(*make(service::kAlarms)), nullptr);
 
-    test::setInternalBuild(device, true);
+    test::setInternalBuild(fake.device, true);
     auto withHaptics = icx(*make(service::kAlarms));
     ASSERT_NE(withHaptics, nullptr);
     EXPECT_EQ(names(*withHaptics),
@@ -111,13 +102,13 @@ TEST_F(AnICXWorker, ExistsOnInternalBuildsOnlyWithItsDetectorsInOrder) {
     EXPECT_TRUE(withHaptics->started());
     EXPECT_TRUE(withHaptics->handleRedundantMessages());
 
-    device.haptics = false;
+    fake.device.haptics = false;
     EXPECT_EQ(names(*icx(*make(service::kAlarms))),
               (std::vector<std::string>{"QVReportingICXWorkerInstanceAlarmLowRMS",
                                         "QVReportingICXWorkerInstanceTemberDestroyRecordQueue",
                                         "QVReportingICXWorkerInstanceSSSLeaks"}));
 
-    device.haptics = true;
+    fake.device.haptics = true;
     auto single = icx(*make(service::kStandalone, 1, {1}, /*single=*/true));
     ASSERT_NE(single, nullptr);
     EXPECT_EQ(names(*single), (std::vector<std::string>{"QVReportingICXWorkerInstanceHapticLeaks",
