@@ -86,9 +86,8 @@ TEST_F(AConvoWorker, DescribesTheSessionToTheServiceByServiceTypeConfigurationAn
     // apiusage goes in real time.
     EXPECT_EQ(*fake.convo.sessions[1]->sessionInfo.find("BatchEvent"), Value(false));
     EXPECT_EQ(*fake.convo.sessions[1]->sessionInfo.find("ContainsRealtimeEvents"), Value(true));
-    // Every configuration entry goes to user info (overwriting), the host app to session info.
-    EXPECT_EQ(*fake.convo.sessions[2]->sessionInfo.find("ClientBundleID"),
-              Value("com.example.app"));
+    // Every configuration entry goes to user info (overwriting). (The host app in session info:
+    // the convo end-to-end test.)
     const auto& user = fake.convo.sessions[2]->userInfo;
     EXPECT_EQ(keysOf(user), (std::vector<std::string>{"ClientName", "QVReportingSessionID",
                                                       "ServiceName", "HostApplicationDisplayID",
