@@ -105,7 +105,6 @@ TEST_F(ATraceWorker, RecordsATestSessionAndWritesEveryEventInMillisecondsDepthFi
     auto session = make(service::kTest, config());
     auto w = worker(session);
     ASSERT_TRUE(w->start());
-    EXPECT_TRUE(w->started());
     ASSERT_EQ(fake.spanTrace.sessions.size(), 1u);
     const auto& recording = *fake.spanTrace.sessions[0];
     EXPECT_EQ(recording.configuration.templateNumber, 2);
