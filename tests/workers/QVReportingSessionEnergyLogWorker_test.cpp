@@ -10,11 +10,8 @@ namespace {
 class AnEnergyLogWorker : public ::testing::Test {
   protected:
     std::shared_ptr<QVReportingSession> make(const char* appName) {
-        return test::makeSession(
-            fake.platform,
-            {.configuration =
-                 appName ? std::optional<Dictionary>({{"KXHostApplicationDisplayID", appName}})
-                         : std::nullopt});
+        return test::makeSession(fake.platform,
+                                 {.configuration = {{{"KXHostApplicationDisplayID", appName}}}});
     }
     static std::shared_ptr<QVReportingSessionMessage> message(
         Dictionary payload, AudioEventType t = type::kEnergyLog,
@@ -78,12 +75,11 @@ TEST_F(AnEnergyLogWorker, GivesStatusOneOnlyForTheExactStringEngineOn) {
 TEST_F(AnEnergyLogWorker, TreatsAMissingOrUnknownAppNameAndTimestampDifferentlyPerRecord) {
     struct Case {
         const char* what;
-        const char* configuredName;  // null: none configured
+        const char* configuredName;
         bool sessionGone;
         const char* clientStatusName;  // ApplicationName of the ClientStatus record; null: none
     };
-    for (const auto& c : std::vector<Case>{{"no name configured", nullptr, false, "Unknown"},
-                                           {"the name Unknown", "Unknown", false, "Unknown"},
+    for (const auto& c : std::vector<Case>{{"the name Unknown", "Unknown", false, "Unknown"},
                                            {"session gone", "com.example", true, nullptr}}) {
         test::ScopedMemoryLog log;
         fake.energyLog.clear();
