@@ -17,12 +17,15 @@ class FakeDeviceInformation : public DeviceInformation {
         }
         return std::nullopt;
     }
-    bool hasCapability(std::string_view) const override { return false; }
+    bool hasCapability(std::string_view capability) const override {
+        return haptics && capability == "haptics";
+    }
 
     std::filesystem::path diagnosticLogsDirectory() const override { return logsDirectory; }
 
     std::optional<bool> internalBuild;
     std::filesystem::path logsDirectory = "/nonexistent/logs";
+    bool haptics = false;       // the one capability asked for
     mutable int questions = 0;  // how often the device was asked
 };
 

@@ -31,16 +31,12 @@ class FakeIssueCaptureService : public IssueCaptureService {
         Dictionary makeSignature(std::string_view domain, std::string_view type,
                                  std::string_view subtype, std::string_view subtypeContext,
                                  std::string_view detectedProcess,
-                                 const std::optional<Dictionary>& thresholdValues) override {
-            Dictionary s{{std::string(kIssueCaptureSignatureDomain), domain},
-                         {std::string(kIssueCaptureSignatureType), type},
-                         {std::string(kIssueCaptureSignatureSubtype), subtype},
-                         {std::string(kIssueCaptureSignatureSubtypeContext), subtypeContext},
-                         {std::string(kIssueCaptureSignatureDetectedProcess), detectedProcess}};
-            if (thresholdValues) {
-                s.set(kIssueCaptureSignatureThresholdValues, *thresholdValues);
-            }
-            return s;
+                                 const std::optional<Dictionary>&) override {
+            return {{std::string(kIssueCaptureSignatureDomain), domain},
+                    {std::string(kIssueCaptureSignatureType), type},
+                    {std::string(kIssueCaptureSignatureSubtype), subtype},
+                    {std::string(kIssueCaptureSignatureSubtypeContext), subtypeContext},
+                    {std::string(kIssueCaptureSignatureDetectedProcess), detectedProcess}};
         }
         bool snapshotWithSignature(const Dictionary& signature, double duration,
                                    const std::optional<Dictionary>&,

@@ -1,11 +1,10 @@
-// An IssueFiler service in memory: it records the process of every draft it is asked to create
-// and answers the completion at once with `error` (none by default), on the caller's thread.
+// An IssueFiler service in memory: it counts the drafts it is asked to create and answers the
+// completion at once with `error` (none by default), on the caller's thread.
 #pragma once
 
 #include <mutex>
 #include <optional>
 #include <string>
-#include <vector>
 
 #include "platform/IssueFilerService.h"
 
@@ -13,16 +12,12 @@ namespace qv::test {
 
 class FakeIssueFilerService : public IssueFilerService {
   public:
-    struct Request {
-        std::string processName;
-    };
-
-    void createDraft(const IssueDraft&, std::string_view processName, std::string_view,
+    void createDraft(const IssueDraft&, std::string_view, std::string_view,
                      Completion completion) override {
         std::optional<std::string> answer;
         {
             std::lock_guard lock(mutex_);
-            requests.push_back({std::string(processName)});
+            ++count_;
             answer = error;
         }
         if (completion) {
@@ -32,14 +27,14 @@ class FakeIssueFilerService : public IssueFilerService {
 
     std::size_t count() const {
         std::lock_guard lock(mutex_);
-        return requests.size();
+        return count_;
     }
 
     std::optional<std::string> error;
-    std::vector<Request> requests;
 
   private:
     mutable std::mutex mutex_;
+    std::size_t count_ = 0;
 };
 
 }  // namespace qv::test

@@ -1,5 +1,5 @@
-// A metrics service in memory: it keeps the wire bytes of every record posted, with its metric
-// identifier, as the Linux service would write them.
+// A metrics service in memory: it keeps the wire bytes of every record posted, as the Linux
+// service would write them.
 #pragma once
 
 #include <cstdint>
@@ -14,15 +14,14 @@ namespace qv::test {
 class FakeMTXMetricsService : public MTXMetricsService {
   public:
     struct Posted {
-        std::uint32_t metricID;
         std::string wire;
     };
 
-    void postMetric(std::uint32_t metricID, const MTXMetricRecord& record) override {
+    void postMetric(std::uint32_t, const MTXMetricRecord& record) override {
         std::string wire;
         record.appendWireBytes(wire);
         std::lock_guard lock(mutex_);
-        posted_.push_back({metricID, std::move(wire)});
+        posted_.push_back({std::move(wire)});
     }
 
     std::vector<Posted> posted() const {

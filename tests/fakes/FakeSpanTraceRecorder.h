@@ -1,7 +1,7 @@
 // A performance-trace recorder in memory. Each recording answers its start and its stop either at
-// once on the caller's thread (the default), from a thread of its own (as the real recorder
-// does), or never (the test plays a recorder that hangs). A failed start completes at once with
-// an error, as the recorder's contract says. Everything asked is recorded.
+// once on the caller's thread (the default) or never (the test plays a recorder that hangs). A
+// failed start completes at once with an error, as the recorder's contract says. Everything asked
+// is recorded. (Answers from the recorder's own threads: the trace end-to-end test.)
 #pragma once
 
 #include <filesystem>
@@ -9,7 +9,6 @@
 #include <mutex>
 #include <optional>
 #include <string>
-#include <thread>
 #include <vector>
 
 #include "platform/SpanTraceRecorder.h"
@@ -18,7 +17,7 @@ namespace qv::test {
 
 class FakeSpanTraceRecorder : public SpanTraceRecorder {
   public:
-    enum class Answer { Now, FromThread, Never };
+    enum class Answer { Now, Never };
 
     class Session : public SpanTraceSession {
       public:
@@ -86,7 +85,6 @@ class FakeSpanTraceRecorder : public SpanTraceRecorder {
         }
 
         const SpanTraceConfiguration configuration;
-        // Read under the recorder's lock() while callbacks may run.
         int starts = 0;
         int stops = 0;
 
@@ -103,8 +101,6 @@ class FakeSpanTraceRecorder : public SpanTraceRecorder {
         std::weak_ptr<SpanTraceDelegate> delegate_;  // guarded by mutex_
         bool valid_ = false;                         // guarded by recorder_.mutex_
     };
-
-    ~FakeSpanTraceRecorder() override { joinThreads(); }
 
     std::shared_ptr<SpanTraceConfiguration> configurationFromTemplate(int number) override {
         std::lock_guard lock(mutex_);
@@ -125,19 +121,6 @@ class FakeSpanTraceRecorder : public SpanTraceRecorder {
         return session;
     }
 
-    // Waits for the answers given from threads.
-    void joinThreads() {
-        std::vector<std::thread> threads;
-        {
-            std::lock_guard lock(mutex_);
-            threads.swap(threads_);
-        }
-        for (auto& t : threads) {
-            t.join();
-        }
-    }
-    std::unique_lock<std::mutex> lock() { return std::unique_lock(mutex_); }
-
     // Settings, set before the worker runs.
     Answer startAnswer = Answer::Now;
     Answer stopAnswer = Answer::Now;
@@ -146,7 +129,7 @@ class FakeSpanTraceRecorder : public SpanTraceRecorder {
     std::optional<std::string> completeError;
     std::optional<std::filesystem::path> traceLocation;
 
-    // What was asked (read under lock()).
+    // What was asked.
     std::vector<int> templatesAsked;
     std::vector<std::shared_ptr<Session>> sessions;
 
@@ -155,14 +138,10 @@ class FakeSpanTraceRecorder : public SpanTraceRecorder {
     void answer(Answer how, F callbacks) {
         if (how == Answer::Now) {
             callbacks();
-        } else if (how == Answer::FromThread) {
-            std::lock_guard lock(mutex_);
-            threads_.emplace_back(std::move(callbacks));
         }
     }
 
     mutable std::mutex mutex_;
-    std::vector<std::thread> threads_;  // guarded by mutex_
 };
 
 }  // namespace qv::test

@@ -21,9 +21,6 @@ class FakeStatFeed : public StatFeed {
         std::uint64_t simple = 0;
         std::vector<StatFeedState> states;
         std::vector<StatFeedBucket> buckets;
-        std::int64_t minimum = 0;
-        std::int64_t maximum = 0;
-        bool unreadable = false;  // left out of samples
     };
 
     // Publishes a channel and returns its id.
@@ -119,16 +116,11 @@ class FakeStatFeed : public StatFeed {
         samples->uptime = uptime_;
         for (const std::uint64_t id : dynamic_cast<const Subscription&>(subscription).ids) {
             const Reading& r = readings_.at(id);
-            if (r.unreadable) {
-                continue;
-            }
             StatFeedChannel c;
             c.info = channels_[id - 1];
             c.simple = r.simple;
             c.states = r.states;
             c.buckets = r.buckets;
-            c.minimum = r.minimum;
-            c.maximum = r.maximum;
             samples->channels.push_back(std::move(c));
         }
         if (samples->channels.empty()) {

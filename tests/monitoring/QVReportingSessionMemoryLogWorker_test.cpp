@@ -1,12 +1,5 @@
 #include "monitoring/QVReportingSessionMemoryLogWorker.h"
 
-#include <gtest/gtest.h>
-
-#include <string>
-#include <vector>
-
-#include "fakes/FakePlatform.h"
-#include "fakes/MemoryLogSink.h"
 #include "session/QVReportingStats.h"
 #include "workers/WorkerTestSupport.h"
 
@@ -125,19 +118,13 @@ class AMemoryLogWorker : public ::testing::Test {
 };
 
 TEST_F(AMemoryLogWorker, ExistsInTestSessionsEverywhereAndInAllSessionsOnInternalBuilds) {
-    // Made with the session only where it applies then; a test session gets it at start, when
-    // its service type is known.
+    // Made with the session only where it applies then. (That a test session of a customer build
+    // gets it at start: the memory-log end-to-end test.)
     fake.device.internalBuild = false;
     auto alarms = test::makeSession(
         fake.platform, {.id = 1, .pids = {99}, .serviceType = service::kAlarms, .start = true});
     EXPECT_EQ(alarms->workerInstanceCount(), 0u);
-
-    auto test = QVReportingSession::initWithID(fake.platform, 2, {99});
-    EXPECT_EQ(test->workerInstanceCount(), 0u);
-    test->setServiceType(service::kTest);
-    test->start();
-    ASSERT_EQ(test->consumingMessageWorkers().size(), 1u);
-    EXPECT_TRUE(test->consumingMessageWorkers()[0]->started());
+    EXPECT_EQ(QVReportingSession::initWithID(fake.platform, 2, {99})->workerInstanceCount(), 0u);
 
     test::setInternalBuild(fake.device, true);
     auto internal = QVReportingSession::initWithID(fake.platform, 3, {99});
@@ -202,13 +189,7 @@ TEST_F(AMemoryLogWorker, ReportsMissingToolsAndCutShortOnesAndUsesTheSettings) {
     ASSERT_EQ(limits.size(), 2u);
     EXPECT_EQ(limits[0].timeout, std::chrono::seconds(60));  // clamped
     EXPECT_EQ(limits[0].maxOutputBytes, 4096u);
-
-    // A tool the shell cannot find prints nothing and is no capture either.
-    fake.processLauncher.script("kzone -l", {{}, {Ending::NotExecutable, 127}});
-    fake.clock.advance(6.0);
-    s->sendMessage(request());
-    EXPECT_TRUE(log->contains("wiredlog: unable to execute 'kzone -l'"));
-    EXPECT_EQ(blocks().size(), 1u);
+    // (A tool the shell cannot find: the memory-log end-to-end test.)
 }
 
 }  // namespace

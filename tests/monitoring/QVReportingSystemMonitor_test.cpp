@@ -1,8 +1,5 @@
 #include "monitoring/QVReportingSystemMonitor.h"
 
-#include <gtest/gtest.h>
-
-#include "fakes/FakePlatform.h"
 #include "monitoring/QVReportingSessionSystemMonitorWorker.h"
 #include "session/SerialQueue.h"
 #include "workers/WorkerTestSupport.h"

@@ -1,10 +1,6 @@
 #include "workers/backends/QVReportingConvoSessionSummary.h"
 
-#include <gtest/gtest.h>
-
 #include <limits>
-#include <string>
-#include <vector>
 
 #include "values/FrozenPayloads.h"
 #include "workers/WorkerTestSupport.h"

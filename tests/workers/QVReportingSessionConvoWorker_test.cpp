@@ -1,13 +1,7 @@
 #include "workers/backends/QVReportingSessionConvoWorker.h"
 
-#include <gtest/gtest.h>
-
-#include <string>
 #include <thread>
-#include <vector>
 
-#include "fakes/FakePlatform.h"
-#include "fakes/MemoryLogSink.h"
 #include "session/QVReportingStats.h"
 #include "workers/WorkerTestSupport.h"
 #include "workers/backends/QVReportingSessionMetricsHubWorker.h"
@@ -30,11 +24,10 @@ class AConvoWorker : public ::testing::Test {
     void TearDown() override { run(); }
 
     std::shared_ptr<QVReportingSession> started(AudioServiceType type, ReporterID id = 42,
-                                                const Dictionary* configuration = nullptr) {
-        auto s = QVReportingSession::initWithID(fake.platform, id, {1234});
-        s->setServiceType(type);
-        s->updateConfigurationWithContentsOfConfiguration(configuration);
-        s->start();
+                                                std::optional<Dictionary> configuration = {}) {
+        auto s = test::makeSession(
+            fake.platform,
+            {.id = id, .serviceType = type, .configuration = configuration, .start = true});
         run();
         return s;
     }
@@ -74,7 +67,7 @@ TEST_F(AConvoWorker, DescribesTheSessionToTheServiceByServiceTypeConfigurationAn
     auto apiUsage = started(service::kAPIUsage, 43);
     const Dictionary configuration{
         {"KXHostApplicationDisplayID", "com.example.app"}, {"ServiceName", "mine"}, {"n", 7}};
-    auto configured = started(service::kTelephony, 44, &configuration);
+    auto configured = started(service::kTelephony, 44, configuration);
     auto single = test::makeSession(
         fake.platform,
         {.id = 1, .pids = {1}, .serviceType = service::kAlerts, .single = true, .start = true});
@@ -93,9 +86,8 @@ TEST_F(AConvoWorker, DescribesTheSessionToTheServiceByServiceTypeConfigurationAn
     // apiusage goes in real time.
     EXPECT_EQ(*fake.convo.sessions[1]->sessionInfo.find("BatchEvent"), Value(false));
     EXPECT_EQ(*fake.convo.sessions[1]->sessionInfo.find("ContainsRealtimeEvents"), Value(true));
-    // Every configuration entry goes to user info (overwriting), the host app to session info.
-    EXPECT_EQ(*fake.convo.sessions[2]->sessionInfo.find("ClientBundleID"),
-              Value("com.example.app"));
+    // Every configuration entry goes to user info (overwriting). (The host app in session info:
+    // the convo end-to-end test.)
     const auto& user = fake.convo.sessions[2]->userInfo;
     EXPECT_EQ(keysOf(user), (std::vector<std::string>{"ClientName", "QVReportingSessionID",
                                                       "ServiceName", "HostApplicationDisplayID",

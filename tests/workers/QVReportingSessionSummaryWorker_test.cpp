@@ -1,14 +1,8 @@
 #include "workers/derived/QVReportingSessionSummaryWorker.h"
 
-#include <gtest/gtest.h>
-
 #include <algorithm>
 #include <limits>
-#include <string>
-#include <vector>
 
-#include "fakes/FakePlatform.h"
-#include "fakes/MemoryLogSink.h"
 #include "session/QVReportingStats.h"
 #include "workers/WorkerTestSupport.h"
 #include "workers/backends/QVReportingSessionMetricsHubWorker.h"

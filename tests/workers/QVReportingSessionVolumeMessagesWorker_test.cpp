@@ -1,11 +1,8 @@
 #include "workers/derived/QVReportingSessionVolumeMessagesWorker.h"
 
-#include <gtest/gtest.h>
-
 #include <limits>
 #include <tuple>
 
-#include "fakes/FakePlatform.h"
 #include "workers/WorkerTestSupport.h"
 
 namespace qv::test {
@@ -35,12 +32,8 @@ TEST(AVolumeMessagesWorker, ReportsEachStretchClosedByStopDurationOrAWatchedChan
         // Per derived message: play time, its label, entries the payload must hold.
         std::vector<std::tuple<double, std::string, Dictionary>> out;
     };
+    // (A volume change closing a stretch: the report's end-to-end test of the playback example.)
     const std::vector<Case> cases = {
-        {"a change closes a stretch and opens the next at once",
-         {},
-         {on(0, 0.3), set(40, "KXSessionVolume", 0.7), off(100)},
-         {{40, "30", {{"KXSessionVolume", 0.3}, {"KXSessionVolumeBucketed", "0.3125"}}},
-          {60, "60", {{"KXSessionVolume", 0.7}, {"KXSessionVolumeBucketed", "0.6875"}}}}},
         {"the minimum is exclusive; a tie buckets up",
          {},
          {on(0, 0.03125), off(0.5), on(1), off(1.625)},

@@ -10,7 +10,7 @@
 #include <string>
 #include <vector>
 
-#include "fakes/FakeDeviceInformation.h"
+#include "fakes/FakePlatform.h"
 #include "fakes/MemoryLogSink.h"
 #include "session/QVReportingSession.h"
 #include "session/QVReportingSessionWorker.h"
