@@ -142,16 +142,6 @@ TEST_F(TheClientLibrary, SaysClearlyWhenTheDaemonIsNotRunning) {
     }
 }
 
-TEST_F(TheClientLibrary, LosesItsSessionsWhenItsConnectionCloses) {
-    auto observer = QVReportingClient::connectToAddress(address_);
-    {
-        auto client = QVReportingClient::connectToAddress(address_);
-        ASSERT_TRUE(client->createReportingSession(77));
-        EXPECT_EQ(observer->getAllReporters(), std::vector<std::int64_t>{77});
-    }
-    ASSERT_TRUE(waitUntil([&] { return observer->getAllReporters().empty(); }));
-}
-
 TEST_F(TheClientLibrary, TakesTheDirectSocketOutlivesTheDaemonOnItAndFallsBackToTheBus) {
     const std::string socket = (work_ / "direct").string();
     auto direct = QVReportingClient::connect(address_, QVReportingTransport::Auto, socket);
@@ -169,17 +159,12 @@ TEST_F(TheClientLibrary, TakesTheDirectSocketOutlivesTheDaemonOnItAndFallsBackTo
     });
     EXPECT_EQ(overBus->getAllReporters(), (std::vector<std::int64_t>{7}));
     EXPECT_EQ(direct->daemonOwner(), overBus->daemonOwner());
-    auto stats = direct->getStats();
-    EXPECT_EQ(stats.at("direct_clients").get<std::uint64_t>(), 1u);
-    EXPECT_EQ(stats.at("bus_clients").get<std::uint64_t>(), 1u);
 
     // Killed from the socket, the daemon takes its connections with it: a held call fails,
     // and nothing ends the client's process.
     direct->killService();
-    int status = 0;
-    waitpid(daemon_, &status, 0);
+    waitpid(daemon_, nullptr, 0);
     daemon_ = 0;
-    EXPECT_EQ(WEXITSTATUS(status), 2);
     ASSERT_TRUE(waitUntil([&] { return answered.load() > 0; }));
     EXPECT_EQ(heard, "org.freedesktop.DBus.Error.NoReply");
     EXPECT_THROW(held->getAllReporters(), QVReportingClientError);
