@@ -123,7 +123,6 @@ TEST(ALinuxSpanTraceRecorder, ReportsAFailedStartOnItsOwnThreadWhereThereIsNoTra
     session->setDelegate(delegate);
     session->start();
     recorder.drain();
-    EXPECT_EQ(delegate->calls.size(), 2u);
     EXPECT_NE(delegate->thread, std::this_thread::get_id()) << "callbacks come on its thread";
     EXPECT_FALSE(session->isValid());
 
