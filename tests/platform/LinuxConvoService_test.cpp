@@ -67,8 +67,6 @@ TEST_F(ALinuxConvoService, AnswersFromItsSuiteReadAfreshAtEveryQuestion) {
         EXPECT_EQ(configure(*session).first, std::nullopt) << none.description();
     }
 
-    preferences.setValue(suite, "Enabled", false);
-    EXPECT_EQ(service.newHierarchyTokenFromParentToken(std::nullopt), std::nullopt);
     preferences.setValue(suite, "Enabled", "YES");
     EXPECT_TRUE(service.newHierarchyTokenFromParentToken(std::nullopt));
 }
@@ -87,11 +85,8 @@ TEST_F(ALinuxConvoService, NumbersItsSessionsAndWritesEachOnesSessionIDOrANull) 
     EXPECT_EQ(got[0]["session"], 1);
     EXPECT_EQ(got[1]["session"], 2);
     EXPECT_EQ(got[2]["sessionID"], 42);
-    EXPECT_EQ(got[3]["session"], 2);
     EXPECT_TRUE(got[3]["sessionID"].is_null());
     EXPECT_EQ(got[3]["category"], 65535);
-    EXPECT_EQ(got[4]["op"], "flush");
-    EXPECT_EQ(got[4]["session"], 1);
 }
 
 }  // namespace

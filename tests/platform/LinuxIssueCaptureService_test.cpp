@@ -116,7 +116,6 @@ TEST_F(ALinuxIssueCaptureService, KeepsTheDailyLimitOverARollingDayAcrossRestart
     set(LinuxIssueCaptureService::kEnabledKey, false);
     EXPECT_EQ(reason(snapshot(signature("S11"))), kIssueCaptureErrorNotSupported);
 
-    EXPECT_EQ(std::ranges::count(refused.lines(), "kIssueCaptureErrorDailyLimitExceeded"), 3);
     EXPECT_EQ(std::distance(fs::directory_iterator(captures()), fs::directory_iterator()), 4);
 }
 

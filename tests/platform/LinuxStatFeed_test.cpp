@@ -29,18 +29,14 @@ TEST_F(TheLinuxStatFeed, ReportsWhatMovedOnALaptopBetweenTwoSnapshotsAndNothingE
     QVReportingDriverUtility utility(feed);
     // Every driver group but the platform's own engine has channels here.
     EXPECT_EQ(utility.ioChannelSubscriptions().size(), 8u);
-    EXPECT_TRUE(log->contains("couldn't find any channels for driver group KorvaneAE2MCA-(null)"));
 
     const auto start = utility.getSnapShot();
     ASSERT_EQ(start.size(), 8u);
 
-    fx.setNetCounter("wlp0s20f3", "rx_bytes", 1000 + 2 * 17 + 1500);
     fx.setNetCounter("lo", "tx_packets", 1000 + 22 * 17 + 3);
     fx.setNetCounter("enp0s31f6", "rx_errors", 5);  // went backwards: reset, not negative
-    fx.setPcmRunning(0, "pcm0p", 96000 + 48000);    // one second at 48 kHz
     fx.setPcmRunning(2, "pcm0p", 4800);             // the speaker opened
     fx.setPcmClosed(1, "pcm1c");                    // the microphone closed: back to 0
-    fx.setInterrupts(LaptopSysfsFixture::kHdaIrq, 510);
     fx.setInterrupts(LaptopSysfsFixture::kDmicIrq, 501);
     fx.setInterrupts(LaptopSysfsFixture::kSpeakerIrq, 502);
     fx.setInterrupts(LaptopSysfsFixture::kHapticsIrq, 503);
@@ -53,14 +49,10 @@ TEST_F(TheLinuxStatFeed, ReportsWhatMovedOnALaptopBetweenTwoSnapshotsAndNothingE
     const Dictionary expectedSimple{
         {"Speaker_Speaker_IOAudio2_Simple_pcm0psub0frames", 4800},
         {"Speaker_Speaker_IOAudio2_Simple_pcm0psub0ms", 100},
-        {"sndhdaintel:card0_irq_MCA_Simple_irq147", 40},
         {"dmic-pdm_pdm_irq_Simple_irq149", 4},
         {"tas2781-speaker_Speaker_irq_Simple_irq150", 8},
         {"cs40l26-haptics_Haptics_Stats_Simple_irq151", 12},
-        {"wlp0s20f3_Rx_Simple_rxbytes", 1500},
         {"lo_Tx_Simple_txpackets", 3},
-        {"PCH_Tx_IOAudio2_Simple_pcm0psub0frames", 48000},
-        {"PCH_Tx_IOAudio2_Simple_pcm0psub0ms", 1000},
     };
     EXPECT_EQ(stats.simple, expectedSimple);
     EXPECT_EQ(stats.histogram,
