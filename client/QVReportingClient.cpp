@@ -64,9 +64,12 @@ struct Waiter {
     T wait() { return promise.get_future().get(); }
 };
 
-// The call failed because the connection itself ended (the daemon on its far end left).
+// The call failed because the connection itself ended (the daemon on its far end left). When
+// the far end closes before the call is sent, sd-bus fails it with ENOTCONN or EPIPE, which
+// carry no D-Bus name of their own.
 bool isConnectionGone(const QVReportingClientError& e) {
-    return e.name() == kErrorNoReply || e.name() == kErrorDisconnected;
+    return e.name() == kErrorNoReply || e.name() == kErrorDisconnected ||
+           e.name() == "System.Error.ENOTCONN" || e.name() == "System.Error.EPIPE";
 }
 
 QVReportingClientError notRunningError() {
