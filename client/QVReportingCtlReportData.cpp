@@ -259,7 +259,10 @@ class Gatherer {
 
     void diagnostic(const std::string& sink, double time, const Json& line) {
         const std::string op = text(line, "op");
-        if (sink == "issuecapture" && (op == "snapshot" || op == "session")) {
+        // A request the service refused (throttled, over the daily limit) has no sessionID: no
+        // capture was taken for it.
+        if (sink == "issuecapture" && (op == "snapshot" || op == "session") &&
+            line.contains("sessionID")) {
             const Json& signature = line.value("signature", Json::object());
             captures_.push_back({ReportIssue::Kind::kCapture,
                                  time,

@@ -80,7 +80,7 @@ class TheReportData : public ::testing::Test {
         // A capture the music session asked for at its stop, written after the stop.
         write(
             "issuecapture.jsonl", 1, 111,
-            R"("op":"snapshot","signature":{"type":"longformaudio","subtype":"Playback","subtypeContext":"EnergyLog"})");
+            R"("op":"snapshot","signature":{"type":"longformaudio","subtype":"Playback","subtypeContext":"EnergyLog"},"sessionID":"a")");
         // Second run: session number 1 again, a haptics session that asked for a capture and was
         // never flushed (the daemon was killed).
         convo(
@@ -92,6 +92,10 @@ class TheReportData : public ::testing::Test {
         convo(204, R"("op":"message","session":1,"category":"Volume","type":null,"payload":[])");
         write(
             "issuecapture.jsonl", 2, 202,
+            R"("op":"snapshot","signature":{"type":"haptics","subtype":"Playback","subtypeContext":"EnergyLog"},"sessionID":"b")");
+        // The same asked for again and refused as too soon: no capture.
+        write(
+            "issuecapture.jsonl", 3, 202.5,
             R"("op":"snapshot","signature":{"type":"haptics","subtype":"Playback","subtypeContext":"EnergyLog"})");
         write("mtx.jsonl", 1, 201,
               R"("metric":5963779,"record":"EAMaB3NpbGVuY2UiAjEyKhFjb20uZXhhbXBsZS5yYWNlcg==")");
