@@ -69,8 +69,16 @@ class ClusterTestCase(unittest.TestCase):
         started = time.monotonic()
         self.exporter.wait_caught_up(expected, timeout)
         caught_up = time.monotonic() - started
-        lines = StreamComparison(self.cluster.urls, self.state, list(expected),
-                                 settle=30).check(self)
+        comparison = StreamComparison(self.cluster.urls, self.state, list(expected), settle=30)
+        try:
+            lines = comparison.check(self)
+        except AssertionError as e:
+            # Tells a line stored twice from one read twice, and a line never stored from one
+            # not read: the count each node's copy of the stream holds beside the lines read.
+            stored = {node.name: node.stream_messages(STREAM) for node in self.cluster.nodes}
+            read = sum(len(in_stream) for in_stream, _ in comparison.by_sink.values())
+            raise AssertionError(f"{e}\nthe stream holds {stored} messages by node; "
+                                 f"{read} lines were read from it") from e
         self.assertEqual(lines, sum(expected.values()))
         wait_until(lambda: all((self.exporter.status() or {}).get("sinks", {}).get(s, {}).get(
             "cursor") == seq for s, seq in expected.items()), timeout=30, what="the status")
