@@ -24,6 +24,9 @@ constexpr const char* kErrorAccessDenied = "org.freedesktop.DBus.Error.AccessDen
 constexpr const char* kErrorNoReply = "org.freedesktop.DBus.Error.NoReply";
 constexpr const char* kErrorFailed = "org.freedesktop.DBus.Error.Failed";
 constexpr const char* kErrorDisconnected = "org.freedesktop.DBus.Error.Disconnected";
+// What sd-bus names errnos it has no D-Bus name for.
+constexpr const char* kErrorNotConnected = "System.Error.ENOTCONN";
+constexpr const char* kErrorBrokenPipe = "System.Error.EPIPE";
 
 constexpr const char* kBusDaemonName = "org.freedesktop.DBus";
 constexpr const char* kBusDaemonPath = "/org/freedesktop/DBus";
@@ -69,7 +72,7 @@ struct Waiter {
 // carry no D-Bus name of their own.
 bool isConnectionGone(const QVReportingClientError& e) {
     return e.name() == kErrorNoReply || e.name() == kErrorDisconnected ||
-           e.name() == "System.Error.ENOTCONN" || e.name() == "System.Error.EPIPE";
+           e.name() == kErrorNotConnected || e.name() == kErrorBrokenPipe;
 }
 
 QVReportingClientError notRunningError() {
