@@ -86,7 +86,7 @@ void onAck(jsCtx*, natsMsg* msg, jsPubAck* ack, jsPubAckErr* error, void* closur
             // is lost if the leader goes before it is, so this is no proof; sent again later.
             callbacks.failed(sink, seq, "a duplicate of a line the stream has not stored yet");
         } else if (ack) {
-            callbacks.acknowledged(sink, seq, ack->Duplicate);
+            callbacks.acknowledged(sink, seq, ack->Sequence, ack->Duplicate);
         } else {
             std::string text =
                 error ? QVReportingExportNatsError(error->Err) : "no acknowledgement";

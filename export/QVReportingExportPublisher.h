@@ -30,8 +30,10 @@ namespace qv::exporter {
 class QVReportingExportPublisher {
   public:
     struct Callbacks {
-        // The stream stored seq (duplicate: it held it already).
-        std::function<void(std::string_view sink, std::uint64_t seq, bool duplicate)> acknowledged;
+        // The stream stored seq as its message streamSeq (duplicate: it held it already).
+        std::function<void(std::string_view sink, std::uint64_t seq, std::uint64_t streamSeq,
+                           bool duplicate)>
+            acknowledged;
         // Publishing seq failed (server error, time-out, connection lost).
         std::function<void(std::string_view sink, std::uint64_t seq, const std::string& error)>
             failed;

@@ -112,8 +112,9 @@ QVReportingExportShipper::QVReportingExportShipper(QVReportingExportSettings set
     stats_.servers = settings_.server.urls;
     stats_.started = wallClock();
     QVReportingExportPublisher::Callbacks callbacks;
-    callbacks.acknowledged = [this](std::string_view sink, std::uint64_t seq, bool duplicate) {
-        acknowledged(sink, seq, duplicate);
+    callbacks.acknowledged = [this](std::string_view sink, std::uint64_t seq,
+                                    std::uint64_t streamSeq, bool duplicate) {
+        acknowledged(sink, seq, streamSeq, duplicate);
     };
     callbacks.failed = [this](std::string_view sink, std::uint64_t seq, const std::string& error) {
         failed(sink, seq, error);
@@ -328,16 +329,28 @@ void QVReportingExportShipper::abandonLateLines(Clock::time_point now) {
         const auto failed = sink->window.failAll();
         stats_.sinks[name].failed += failed;
         inFlight_ -= failed;
+        if (settings_.logAnswers && failed > 0) {
+            log(name + ": " + std::to_string(failed) +
+                " lines in flight given up on, to be sent again from seq " +
+                std::to_string(sink->window.cursor() + 1));
+        }
     }
     noteFailureLocked("no acknowledgement within " + std::to_string(settings_.ackWait.count()) +
                       " ms");
 }
 
 void QVReportingExportShipper::acknowledged(std::string_view name, std::uint64_t seq,
-                                            bool duplicate) {
+                                            std::uint64_t streamSeq, bool duplicate) {
     std::lock_guard lock(mutex_);
     const auto sink = sinks_.find(name);
-    if (sink == sinks_.end() || !sink->second->window.acknowledge(seq)) {
+    const bool awaited = sink != sinks_.end() && sink->second->window.acknowledge(seq);
+    if (settings_.logAnswers) {
+        logAnswer(name, seq,
+                  "stored as stream message " + std::to_string(streamSeq) +
+                      (duplicate ? " (a duplicate)" : ""),
+                  awaited);
+    }
+    if (!awaited) {
         return;
     }
     auto& counters = stats_.sinks[sink->first];
@@ -358,12 +371,22 @@ void QVReportingExportShipper::failed(std::string_view name, std::uint64_t seq,
                                       const std::string& error) {
     std::lock_guard lock(mutex_);
     const auto sink = sinks_.find(name);
-    if (sink == sinks_.end() || !sink->second->window.fail(seq)) {
+    const bool awaited = sink != sinks_.end() && sink->second->window.fail(seq);
+    if (settings_.logAnswers) {
+        logAnswer(name, seq, "failed: " + error, awaited);
+    }
+    if (!awaited) {
         return;
     }
     ++stats_.sinks[sink->first].failed;
     --inFlight_;
     noteFailureLocked(error);
+}
+
+void QVReportingExportShipper::logAnswer(std::string_view sink, std::uint64_t seq,
+                                         const std::string& answer, bool awaited) {
+    log(std::string(sink) + " " + std::to_string(seq) + ": " + answer +
+        (awaited ? "" : "; not awaited any more, ignored"));
 }
 
 void QVReportingExportShipper::noteFailureLocked(const std::string& error) {

@@ -45,6 +45,8 @@ struct QVReportingExportSettings {
     std::size_t maxPending = 4096;
     // A line in flight for longer counts as failed, and so does everything then in flight.
     std::chrono::milliseconds ackWait{5000};
+    // Logs the stream's answer to every line: to follow one that went missing.
+    bool logAnswers = false;
 };
 
 class QVReportingExportShipper {
@@ -75,8 +77,12 @@ class QVReportingExportShipper {
     void saveCursor();
     void writeStatus();
 
-    void acknowledged(std::string_view sink, std::uint64_t seq, bool duplicate);
+    void acknowledged(std::string_view sink, std::uint64_t seq, std::uint64_t streamSeq,
+                      bool duplicate);
     void failed(std::string_view sink, std::uint64_t seq, const std::string& error);
+    // With --log-answers: what the stream answered for one line, and whether it was awaited.
+    static void logAnswer(std::string_view sink, std::uint64_t seq, const std::string& answer,
+                          bool awaited);
     // REQUIRES: mutex_ held.
     void noteFailureLocked(const std::string& error);
 

@@ -60,6 +60,8 @@ int run(int argc, char** argv) {
                    "Duplicate window of a stream this makes (longer than any resend)")
         ->check(CLI::Range(10, 7 * 24 * 3600))
         ->capture_default_str();
+    app.add_flag("--log-answers", settings.logAnswers,
+                 "Logs the stream's answer to every line: where it stored it, or why not");
     try {
         app.parse(argc, argv);
     } catch (const CLI::ParseError& e) {

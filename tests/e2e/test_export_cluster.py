@@ -3,6 +3,7 @@ replicated three times, through faults while lines keep arriving: the stream's l
 and a new one elected, and every server down for 30 s then back. Each ends with every line on
 disk in the stream exactly once, in seq order per sink."""
 
+import collections
 import shutil
 import signal
 import tempfile
@@ -44,7 +45,10 @@ class ClusterTestCase(unittest.TestCase):
         self.cluster = Cluster(self.workdir)
         self.cluster.start()
         self.sinks = [SinkFiles(self.state, "analytics"), SinkFiles(self.state, "convo")]
-        self.exporter = Exporter(self.workdir, self.state, self.cluster.urls, "--replicas", "3")
+        # Every answer of the stream is logged, so that a line lost or stored twice can be
+        # followed through them.
+        self.exporter = Exporter(self.workdir, self.state, self.cluster.urls, "--replicas", "3",
+                                 "--log-answers")
         self.writer = None
 
     def tearDown(self):
@@ -78,11 +82,23 @@ class ClusterTestCase(unittest.TestCase):
             stored = {node.name: node.stream_messages(STREAM) for node in self.cluster.nodes}
             read = sum(len(in_stream) for in_stream, _ in comparison.by_sink.values())
             raise AssertionError(f"{e}\nthe stream holds {stored} messages by node; "
-                                 f"{read} lines were read from it") from e
+                                 f"{read} lines were read from it; the stream's answers for "
+                                 f"the first lines at fault:\n{self.answers(comparison)}") from e
         self.assertEqual(lines, sum(expected.values()))
         wait_until(lambda: all((self.exporter.status() or {}).get("sinks", {}).get(s, {}).get(
             "cursor") == seq for s, seq in expected.items()), timeout=30, what="the status")
         return lines, caught_up, self.exporter.status()["sinks"]
+
+    def answers(self, comparison):
+        """The exporter's log lines about the first few lines missing or stored twice, and
+        about the lines in flight it gave up on."""
+        at_fault = [(sink, seq) for sink, seqs in comparison.missing().items() for seq in seqs[:3]]
+        for sink, (in_stream, _) in comparison.by_sink.items():
+            counts = collections.Counter(seq for seq, _ in in_stream)
+            at_fault += [(sink, seq) for seq in sorted(s for s, n in counts.items() if n > 1)[:3]]
+        prefixes = tuple(f"qvreport-export: {sink} {seq}:" for sink, seq in at_fault)
+        return "".join(line for line in self.exporter.log().splitlines(True)
+                       if line.startswith(prefixes) or "given up on" in line)
 
     @staticmethod
     def totals(status):
