@@ -6,10 +6,8 @@
 #include <sys/resource.h>
 
 #include <fstream>
-#include <iterator>
 
 #include "fakes/TempDirectory.h"
-#include "values/ValueJson.h"
 #include "workers/WorkerTestSupport.h"
 
 namespace qv {
@@ -23,12 +21,8 @@ class ASummaryJsonFileWorker : public ::testing::Test {
   protected:
     void SetUp() override { fake.device.logsDirectory = logs.path(); }
 
-    std::shared_ptr<QVReportingSession> make(AudioServiceType serviceType,
-                                             const std::string& appName = "com.example.rec") {
-        return test::makeSession(fake.platform,
-                                 {.id = 42,
-                                  .serviceType = serviceType,
-                                  .configuration = {{{"KXHostApplicationDisplayID", appName}}}});
+    std::shared_ptr<QVReportingSession> make(AudioServiceType serviceType) {
+        return test::makeSession(fake.platform, {.id = 42, .serviceType = serviceType});
     }
     std::vector<fs::path> files() const { return test::filesIn(logs / "Audio/Reporting"); }
 
@@ -37,42 +31,8 @@ class ASummaryJsonFileWorker : public ::testing::Test {
     test::FakePlatform fake;
 };
 
-TEST_F(ASummaryJsonFileWorker, WritesEachStoredMessageOnceUnderItsCountedKindAsAJsonArray) {
-    auto session = make(service::kTest);
-    session->start();
-    for (int n : {1, 2, 2}) {  // the repeat is redundant: not written
-        send(*session, {{"n", n}}, category::kPlayback, type::kStart);
-    }
-    send(*session, {{"v", 0.5}, {"text", "a \"quoted\"\nline"}}, category::kVolume, type::kSummary);
-    EXPECT_TRUE(files().empty()) << "nothing is written before the stop";
-    session->stop();
-
-    const auto written = files();
-    ASSERT_EQ(written.size(), 1u);
-    // "yyyyMMdd-HHmmss" and the zone ("+hhmm" or "-hhmm"), then the session's own parts.
-    const std::string name = written[0].filename().string();
-    EXPECT_EQ(test::timeStampShape(name), "99999999+999999+9999") << name;
-    EXPECT_EQ(name.substr(20), "-42-com.example.rec-test.json");
-
-    std::ifstream in(written[0]);
-    const std::string text((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
-    EXPECT_EQ(text.rfind("[\n{\n", 0), 0u);
-    EXPECT_NE(text.find("}\n,\n{\n"), std::string::npos);
-    EXPECT_EQ(text.substr(text.size() - 4), "}\n]\n");
-    const auto array = nlohmann::ordered_json::parse(text);
-    std::vector<std::string> members;
-    for (const auto& element : array) {
-        ASSERT_EQ(element.size(), 1u);
-        members.push_back(element.begin().key());
-    }
-    EXPECT_EQ(members,
-              (std::vector<std::string>{"Setup_Start_1", "Playback_Start_1", "Playback_Start_2",
-                                        "Volume_Summary_1", "Setup_Stop_1"}));
-    const Dictionary volume = QVReportingDictionaryFromJson(array[3]["Volume_Summary_1"]);
-    EXPECT_EQ(*volume.find("text"), Value("a \"quoted\"\nline"));
-    EXPECT_EQ(*volume.find("isSessionStarted"), Value("YES"));
-}
-
+// The file a test session's stop writes, its name and what it holds: the end-to-end test of
+// derived messages.
 TEST_F(ASummaryJsonFileWorker, ExistsOnlyForTestSessionsOrInternalBuildsAndOnlyWithMessages) {
     fake.device.internalBuild = false;
     EXPECT_FALSE(QVReportingSessionSummaryJsonFileWorker::initWithSession(make(service::kGeneric)));
