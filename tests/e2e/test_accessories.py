@@ -117,8 +117,8 @@ class AccessoryTestCase(unittest.TestCase):
                    and l["userInfo"].get("ClientName") == "Earlink_Telemetry"}
         return [l for l in lines if l["session"] in reports]
 
-    def session_with_trigger(self, client, rid):
-        client.create(rid, service_type=1)
+    def session_with_trigger(self, client, rid, config=None):
+        client.create(rid, service_type=1, config=config)
         client.start(rid)
         client.send({"active_devices": TRIGGER}, ROUTE_CHANGE, 0, [rid])
         self.assertTrue(client.stop(rid))
@@ -170,12 +170,21 @@ class Publication(AccessoryTestCase):
         self.start_daemon(2)
         client = self.client()
         before = time.time()
-        self.session_with_trigger(client, 200)
+        self.session_with_trigger(client, 200, {"KXHostApplicationDisplayID": "com.example.app"})
 
         messages = wait_until(lambda: [l for l in self.convo() if l["op"] == "message"],
                               what="the publication")
         sessions = [l for l in self.convo() if l["op"] == "session"]
         self.assertEqual([s["sessionInfo"]["SessionID"] for s in sessions], [200])
+        # A session of its own, never batched, under the application the client named.
+        info = sessions[0]["sessionInfo"]
+        self.assertEqual((info["BatchEvent"], info["ClientBundleID"]), (False, "com.example.app"))
+        self.assertNotIn("ContainsRealtimeEvents", info)
+        self.assertIn("HierarchyToken", info)
+        self.assertEqual(list(sessions[0]["userInfo"].items()), [
+            ("ClientName", "Earlink_Telemetry"), ("ServiceName", "Earlink_Registration"),
+            ("HostApplicationDisplayID", "com.example.app"),
+            ("KXHostApplicationDisplayID", "com.example.app")])
         # Only the device seen connected is active; it goes out with a week, not a time.
         self.assertEqual(len(messages), 1)
         message = messages[0]
@@ -202,6 +211,7 @@ class NoBlueZ(AccessoryTestCase):
         self.assertIn("cannot reach the bus unix:path=", log)
         self.assertIn("Timed Out waiting for BT Manager init", log)
         self.assertNotIn("splunk", self.suite().get("ELRegistrationInfo", {}))
+        self.assertNotIn("AudioRegistrationNextInvocationEpoch", self.suite(), "nothing scheduled")
         self.assertIn(300, [int(r) for r in client.reporting.GetAllReporters()])
 
 
