@@ -199,6 +199,36 @@ class Publication(AccessoryTestCase):
                       "Let's publish to Convo!", self.daemon.log_text())
 
 
+class HostileDevices(AccessoryTestCase):
+    def test_what_bluez_claims_never_names_a_file_outside_the_directory(self):
+        # Files a hostile address could aim at, above the directory and in it.
+        good = {"TELPVersionInfo": version_info("K1"), "CaseInfo": {"CaseInfoVersion": "9"}}
+        with open(os.path.join(self.workdir, "passwd.json"), "w") as f:
+            json.dump({**good, "TELPVersionInfo": version_info("P")}, f)
+        with open(os.path.join(self.accessories, "AA:BB:CC:DD:EE:FF.json"), "w") as f:
+            json.dump(good, f)
+        generic = dbus.Interface(self.connection.get_object("org.bluez", "/"),
+                                 "org.freedesktop.DBus.Mock")
+        for name, address, paired in (("a", "../passwd", True), ("c", "aa:bb:cc:dd:ee:ff", True),
+                                      ("d", dbus.UInt32(7), True),
+                                      ("e", "AA:BB:CC:DD:EE:FF", "yes")):
+            generic.AddObject(f"/org/bluez/hci0/dev_{name}", "org.bluez.Device1", dbus.Dictionary(
+                {"Address": address, "Paired": paired, "Connected": True}, signature="sv"), [])
+        self.start_daemon(3)  # a Paired that is no boolean pairs nothing
+        self.session_with_trigger(self.client(), 400)
+
+        # Only the well-formed address, in any case, has the information of its own file.
+        suite = wait_until(lambda: "splunk" in self.suite().get("ELRegistrationInfo", {})
+                           and self.suite(), what="the registration in the suite")
+        self.assertEqual([e["AudioUUIDLeft"] for e in suite["ELRegistrationInfo"]["splunk"]],
+                         ["e11-K1"])
+        log = self.daemon.log_text()
+        self.assertEqual(log.count("which is not a Bluetooth address"), 1)
+        self.assertIn('dev_a has the address "../passwd", which is not a Bluetooth address', log)
+        self.assertIn("Address of /org/bluez/hci0/dev_d is not a string", log)
+        self.assertIn("Paired of /org/bluez/hci0/dev_e is not a boolean", log)
+
+
 class NoBlueZ(AccessoryTestCase):
     def test_without_bluez_the_daemon_serves_and_gathers_nothing(self):
         self.daemon = Daemon(self.bus, self.state, "--bluez-bus",
