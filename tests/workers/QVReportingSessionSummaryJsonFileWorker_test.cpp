@@ -2,11 +2,9 @@
 
 #include <nlohmann/json.hpp>
 
-#include <signal.h>
-#include <sys/resource.h>
-
 #include <fstream>
 
+#include "fakes/FileSizeLimit.h"
 #include "fakes/TempDirectory.h"
 #include "workers/WorkerTestSupport.h"
 
@@ -68,21 +66,14 @@ TEST_F(ASummaryJsonFileWorker, LogsFileErrorsAndLetsTheSessionGoOn) {
 }
 
 TEST_F(ASummaryJsonFileWorker, LeavesNoFileNorHalfOfOneWhenTheDiskIsFull) {
-    // A file size limit plays the full disk: a write past it fails (SIGXFSZ ignored: EFBIG).
     test::ScopedMemoryLog log;
-    fake.device.logsDirectory = logs.path();
-    const auto previous = ::signal(SIGXFSZ, SIG_IGN);
-    rlimit saved{};
-    ASSERT_EQ(::getrlimit(RLIMIT_FSIZE, &saved), 0);
     auto session = make(service::kTest);
     session->start();
     send(*session, {{"pad", std::string(4096, 'p')}}, category::kPlayback, type::kStart);
-    rlimit small = saved;
-    small.rlim_cur = 1024;
-    ASSERT_EQ(::setrlimit(RLIMIT_FSIZE, &small), 0);
-    session->stop();
-    ASSERT_EQ(::setrlimit(RLIMIT_FSIZE, &saved), 0);
-    ::signal(SIGXFSZ, previous);
+    {
+        test::FileSizeLimit full(1024);
+        session->stop();
+    }
     EXPECT_TRUE(files().empty()) << "neither the file nor its temporary one";
     EXPECT_TRUE(log->contains("SummaryJsonFileWorker failed to write line."));
     EXPECT_TRUE(log->contains("(no file left)"));
