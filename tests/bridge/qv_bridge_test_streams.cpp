@@ -1,8 +1,7 @@
 // A PipeWire client for the bridge's tests and benchmark: N playback streams of a quiet tone that
 // optionally change their own volume R times a second, or overrun their cycle (the process
 // callback takes longer than the quantum, so the graph's driver sees xruns).
-//   qv_bridge_test_streams [--streams N] [--seconds S] [--volume-rate R] [--overrun]
-//                          [--app-id ID] [--role ROLE]
+//   qv_bridge_test_streams [--streams N] [--seconds S] [--volume-rate R] [--overrun] [--app-id ID]
 #include <unistd.h>
 
 #include <cmath>
@@ -27,7 +26,6 @@ struct Options {
     double volumeRate = 0;
     bool overrun = false;
     std::string appID = "qv-test-streams";
-    std::string role = "Music";
 };
 
 struct Stream {
@@ -120,12 +118,10 @@ int main(int argc, char** argv) {
             o.overrun = true;
         } else if (arg == "--app-id" && hasValue) {
             o.appID = argv[++i];
-        } else if (arg == "--role" && hasValue) {
-            o.role = argv[++i];
         } else {
             std::fprintf(stderr,
-                         "usage: %s [--streams N] [--seconds S] [--volume-rate R] "
-                         "[--overrun] [--app-id ID] [--role ROLE]\n",
+                         "usage: %s [--streams N] [--seconds S] [--volume-rate R] [--overrun] "
+                         "[--app-id ID]\n",
                          argv[0]);
             return 2;
         }
@@ -142,10 +138,9 @@ int main(int argc, char** argv) {
     for (int i = 0; i < o.streams; ++i) {
         auto s = std::make_unique<Stream>();
         s->overrun = o.overrun;
-        pw_properties* props =
-            pw_properties_new(PW_KEY_MEDIA_TYPE, "Audio", PW_KEY_MEDIA_CATEGORY, "Playback",
-                              PW_KEY_MEDIA_ROLE, o.role.c_str(), PW_KEY_APP_ID, o.appID.c_str(),
-                              PW_KEY_NODE_LATENCY, "1024/48000", nullptr);
+        pw_properties* props = pw_properties_new(
+            PW_KEY_MEDIA_TYPE, "Audio", PW_KEY_MEDIA_CATEGORY, "Playback", PW_KEY_MEDIA_ROLE,
+            "Music", PW_KEY_APP_ID, o.appID.c_str(), PW_KEY_NODE_LATENCY, "1024/48000", nullptr);
         const std::string name = o.appID + "-" + std::to_string(i);
         s->stream = pw_stream_new_simple(loop, name.c_str(), props, &events, s.get());
         std::uint8_t buffer[1024];

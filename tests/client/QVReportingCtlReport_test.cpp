@@ -1,14 +1,12 @@
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
-#include <set>
 #include <string>
 
 #include <fmt/format.h>
 #include <gtest/gtest.h>
 
 #include "QVReportingCtlReportData.h"
-#include "QVReportingCtlReportPage.h"
 #include "fakes/TempDirectory.h"
 
 namespace qv::client {
@@ -224,42 +222,6 @@ TEST_F(TheReportData, KeepsWhatLiesFromSinceUpToUntilAndOneApplication) {
         EXPECT_EQ(data.empty(), c.sessions + c.playbacks + c.issues == 0) << what;
     }
     EXPECT_THROW(QVReportingCtlGatherReport((root_ / "sinks").string(), {}), std::runtime_error);
-}
-
-// The value of an attribute of the element that starts at `at`.
-std::string attribute(const std::string& page, std::size_t at, const std::string& name) {
-    const std::string key = " " + name + "=\"";
-    const auto begin = page.find(key, at) + key.size();
-    return page.substr(begin, page.find('"', begin) - begin);
-}
-
-TEST_F(TheReportData, MakesASelfContainedPageWhosePlotsCarryTheirPoints) {
-    const ReportCounters counters{nullptr, "no daemon runs on the system bus"};
-    const std::string page = QVReportingCtlRenderReportPage(gather(), root_.string(), counters, 0);
-    std::map<std::string, int> points;
-    for (auto at = page.find("<figure class=\"plot"); at != std::string::npos;
-         at = page.find("<figure class=\"plot", at + 1)) {
-        points[attribute(page, at, "id")] = std::stoi(attribute(page, at, "data-points"));
-    }
-    EXPECT_EQ(points, (std::map<std::string, int>{{"plot-sessions", 3},
-                                                  {"plot-usage-application", 2},
-                                                  {"plot-usage-device", 3},
-                                                  {"plot-volume", 3},
-                                                  {"plot-issues", 4}}));
-    // Five inline SVGs whose ids do not collide, and nothing fetched from elsewhere.
-    std::set<std::string> ids;
-    for (const char quote : {'\'', '"'}) {
-        const std::string key = std::string("id=") + quote;
-        for (auto at = page.find(key); at != std::string::npos; at = page.find(key, at + 1)) {
-            const auto begin = at + key.size();
-            const std::string id = page.substr(begin, page.find(quote, begin) - begin);
-            EXPECT_TRUE(ids.insert(id).second) << "id used twice: " << id;
-        }
-    }
-    EXPECT_NE(page.find("plot-volume-gnuplot_plot_1"), std::string::npos);
-    EXPECT_EQ(page.find("<?xml"), std::string::npos);
-    EXPECT_EQ(page.find("src="), std::string::npos);
-    EXPECT_EQ(page.find("href=\"http"), std::string::npos);
 }
 
 }  // namespace

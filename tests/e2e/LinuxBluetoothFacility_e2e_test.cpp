@@ -13,7 +13,6 @@
 #include <cstdio>
 #include <fstream>
 #include <string>
-#include <vector>
 
 #include <sdbus-c++/sdbus-c++.h>
 
@@ -27,7 +26,6 @@ namespace {
 using namespace std::chrono_literals;
 
 constexpr const char* kMock = "org.bluez.Mock";
-constexpr const char* kGenericMock = "org.freedesktop.DBus.Mock";
 
 // A private bus and, when asked, a mock BlueZ on it; both ended with the object.
 class PrivateBus {
@@ -107,23 +105,6 @@ class PrivateBus {
         mock_->callMethod(connected ? "ConnectDevice" : "DisconnectDevice")
             .onInterface(kMock)
             .withArguments("hci0", device);
-    }
-
-    // A Device1 object made by hand, with whatever properties a test wants BlueZ to claim.
-    void addRawDevice(const std::string& path, std::map<std::string, sdbus::Variant> properties) {
-        mock_->callMethod("AddObject")
-            .onInterface(kGenericMock)
-            .withArguments(
-                path, std::string("org.bluez.Device1"), properties,
-                std::vector<sdbus::Struct<std::string, std::string, std::string, std::string>>{});
-        std::map<std::string, std::map<std::string, sdbus::Variant>> interfaces{
-            {"org.bluez.Device1", properties}};
-        std::vector<sdbus::Variant> args{sdbus::Variant(sdbus::ObjectPath(path)),
-                                         sdbus::Variant(interfaces)};
-        mock_->callMethod("EmitSignal")
-            .onInterface(kGenericMock)
-            .withArguments(std::string("org.freedesktop.DBus.ObjectManager"),
-                           std::string("InterfacesAdded"), std::string("oa{sa{sv}}"), args);
     }
 
     std::string address;
@@ -223,48 +204,6 @@ TEST(TheLinuxBluetoothFacility, FollowsBlueZAndTheAccessoryDirectory) {
     ASSERT_TRUE(test::waitUntil([&] { return facility.TEST_syncCount() > syncs; }));
     EXPECT_TRUE(facility.available());
     EXPECT_TRUE(facility.pairedDevices().empty()) << "the new BlueZ has no devices yet";
-}
-
-TEST(TheLinuxBluetoothFacility, NeverLetsWhatBlueZClaimsNameAFileOutsideItsDirectory) {
-    PrivateBus bus;
-    ASSERT_FALSE(bus.address.empty()) << "no dbus-daemon";
-    test::TempDirectory root("qvaccessories");
-    std::filesystem::create_directory(root / "accessories");
-    const auto dir = root / "accessories";
-    // Files a hostile address could aim at, next to and above the directory.
-    std::ofstream(root / "passwd.json") << kGoodFile;
-    std::ofstream(dir / "AA:BB:CC:DD:EE:FF.json") << kGoodFile;
-    test::Notes log;
-    bus.startBlueZ();
-    LinuxBluetoothFacility facility(bus.address, dir.string(), noting(log));
-    ASSERT_TRUE(test::waitUntil([&] { return facility.available(); }));
-    bus.mock().callMethod("AddAdapter").onInterface(kMock).withArguments("hci0", "bench");
-
-    auto raw = [&](const std::string& path, sdbus::Variant address, sdbus::Variant paired) {
-        bus.addRawDevice(
-            path, {{"Address", address}, {"Paired", paired}, {"Connected", sdbus::Variant(true)}});
-    };
-    raw("/org/bluez/hci0/dev_a", sdbus::Variant(std::string("../passwd")), sdbus::Variant(true));
-    raw("/org/bluez/hci0/dev_c", sdbus::Variant(std::string("aa:bb:cc:dd:ee:ff")),
-        sdbus::Variant(true));
-    raw("/org/bluez/hci0/dev_d", sdbus::Variant(std::uint32_t{7}), sdbus::Variant(true));
-    raw("/org/bluez/hci0/dev_e", sdbus::Variant(std::string("AA:BB:CC:DD:EE:FF")),
-        sdbus::Variant(std::string("yes")));
-    ASSERT_TRUE(test::waitUntil([&] { return log.containing("is not a boolean") == 1; }));
-    ASSERT_TRUE(test::waitUntil([&] { return facility.pairedDevices().size() == 3; }));
-
-    // Only the well-formed address (in any case) has accessory information; the others are
-    // listed without any, each refusal logged; a Paired that is not a boolean pairs nothing.
-    // Which texts are addresses is the address parser's unit test.
-    for (const auto& d : facility.pairedDevices()) {
-        EXPECT_EQ(d.accessoryInformation.has_value(), d.identifier == "/org/bluez/hci0/dev_c")
-            << d.identifier;
-        EXPECT_TRUE(d.address.empty() || d.address == "AA:BB:CC:DD:EE:FF") << d.address;
-    }
-    EXPECT_EQ(log.containing("has the address \"../passwd\", which is not a Bluetooth address"),
-              1u);
-    EXPECT_EQ(log.containing("which is not a Bluetooth address"), 1u);
-    EXPECT_EQ(log.containing("Address of /org/bluez/hci0/dev_d is not a string"), 1u);
 }
 
 }  // namespace

@@ -117,8 +117,8 @@ class AccessoryTestCase(unittest.TestCase):
                    and l["userInfo"].get("ClientName") == "Earlink_Telemetry"}
         return [l for l in lines if l["session"] in reports]
 
-    def session_with_trigger(self, client, rid):
-        client.create(rid, service_type=1)
+    def session_with_trigger(self, client, rid, config=None):
+        client.create(rid, service_type=1, config=config)
         client.start(rid)
         client.send({"active_devices": TRIGGER}, ROUTE_CHANGE, 0, [rid])
         self.assertTrue(client.stop(rid))
@@ -170,12 +170,21 @@ class Publication(AccessoryTestCase):
         self.start_daemon(2)
         client = self.client()
         before = time.time()
-        self.session_with_trigger(client, 200)
+        self.session_with_trigger(client, 200, {"KXHostApplicationDisplayID": "com.example.app"})
 
         messages = wait_until(lambda: [l for l in self.convo() if l["op"] == "message"],
                               what="the publication")
         sessions = [l for l in self.convo() if l["op"] == "session"]
         self.assertEqual([s["sessionInfo"]["SessionID"] for s in sessions], [200])
+        # A session of its own, never batched, under the application the client named.
+        info = sessions[0]["sessionInfo"]
+        self.assertEqual((info["BatchEvent"], info["ClientBundleID"]), (False, "com.example.app"))
+        self.assertNotIn("ContainsRealtimeEvents", info)
+        self.assertIn("HierarchyToken", info)
+        self.assertEqual(list(sessions[0]["userInfo"].items()), [
+            ("ClientName", "Earlink_Telemetry"), ("ServiceName", "Earlink_Registration"),
+            ("HostApplicationDisplayID", "com.example.app"),
+            ("KXHostApplicationDisplayID", "com.example.app")])
         # Only the device seen connected is active; it goes out with a week, not a time.
         self.assertEqual(len(messages), 1)
         message = messages[0]
@@ -190,6 +199,36 @@ class Publication(AccessoryTestCase):
                       "Let's publish to Convo!", self.daemon.log_text())
 
 
+class HostileDevices(AccessoryTestCase):
+    def test_what_bluez_claims_never_names_a_file_outside_the_directory(self):
+        # Files a hostile address could aim at, above the directory and in it.
+        good = {"TELPVersionInfo": version_info("K1"), "CaseInfo": {"CaseInfoVersion": "9"}}
+        with open(os.path.join(self.workdir, "passwd.json"), "w") as f:
+            json.dump({**good, "TELPVersionInfo": version_info("P")}, f)
+        with open(os.path.join(self.accessories, "AA:BB:CC:DD:EE:FF.json"), "w") as f:
+            json.dump(good, f)
+        generic = dbus.Interface(self.connection.get_object("org.bluez", "/"),
+                                 "org.freedesktop.DBus.Mock")
+        for name, address, paired in (("a", "../passwd", True), ("c", "aa:bb:cc:dd:ee:ff", True),
+                                      ("d", dbus.UInt32(7), True),
+                                      ("e", "AA:BB:CC:DD:EE:FF", "yes")):
+            generic.AddObject(f"/org/bluez/hci0/dev_{name}", "org.bluez.Device1", dbus.Dictionary(
+                {"Address": address, "Paired": paired, "Connected": True}, signature="sv"), [])
+        self.start_daemon(3)  # a Paired that is no boolean pairs nothing
+        self.session_with_trigger(self.client(), 400)
+
+        # Only the well-formed address, in any case, has the information of its own file.
+        suite = wait_until(lambda: "splunk" in self.suite().get("ELRegistrationInfo", {})
+                           and self.suite(), what="the registration in the suite")
+        self.assertEqual([e["AudioUUIDLeft"] for e in suite["ELRegistrationInfo"]["splunk"]],
+                         ["e11-K1"])
+        log = self.daemon.log_text()
+        self.assertEqual(log.count("which is not a Bluetooth address"), 1)
+        self.assertIn('dev_a has the address "../passwd", which is not a Bluetooth address', log)
+        self.assertIn("Address of /org/bluez/hci0/dev_d is not a string", log)
+        self.assertIn("Paired of /org/bluez/hci0/dev_e is not a boolean", log)
+
+
 class NoBlueZ(AccessoryTestCase):
     def test_without_bluez_the_daemon_serves_and_gathers_nothing(self):
         self.daemon = Daemon(self.bus, self.state, "--bluez-bus",
@@ -202,6 +241,7 @@ class NoBlueZ(AccessoryTestCase):
         self.assertIn("cannot reach the bus unix:path=", log)
         self.assertIn("Timed Out waiting for BT Manager init", log)
         self.assertNotIn("splunk", self.suite().get("ELRegistrationInfo", {}))
+        self.assertNotIn("AudioRegistrationNextInvocationEpoch", self.suite(), "nothing scheduled")
         self.assertIn(300, [int(r) for r in client.reporting.GetAllReporters()])
 
 

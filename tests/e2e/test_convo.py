@@ -2,6 +2,7 @@
 the service switched off through its defaults suite with qvreportctl."""
 
 import os
+import struct
 import subprocess
 import sys
 import unittest
@@ -12,7 +13,7 @@ from harness import DAEMON, DaemonTestCase, jsonl_lines, wait_until  # noqa: E40
 # Built beside qvreportd.
 CTL = os.environ.get("QVREPORTCTL", os.path.join(os.path.dirname(DAEMON), "qvreportctl"))
 SUITE = "com.korvane.qvsound.convo"
-DSP_PLAYBACK, STATE, TELEPHONY = 0x10000004, 18, 2
+DSP_PLAYBACK, STATE, TELEPHONY, TEST, API_USAGE = 0x10000004, 18, 2, 11, 12
 
 
 class ConvoReporting(DaemonTestCase):
@@ -24,27 +25,31 @@ class ConvoReporting(DaemonTestCase):
                         "defaults", "write", SUITE, key, value], check=True,
                        stdout=subprocess.DEVNULL)
 
-    def run_session(self, rid, count):
+    def run_session(self, rid, count, service_type=TELEPHONY,
+                    config={"KXHostApplicationDisplayID": "com.example.call"}):
         c = self.client()
-        c.create(rid, service_type=TELEPHONY, config={"KXHostApplicationDisplayID": "com.example.call"})
+        c.create(rid, service_type=service_type, config=config)
         c.start(rid)
         for i in range(count):
             c.send({"i": i, "label": f"m{i}"}, DSP_PLAYBACK, STATE, [rid])
         self.assertTrue(c.stop(rid))
 
     def test_a_session_reaches_the_sink_in_order_and_a_switched_off_service_gets_nothing(self):
+        self.run_session(20, 3, service_type=TEST)  # a test session is not mirrored
         self.run_session(21, 30)
         lines = wait_until(lambda: [l for l in self.lines() if l["op"] == "flush"] and self.lines(),
                            what="the Convo session flushed")
         session, *rest = lines
         self.assertEqual(session["op"], "session")
         info = session["sessionInfo"]
-        self.assertEqual((info["ClientType"], info["SessionID"], info["BatchEvent"],
-                          info["ContainsRealtimeEvents"], info["ClientBundleID"]),
-                         (19, 21, True, False, "com.example.call"))
-        self.assertAlmostEqual(info["ClientVersion"], 2.1, places=6)
-        self.assertEqual(session["userInfo"]["ServiceName"], "telephony_session")
-        self.assertEqual(session["userInfo"]["QVReportingSessionID"], 21)
+        self.assertEqual(list(info.items()), [
+            ("ClientType", 19), ("ClientVersion", struct.unpack("f", struct.pack("f", 2.1))[0]),
+            ("SessionID", 21), ("BatchEvent", True), ("HierarchyToken", info["HierarchyToken"]),
+            ("ContainsRealtimeEvents", False), ("ClientBundleID", "com.example.call")])
+        self.assertEqual(list(session["userInfo"].items()), [
+            ("ClientName", "com.korvane.qvsound"), ("QVReportingSessionID", 21),
+            ("ServiceName", "telephony_session"), ("HostApplicationDisplayID", "com.example.call"),
+            ("KXHostApplicationDisplayID", "com.example.call")])
 
         messages = [l for l in rest if l["op"] == "message"]
         self.assertTrue(all(l["session"] == session["session"] for l in rest))
@@ -61,9 +66,10 @@ class ConvoReporting(DaemonTestCase):
         self.assertEqual(rest[-1]["op"], "flush")
         self.assertEqual(rest[-2], summary)
 
-        # No backends: the session is described, then nothing follows it.
+        # No backends: the session is described, then nothing follows it. API usage goes in real
+        # time; configuration entries go to user info, over the worker's own.
         self.defaults_write("Backends", "[]")
-        self.run_session(22, 3)
+        self.run_session(22, 3, service_type=API_USAGE, config={"ServiceName": "mine", "n": 7})
         wait_until(lambda: "failed to find backend" in self.daemon.log_text(),
                    what="the empty backend list")
         # Switched off: not even a session.
@@ -74,7 +80,13 @@ class ConvoReporting(DaemonTestCase):
         self.assertEqual(self.daemon.stop(), 0)  # every sink line written by now
         after = self.lines()[len(lines):]
         self.assertEqual([l["op"] for l in after], ["session"])
-        self.assertEqual(after[0]["sessionInfo"]["SessionID"], 22)
+        info = after[0]["sessionInfo"]
+        self.assertEqual((info["SessionID"], info["BatchEvent"], info["ContainsRealtimeEvents"]),
+                         (22, False, True))
+        self.assertNotIn("ClientBundleID", info)
+        self.assertEqual(list(after[0]["userInfo"].items()), [
+            ("ClientName", "com.korvane.qvsound"), ("QVReportingSessionID", 22),
+            ("ServiceName", "mine"), ("n", 7)])
         log = self.daemon.log_text()
         # Each message of both sessions dropped, the three sent and those derived at stop.
         self.assertGreaterEqual(log.count("Session never started. -[QVReportingSessionConvoWorker "

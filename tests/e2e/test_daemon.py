@@ -187,6 +187,12 @@ class DerivedMessages(DaemonTestCase):
                 "vp_config_primary_vocoderFs": "24000"}, INPUT, STATE, [31])
         c.send({"qvreporting_timestamp": now - 15, "session_input_running": False}, RECORD, STOP,
                [31])
+        quoted = {"qvreporting_timestamp": now - 25, "text": 'a "quoted"\nline'}
+        c.send(quoted, PLAYBACK, START, [31])
+        c.send(quoted, PLAYBACK, START, [31])  # redundant: not written to the file
+        directory = os.path.join(self.daemon.state_dir, "logs", "Audio", "Reporting")
+        c.reporting.GetAllReporters()  # every message above has been taken in
+        self.assertFalse(os.path.exists(directory), "nothing is written before the stop")
         self.assertTrue(c.stop(31))
 
         def summaries():
@@ -203,19 +209,32 @@ class DerivedMessages(DaemonTestCase):
         self.assertEqual(volume["KXSessionVolumeBucketed"], "0.5")
         self.assertEqual(inputs["inputrunning_secondsBucketed"], "5")
         self.assertEqual(inputs["vocoders"], "aac:24000,opus:16000")
-        self.assertEqual(summary["num_messages"], 6)  # the five sent and the volume message
+        self.assertEqual(summary["num_messages"], 8)  # the seven sent and the volume message
 
-        # One file, inside the directory whatever the application's name, that python reads back.
-        directory = os.path.join(self.daemon.state_dir, "logs", "Audio", "Reporting")
+        # One file, named by its local time and zone, inside the directory whatever the
+        # application's name; a JSON array of one-member objects, each message under its kind
+        # and count, in time order, that python reads back.
         files = os.listdir(directory)
         self.assertEqual(len(files), 1)
-        self.assertTrue(files[0].endswith("-31-%2E.%2Fe2e%0Aapp-test.json"), files[0])
+        self.assertRegex(files[0], r"^\d{8}-\d{6}[+-]\d{4}-31-%2E\.%2Fe2e%0Aapp-test\.json$")
         with open(os.path.join(directory, files[0])) as f:
-            by_name = {name: payload for member in json.load(f) for name, payload in member.items()}
-        self.assertLessEqual({"Volume_Summary_1", "Input_Summary_1", "Session_Generic_Summary_1"},
-                             by_name.keys())
+            text = f.read()
+        self.assertTrue(text.startswith("[\n{\n") and text.endswith("}\n]\n"), text)
+        self.assertIn("}\n,\n{\n", text)
+        members = json.loads(text)
+        # (What the machine's own driver counters did meanwhile may follow, as ChannelStats.)
+        self.assertEqual([name for member in members for name in member
+                          if not name.startswith("ChannelStats_")],
+                         ["Playback_Start_1", "Playback_Start_2", "Record_Start_1",
+                          "Playback_Stop_1", "Input_State_1", "Record_Stop_1", "Setup_Start_1",
+                          "Setup_Stop_1", "Volume_Summary_1", "Session_Generic_Summary_1",
+                          "Input_Summary_1"])
+        self.assertEqual({len(member) for member in members}, {1})
+        by_name = {name: payload for member in members for name, payload in member.items()}
         for key, value in playing.items():
             self.assertEqual(by_name["Playback_Start_1"][key], value, key)
+        self.assertEqual(by_name["Playback_Start_2"]["text"], quoted["text"])
+        self.assertEqual(by_name["Volume_Summary_1"]["isSessionStarted"], "YES")
 
 
 class Shutdown(DaemonTestCase):

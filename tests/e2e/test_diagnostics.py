@@ -149,6 +149,19 @@ class PulsarOverloads(DiagnosticsTestCase):
         self.assertEqual(len(list(c.reporting.GetAllReporters())), len(ids))
 
 
+# The draft line of the Vidcall x/y error of a python3 client.
+DRAFT = {
+    "op": "draft", "draft": 1, "processName": "python3",
+    "displayReason": "a Vidcall spatial positioning error occurred",
+    "title": "Invalid x/y coordinates during a Vidcall call (ITF)",
+    "problemDescription": "Invalid coordinates were provided to the audio layer during a Vidcall "
+                          "call, making it impossible to render spatial audio correctly. Filing "
+                          "this tracker will help determine what went wrong.",
+    "component": {"name": "Vidcall Core - Callwire", "version": "All", "identifier": 1174093},
+    "reproducibility": 6, "classification": 7,
+    "diagnosticExtensionIdentifiers": ["com.korvane.DiagnosticExtensions.audio"]}
+
+
 class IssueFilerPrompt(DiagnosticsTestCase):
     settings = {"VidcallInvalidXyBackOffSeconds": 3600}
     with_session_bus = True
@@ -173,9 +186,7 @@ class IssueFilerPrompt(DiagnosticsTestCase):
         prompts = wait_until(lambda: self.sink("issuefiler", "prompt"), what="the prompt")
         drafts = self.sink("issuefiler", "draft")
         self.assertEqual(len(drafts), 1)
-        self.assertEqual(drafts[0]["processName"], "python3")
-        self.assertEqual(drafts[0]["title"], "Invalid x/y coordinates during a Vidcall call (ITF)")
-        self.assertEqual(drafts[0]["component"]["name"], "Vidcall Core - Callwire")
+        self.assertEqual({k: v for k, v in drafts[0].items() if k not in ("time", "seq")}, DRAFT)
         self.assertEqual(prompts[0]["shown"], True)
         # The server may answer before it writes down what it showed.
         notes = wait_until(lambda: jsonl_lines(notified), what="the notification server's record")
@@ -195,6 +206,29 @@ class IssueFilerPrompt(DiagnosticsTestCase):
         self.assertEqual(len(self.sink("issuefiler", "draft")), 1)
         with open(os.path.join(self.state, "defaults", SUITE + ".json")) as f:
             self.assertIn("VidcallInvalidXyITFlastRun", json.load(f))
+
+
+
+class IssueFilerWithoutDesktop(DiagnosticsTestCase):
+    settings = {"VidcallInvalidXyBackOffSeconds": 0}  # hasRun alone: one draft a session
+
+    def test_without_a_session_bus_each_draft_is_recorded_and_the_cause_said_once(self):
+        c = Client(self.bus)
+        now = time.time()
+        for rid in (61, 62):
+            c.create(rid)
+            c.start(rid)
+            c.send({"qvreporting_timestamp": now - 10, "vcac_position": 1}, SETUP, GENERIC_TYPE,
+                   [rid])
+            c.send({"qvreporting_timestamp": now, "vcac_invalid_x": 2}, IO, ERROR_TYPE, [rid])
+        prompts = wait_until(lambda: len(self.sink("issuefiler", "prompt")) == 2
+                             and self.sink("issuefiler", "prompt"), what="both prompts")
+        self.assertEqual([(p["draft"], p["shown"], p["reason"]) for p in prompts],
+                         [(1, False, "no session bus"), (2, False, "no session bus")])
+        self.assertEqual([d["draft"] for d in self.sink("issuefiler", "draft")], [1, 2])
+        # A draft recorded is a draft created.
+        wait_until(lambda: self.logged("Successfully created draft") == 2, what="both completions")
+        self.assertEqual(self.logged("issue filer: no session bus"), 1)
 
 
 if __name__ == "__main__":

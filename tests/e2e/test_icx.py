@@ -14,7 +14,7 @@ import uuid
 sys.path.insert(0, os.path.dirname(__file__))
 from harness import DAEMON, DaemonTestCase, jsonl_lines, wait_until  # noqa: E402
 
-PLAYBACK, ENERGY_LOG, HAPTICS = 4, 8, 3
+PLAYBACK, ERROR, ISSUE_DETECTOR, ENERGY_LOG, HAPTICS, ALARMS = 4, 11, 7, 8, 3, 4
 JOURNAL_REMOTE = "/lib/systemd/systemd-journal-remote"
 
 
@@ -32,7 +32,9 @@ def write_journal(directory, pid, message):
     return True
 
 
-class HapticLeakCapture(DaemonTestCase):
+class CaptureTestCase(DaemonTestCase):
+    """An internal build whose device has haptic hardware, its journal in a directory of its own."""
+
     def setUp(self):
         self.extra = tempfile.mkdtemp(prefix="qv-icx-")
         self.addCleanup(shutil.rmtree, self.extra, True)
@@ -51,6 +53,11 @@ class HapticLeakCapture(DaemonTestCase):
         return [os.path.join(root, d) for d in sorted(os.listdir(root))
                 if os.path.exists(os.path.join(root, d, "manifest.json"))]
 
+    def sink_lines(self):
+        return jsonl_lines(os.path.join(self.daemon.state_dir, "sinks", "issuecapture.jsonl"))
+
+
+class HapticLeakCapture(CaptureTestCase):
     def test_a_haptic_leak_sequence_captures_the_clients_journal_lines_and_status(self):
         marker = f"icx e2e marker {uuid.uuid4().hex}"
         journal_written = write_journal(self.journal, os.getpid(), marker)
@@ -67,8 +74,9 @@ class HapticLeakCapture(DaemonTestCase):
         with open(os.path.join(capture, "manifest.json")) as f:
             manifest = json.load(f)
         self.assertEqual(manifest["kind"], "snapshot")
-        self.assertEqual(manifest["signature"]["type"], "haptics")
-        self.assertEqual(manifest["signature"]["subtypeContext"], "EnergyLog")
+        self.assertEqual(manifest["signature"], {
+            "domain": "AudioAnalytics", "type": "haptics", "subtype": "Playback",
+            "subtypeContext": "EnergyLog", "detectedProcess": "Unknown"})
         self.assertEqual(manifest["processIDs"], [os.getpid()])
 
         with open(os.path.join(capture, f"status-{os.getpid()}.txt")) as f:
@@ -78,10 +86,10 @@ class HapticLeakCapture(DaemonTestCase):
 
         wait_until(lambda: "Started ICX session for haptics leaks. sessionId="
                    + os.path.basename(capture) in self.daemon.log_text(), what="the reply's log line")
-        def sink_lines():
-            return jsonl_lines(os.path.join(self.daemon.state_dir, "sinks", "issuecapture.jsonl"))
-        lines = wait_until(lambda: len(sink_lines()) >= 2 and sink_lines(), what="the sink lines")
+        lines = wait_until(lambda: len(self.sink_lines()) >= 2 and self.sink_lines(),
+                           what="the sink lines")
         self.assertEqual([l["op"] for l in lines], ["snapshot", "reply"])
+        self.assertEqual(lines[0]["duration"], 0)
         self.assertEqual(lines[0]["payload"]["DEParameters"][
             "com.korvane.EnergylogCore.DESysLogFilterProcess"]["processIDs"], [os.getpid()])
         self.assertEqual(lines[1]["reply"], {"success": True, "sessionID": os.path.basename(capture)})
@@ -98,6 +106,32 @@ class HapticLeakCapture(DaemonTestCase):
             journal = f.read()
         self.assertIn(f"icx-e2e[{os.getpid()}]: {marker}", journal)
         self.assertEqual(manifest["journal"]["lines"], 1)
+
+
+
+class AlarmLowLevel(CaptureTestCase):
+    def test_a_low_level_alarm_asks_for_one_timed_capture_and_cancels_it_at_stop(self):
+        c = self.client()
+        c.create(601, service_type=ALARMS)
+        c.start(601)
+        for n in range(6):  # the third fires, once in the session
+            c.send({"issue_type": "LowRMS", "n": n}, ERROR, ISSUE_DETECTOR, [601])
+        reply = wait_until(lambda: [l for l in self.sink_lines() if l["op"] == "reply"],
+                           what="the reply")[0]
+        capture = reply["sessionID"]
+        requests = [l for l in self.sink_lines() if l["op"] == "session"]
+        self.assertEqual([(r["duration"], r["sessionID"]) for r in requests], [(60, capture)])
+        self.assertNotIn("payload", requests[0])
+        self.assertEqual(requests[0]["signature"], {
+            "domain": "AudioAnalytics", "type": "alarms", "subtype": "Error",
+            "subtypeContext": "IssueDetector", "detectedProcess": "python3"})
+        wait_until(lambda: f"Started ICX session for alarm Low RMS. sessionId={capture} "
+                   "timeout=60.000000" in self.daemon.log_text(), what="the reply's log line")
+
+        self.assertTrue(c.stop(601))
+        cancels = wait_until(lambda: [l for l in self.sink_lines() if l["op"] == "cancel"],
+                             what="the cancel")
+        self.assertEqual([l["sessionID"] for l in cancels], [capture])
 
 
 if __name__ == "__main__":

@@ -2,10 +2,10 @@
 record through protoc and the shipped schema, and through qvreportctl."""
 
 import base64
-import math
 import os
 import subprocess
 import sys
+import time
 import unittest
 
 import dbus
@@ -36,6 +36,10 @@ def decode(wire):
 class MTXSink(DaemonTestCase):
     def test_an_issue_detector_message_becomes_a_record_protoc_decodes_with_the_schema(self):
         c = self.client()
+        # Sent while no session runs, it goes to the shared session, which the worker serves too.
+        c.send({"issue_type": "shared", "node": "n", "rtaid_client": "c",
+                "any_channel_silence_seconds": 1}, IO, ISSUE_DETECTOR)
+        wait_until(lambda: sink_lines(self.daemon, "mtx"), what="the shared session's record")
         c.create(70)
         c.start(70)
         c.send({"issue_type": "dropout", "node": dbus.Int32(12), "rtaid_client": "com.example",
@@ -47,15 +51,17 @@ class MTXSink(DaemonTestCase):
                 "any_channel_silence_seconds": "  42 seconds"}, GENERIC, ISSUE_DETECTOR, [70])
         c.send({}, GENERIC, ISSUE_DETECTOR, [70])
         c.send({"issue_type": "not an issue"}, IO, GENERIC, [70])
-        wait_until(lambda: len(sink_lines(self.daemon, "mtx")) >= 3,
-                   what="three records in the mtx sink")
+        wait_until(lambda: len(sink_lines(self.daemon, "mtx")) >= 4,
+                   what="four records in the mtx sink")
         self.assertEqual(self.daemon.stop(), 0)
         records = sink_lines(self.daemon, "mtx")
-        self.assertEqual(len(records), 3, "only type 7 makes a record")
-        self.assertEqual([list(r) for r in records], [["time", "seq", "metric", "record"]] * 3)
+        self.assertEqual(len(records), 4, "only type 7 makes a record")
+        self.assertEqual([list(r) for r in records], [["time", "seq", "metric", "record"]] * 4)
         self.assertEqual({r["metric"] for r in records}, {5963779})
 
-        wires = [base64.b64decode(r["record"], validate=True) for r in records]
+        shared, *wires = [base64.b64decode(r["record"], validate=True) for r in records]
+        self.assertEqual(decode(shared),
+                         'duration: 1\nissuetype: "shared"\nnode: "n"\nrtaidclient: "c"\n')
         self.assertEqual(decode(wires[0]),
                          'duration: -3\nissuetype: "dropout"\nnode: "12"\n'
                          'rtaidclient: "com.example"\n')
@@ -80,32 +86,47 @@ class MTXSink(DaemonTestCase):
 class EnergyLogSink(DaemonTestCase):
     def test_haptics_messages_become_registry_28_events_in_a_fixed_order(self):
         c = self.client()
+        # Sent while no session runs, it goes to the shared session, which the worker serves too.
+        c.send({"EngineState": "EngineOn"}, IO, ENERGY_LOG)
+        wait_until(lambda: sink_lines(self.daemon, "energylog"), what="the shared session's event")
         c.create(80, config={"KXHostApplicationDisplayID": "com.example.game"})
         c.start(80)
         c.create(81)  # no application name: "Unknown"
         c.start(81)
-        c.send({"EngineOnTime": 12.5, "EngineState": "EngineOn",
+        stamp = time.time() - 30  # the records' end time is the message's, not the daemon's now
+        c.send({"EngineOnTime": 12.5, "EngineState": "EngineOn", "qvreporting_timestamp": stamp,
                 "Haptic_Active_Hardware_Time_Seconds": dbus.Int64(3600),
                 "Active_Clients": dbus.Array(["a", "b"], signature="s")},
                GENERIC, ENERGY_LOG, [80])
         c.send({"EngineOnTime": dbus.Int32(3), "EngineState": dbus.Int32(1)}, IO, ENERGY_LOG, [81])
         c.send({"EngineOnTime": 1}, IO, ISSUE_DETECTOR, [80])  # another type: nothing
-        wait_until(lambda: len(sink_lines(self.daemon, "energylog")) >= 5,
-                   what="five energy-log events")
+        c.send({"EngineOnTimeX": 1, "enginestate": "EngineOn"}, IO, ENERGY_LOG, [80])  # nor this
+        # Status 1 is for exactly the text "EngineOn".
+        for state in ("engineon", "EngineOn ", True, float("nan"),
+                      dbus.Array(["EngineOn"], signature="s")):
+            c.send({"EngineState": state}, IO, ENERGY_LOG, [80])
+        wait_until(lambda: len(sink_lines(self.daemon, "energylog")) >= 11,
+                   what="eleven energy-log events")
         self.assertEqual(self.daemon.stop(), 0)
         events = sink_lines(self.daemon, "energylog")
-        self.assertEqual(len(events), 5)
+        self.assertEqual(len(events), 11)
         self.assertEqual({e["registry"] for e in events}, {28})
-        self.assertEqual([list(e) for e in events], [["time", "seq", "registry", "event", "payload"]] * 5)
+        self.assertEqual([list(e) for e in events],
+                         [["time", "seq", "registry", "event", "payload"]] * 11)
         self.assertEqual([e["event"] for e in events],
-                         ["Vantrel_Haptics_EngineOnDuration", "Vantrel_Haptics_ClientStatus",
-                          "LeakedHapticsSessionInfo", "Vantrel_Haptics_EngineOnDuration",
-                          "Vantrel_Haptics_ClientStatus"])
-        on, status, leaked, unknown_on, unknown_status = (e["payload"] for e in events)
+                         ["Vantrel_Haptics_ClientStatus", "Vantrel_Haptics_EngineOnDuration",
+                          "Vantrel_Haptics_ClientStatus", "LeakedHapticsSessionInfo",
+                          "Vantrel_Haptics_EngineOnDuration"] +
+                         ["Vantrel_Haptics_ClientStatus"] * 6)
+        shared, on, status, leaked, unknown_on, unknown_status, *states = (e["payload"]
+                                                                           for e in events)
+        self.assertEqual(shared["Status"], 1)
         self.assertEqual(list(on), ["EngineOnDuration", "ApplicationName", "TimestampEnd"])
         self.assertEqual((on["EngineOnDuration"], on["ApplicationName"]), (12.5, "com.example.game"))
-        self.assertTrue(math.isclose(on["TimestampEnd"], events[0]["time"], abs_tol=5))
+        self.assertEqual(on["TimestampEnd"], stamp)
         self.assertEqual((status["Status"], status["ApplicationName"]), (1, "com.example.game"))
+        self.assertIs(type(status["Status"]), int)
+        self.assertEqual([s["Status"] for s in states], [0] * 5)
         self.assertEqual(leaked, {"Haptic_Active_Hardware_Time_Seconds": 3600,
                                   "Active_Clients": ["a", "b"]})
         # "Unknown" is left out and logged in one record, kept in the other.

@@ -157,10 +157,10 @@ class Report(unittest.TestCase):
             r'(.*?)</figure>', dom, re.S)}
         self.assertEqual(sorted(figures), sorted(PLOTS), "a plot is missing or empty")
         points = {name: int(m.group(2)) for name, m in figures.items()}
-        # Five sessions (four examples and the game), and one issue of each kind they cause.
-        self.assertEqual(points["plot-sessions"], 5)
-        self.assertEqual(points["plot-volume"], 5)  # the playback example's five stretches
-        self.assertEqual(points["plot-issues"], 3)
+        # Five sessions (four examples and the game), two applications that played or recorded
+        # on three devices, the playback example's five stretches, and one issue of each kind.
+        self.assertEqual(points, {"plot-sessions": 5, "plot-usage-application": 2,
+                                  "plot-usage-device": 3, "plot-volume": 5, "plot-issues": 3})
         for name, m in figures.items():
             counter = SeriesCounter()
             counter.feed(m.group(4))
@@ -183,6 +183,15 @@ class Report(unittest.TestCase):
             box = image.crop((left, top, left + width, top + height * 8 // 10))
             colored = sum(1 for r, g, b in box.getdata() if max(r, g, b) - min(r, g, b) > 80)
             self.assertGreater(colored, 20, f"{name}: no data drawn on the screenshot")
+
+    def test_the_page_holds_all_it_shows_under_ids_that_never_collide(self):
+        page = self.read("report.html")
+        # Each plot's inline SVG keeps its own ids apart from the others'.
+        ids = [m.group(2) for m in re.finditer(r"""\bid=(["'])(.*?)\1""", page)]
+        self.assertEqual(len(ids), len(set(ids)), "an id used twice")
+        self.assertIn("plot-volume-gnuplot_plot_1", ids)
+        for outside in ("<?xml", "src=", 'href="http'):
+            self.assertNotIn(outside, page)
 
     def test_counters_come_from_getstats_while_the_daemon_runs_else_from_disk(self):
         live = self.read("live.html")

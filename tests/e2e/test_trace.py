@@ -111,6 +111,11 @@ class Trace(TraceSessionCase):
         ours = os.path.join(TRACEFS, "instances", f"qvreportd-{self.daemon.process.pid}-*")
         instances = glob.glob(ours)
         self.assertEqual(len(instances), 1, instances)
+        # The instance's clock is the monotonic one, and the template's events are on.
+        with open(os.path.join(instances[0], "trace_clock")) as f:
+            self.assertIn("[mono]", f.read())
+        with open(os.path.join(instances[0], "events", "sched", "sched_switch", "enable")) as f:
+            self.assertEqual(f.read(), "1\n")
         marker = os.path.join(instances[0], "trace_marker")
         for _ in range(3):
             write_marker(marker, "qv:e2e:decode:begin")
@@ -141,6 +146,10 @@ class Trace(TraceSessionCase):
         raw = glob.glob(os.path.join(self.daemon.state_dir, "logs", "Audio", "Traces", "raw",
                                      "*.trace"))
         self.assertEqual(len(raw), 1)
+        with open(raw[0]) as f:
+            self.assertTrue(f.readline().startswith(
+                f"# qvreportd trace: instance={os.path.basename(instances[0])} template=2 "
+                "clock=mono"))
         self.assertFalse(os.path.exists(os.path.join(os.path.dirname(self.results_path()),
                                                      "temp_gaugedata.gdj")))
         log = self.daemon.log_text()

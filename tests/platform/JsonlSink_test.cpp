@@ -3,8 +3,6 @@
 #include <gtest/gtest.h>
 
 #include <fcntl.h>
-#include <signal.h>
-#include <sys/resource.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -21,6 +19,7 @@
 #include <vector>
 
 #include "fakes/FakeClock.h"
+#include "fakes/FileSizeLimit.h"
 #include "fakes/Notes.h"
 #include "fakes/SinkLines.h"
 #include "fakes/TempDirectory.h"
@@ -149,26 +148,20 @@ TEST_F(AJsonlSink, ReportsACauseOnceCountsLostLinesAndRecovers) {
 }
 
 TEST_F(AJsonlSink, LosesOnlyWhatAFullDiskRefusesAndKeepsLaterLinesWhole) {
-    // A file size limit plays the full disk: writes past it fail (SIGXFSZ ignored: EFBIG).
-    const auto previous = ::signal(SIGXFSZ, SIG_IGN);
-    rlimit saved{};
-    ASSERT_EQ(::getrlimit(RLIMIT_FSIZE, &saved), 0);
     const std::string padding(100, 'p');
     std::size_t lostWhileFull = 0;
     {
         JsonlSink sink(stateDir.string(), "energylog", clock, recording());
-        rlimit small = saved;
-        small.rlim_cur = 1000;
-        ASSERT_EQ(::setrlimit(RLIMIT_FSIZE, &small), 0);
-        for (int i = 0; i < 20; ++i) {
-            sink.append({{"i", i}, {"pad", padding}});
+        {
+            test::FileSizeLimit full(1000);  // the disk fills up after a few lines
+            for (int i = 0; i < 20; ++i) {
+                sink.append({{"i", i}, {"pad", padding}});
+            }
+            sink.flush();
         }
-        sink.flush();
-        ASSERT_EQ(::setrlimit(RLIMIT_FSIZE, &saved), 0);
         lostWhileFull = lostCount();
         sink.append({{"i", 20}});
     }
-    ::signal(SIGXFSZ, previous);
     EXPECT_GT(lostWhileFull, 0u);
     EXPECT_LT(lostWhileFull, 20u);
     EXPECT_EQ(lostCount(), lostWhileFull) << "the disk has room again";

@@ -4,8 +4,6 @@
 #include <gtest/gtest.h>
 #include <nlohmann/json.hpp>
 
-#include <signal.h>
-#include <sys/resource.h>
 #include <unistd.h>
 
 #include <cmath>
@@ -17,6 +15,7 @@
 
 #include "fakes/FakeClock.h"
 #include "fakes/FakeServices.h"
+#include "fakes/FileSizeLimit.h"
 #include "fakes/Notes.h"
 #include "fakes/SinkLines.h"
 #include "fakes/TempDirectory.h"
@@ -293,27 +292,7 @@ TEST_F(ALinuxIssueCaptureService, BoundsTheRequestsWaitingForItsThreadAndItsPend
                                 LinuxIssueCaptureService::kMaxPendingSessions + 1));
 }
 
-// A disk that fills up in the middle of a capture, played by a file-size limit: every write past
-// it fails (EFBIG) as a full disk's would (ENOSPC), with SIGXFSZ ignored.
-class FileSizeLimit {
-  public:
-    explicit FileSizeLimit(rlim_t bytes) {
-        getrlimit(RLIMIT_FSIZE, &saved_);
-        previous_ = signal(SIGXFSZ, SIG_IGN);
-        rlimit limit = saved_;
-        limit.rlim_cur = bytes;
-        setrlimit(RLIMIT_FSIZE, &limit);
-    }
-    ~FileSizeLimit() {
-        setrlimit(RLIMIT_FSIZE, &saved_);
-        signal(SIGXFSZ, previous_);
-    }
-
-  private:
-    rlimit saved_{};
-    sighandler_t previous_;
-};
-
+// A disk that fills up in the middle of a capture.
 TEST(AnIssueCapture, ThatCannotBeWrittenWholeSaysSoAndLeavesNoHalfManifest) {
     test::TempDirectory dir{"qvcapture"};
     IssueCaptureJob job;
@@ -328,7 +307,7 @@ TEST(AnIssueCapture, ThatCannotBeWrittenWholeSaysSoAndLeavesNoHalfManifest) {
     job.journalDirectory = (dir / "none").string();
     IssueCaptureOutcome outcome;
     {
-        FileSizeLimit limit(64);
+        test::FileSizeLimit limit(64);
         outcome = QVReportingCollectIssueCapture(job, 1.0);
     }
     EXPECT_FALSE(outcome.manifestWritten);

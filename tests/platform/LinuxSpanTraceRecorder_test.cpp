@@ -183,8 +183,8 @@ TEST(ALinuxSpanTraceRecorder, RecordsMarkersInAnInstanceOfItsOwnAndAlwaysRemoves
         const int kb = std::stoi(readAll(instance / "buffer_size_kb"));
         EXPECT_GE(kb, 1024);
         EXPECT_LT(kb, 1100);
-        EXPECT_NE(readAll(instance / "trace_clock").find("[mono]"), std::string::npos);
-        EXPECT_EQ(readAll(instance / "events/sched/sched_switch/enable"), "1\n");
+        // (The clock, the first template's events and the trace's header line: the end-to-end
+        // Trace test.)
         if (fs::exists(instance / "events/irq/irq_handler_entry")) {
             EXPECT_EQ(readAll(instance / "events/irq/irq_handler_entry/enable"), "1\n");
         }
@@ -198,10 +198,6 @@ TEST(ALinuxSpanTraceRecorder, RecordsMarkersInAnInstanceOfItsOwnAndAlwaysRemoves
         ASSERT_TRUE(delegate->location);
         EXPECT_EQ(delegate->location->parent_path(), dir / "raw");
         EXPECT_EQ(delegate->token, names[0]);
-        const std::string text = readAll(*delegate->location);
-        EXPECT_EQ(
-            text.rfind("# qvreportd trace: instance=" + names[0] + " template=3 clock=mono", 0),
-            0u);
 
         // A recording released without a stop still has its instance removed.
         auto abandoned = recorder.createSession(*recorder.configurationFromTemplate(2));

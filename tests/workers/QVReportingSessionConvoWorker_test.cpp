@@ -59,43 +59,14 @@ class AConvoWorker : public ::testing::Test {
     test::ScopedMemoryLog log;
 };
 
-TEST_F(AConvoWorker, DescribesTheSessionToTheServiceByServiceTypeConfigurationAndSingleUse) {
-    EXPECT_EQ(started(service::kTest)->workerInstanceCount(), 0u) << "no worker for test sessions";
-    EXPECT_EQ(fake.convo.tokensAsked, 0);
-
-    auto generic = started(service::kGeneric, 42);
-    auto apiUsage = started(service::kAPIUsage, 43);
-    const Dictionary configuration{
-        {"KXHostApplicationDisplayID", "com.example.app"}, {"ServiceName", "mine"}, {"n", 7}};
-    auto configured = started(service::kTelephony, 44, configuration);
+// What a session tells the service, by its service type and configuration, is the Convo
+// end-to-end test's; here, the name a single-message session goes by.
+TEST_F(AConvoWorker, NamesASingleMessageSessionByItsBareServiceName) {
     auto single = test::makeSession(
-        fake.platform,
-        {.id = 1, .pids = {1}, .serviceType = service::kAlerts, .single = true, .start = true});
+        fake.platform, {.id = 1, .serviceType = service::kAlerts, .single = true, .start = true});
     run();
-    ASSERT_EQ(fake.convo.sessions.size(), 4u);
-
-    const auto& info = fake.convo.sessions[0]->sessionInfo;
-    EXPECT_EQ(keysOf(info),
-              (std::vector<std::string>{"ClientType", "ClientVersion", "SessionID", "BatchEvent",
-                                        "HierarchyToken", "ContainsRealtimeEvents"}));
-    EXPECT_EQ(info.find("ClientVersion")->asDouble(), static_cast<double>(2.1f)) << "a float";
-    EXPECT_EQ(*info.find("HierarchyToken"), Value("token-1"));
-    EXPECT_EQ(fake.convo.sessions[0]->userInfo, (Dictionary{{"ClientName", "com.korvane.qvsound"},
-                                                            {"QVReportingSessionID", 42},
-                                                            {"ServiceName", "generic_session"}}));
-    // apiusage goes in real time.
-    EXPECT_EQ(*fake.convo.sessions[1]->sessionInfo.find("BatchEvent"), Value(false));
-    EXPECT_EQ(*fake.convo.sessions[1]->sessionInfo.find("ContainsRealtimeEvents"), Value(true));
-    // Every configuration entry goes to user info (overwriting). (The host app in session info:
-    // the convo end-to-end test.)
-    const auto& user = fake.convo.sessions[2]->userInfo;
-    EXPECT_EQ(keysOf(user), (std::vector<std::string>{"ClientName", "QVReportingSessionID",
-                                                      "ServiceName", "HostApplicationDisplayID",
-                                                      "KXHostApplicationDisplayID", "n"}));
-    EXPECT_EQ(*user.find("ServiceName"), Value("mine"));
-    // A single-message session goes by its bare service name.
-    EXPECT_EQ(*fake.convo.sessions[3]->userInfo.find("ServiceName"), Value("alerts"));
-    EXPECT_FALSE(fake.convo.sessions[3]->sessionInfo.contains("ClientBundleID"));
+    ASSERT_EQ(fake.convo.sessions.size(), 1u);
+    EXPECT_EQ(*fake.convo.sessions[0]->userInfo.find("ServiceName"), Value("alerts"));
 }
 
 TEST_F(AConvoWorker, HoldsMessagesDuringTheWaitAndForwardsThemInOrderOnceBackendsAreKnown) {
