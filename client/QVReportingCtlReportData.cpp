@@ -293,22 +293,26 @@ class Gatherer {
     }
 
     // A capture names no session: it belongs to the session of its signature's service that
-    // was running when it was asked for. Its line is written when the capture is taken, which
-    // can be after a session that asked at its stop has ended: then it is the latest session of
-    // the service begun before it.
+    // was running when it was asked for. Its line is written on another thread when the capture
+    // is taken, so one asked at a session's stop can land after the session's last line, or
+    // before its first when that is written at the stop too: then it is the session of the
+    // service nearest to it in time, the latest of equals.
     void finish() {
         for (std::size_t i = 0; i < captures_.size(); ++i) {
             ReportIssue& capture = captures_[i];
             ReportSession* owner = nullptr;
+            double nearest = 0;
             for (auto s = allSessions_.rbegin(); s != allSessions_.rend(); ++s) {
-                if (s->service != captureServices_[i] || s->start > capture.time) {
+                if (s->service != captureServices_[i]) {
                     continue;
                 }
-                if (!s->stopped || capture.time <= s->end) {
+                const double away = capture.time < s->start ? s->start - capture.time
+                                    : s->stopped            ? std::max(0.0, capture.time - s->end)
+                                                            : 0.0;
+                if (!owner || away < nearest) {
                     owner = &*s;
-                    break;
+                    nearest = away;
                 }
-                owner = owner ? owner : &*s;
             }
             if (owner) {
                 ++owner->captures;

@@ -79,8 +79,8 @@ class TheReportData : public ::testing::Test {
         write(
             "issuecapture.jsonl", 1, 111,
             R"("op":"snapshot","signature":{"type":"longformaudio","subtype":"Playback","subtypeContext":"EnergyLog"},"sessionID":"a")");
-        // Second run: session number 1 again, a haptics session that asked for a capture and was
-        // never flushed (the daemon was killed).
+        // Second run: session number 1 again, a haptics session that asked for a capture at once
+        // and was never flushed (the daemon was killed). The capture's line came first.
         convo(
             200,
             R"("op":"session","session":1,"sessionInfo":{"SessionID":9},"userInfo":{"ServiceName":"haptics_session"})");
@@ -89,7 +89,7 @@ class TheReportData : public ::testing::Test {
         convo(203, R"("op":"message","session":"1","category":"Volume","type":null)");
         convo(204, R"("op":"message","session":1,"category":"Volume","type":null,"payload":[])");
         write(
-            "issuecapture.jsonl", 2, 202,
+            "issuecapture.jsonl", 2, 199.5,
             R"("op":"snapshot","signature":{"type":"haptics","subtype":"Playback","subtypeContext":"EnergyLog"},"sessionID":"b")");
         // The same asked for again and refused as too soon: no capture.
         write(
@@ -184,8 +184,8 @@ TEST_F(TheReportData, GroupsEachSessionsMessagesAcrossDaemonRunsAndSegments) {
     EXPECT_EQ(issues, (std::vector<std::string>{
                           "103 overload music IO.Error, 512 frames",
                           "111 capture music longformaudio / Playback / EnergyLog",
+                          "199.5 capture  haptics / Playback / EnergyLog",
                           "201 MTX record com.example.racer silence on node 12, 3 s",
-                          "202 capture  haptics / Playback / EnergyLog",
                       }));
 
     // Segments, lines, seqs from and to, missing (1 and 2), unreadable.
@@ -207,8 +207,8 @@ TEST_F(TheReportData, KeepsWhatLiesFromSinceUpToUntilAndOneApplication) {
     };
     const Case cases[] = {
         {100, 102, "", 1, 0, 0},           // the session at 102 is left out
-        {102, 200.5, "", 2, 2, 2},         // since is kept, until is not
-        {110, std::nullopt, "", 1, 2, 3},  // stretches from 110, issues at 111, 201 and 202
+        {102, 199.5, "", 1, 2, 2},         // since is kept, until is not
+        {110, std::nullopt, "", 1, 2, 3},  // stretches from 110, issues at 111, 199.5 and 201
         {std::nullopt, std::nullopt, "music", 1, 2, 2},
         {std::nullopt, std::nullopt, "nobody", 0, 0, 0},
     };
