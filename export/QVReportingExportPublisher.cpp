@@ -191,6 +191,31 @@ std::string QVReportingExportPublisher::ensureStream() {
     return {};
 }
 
+std::string QVReportingExportPublisher::streamSettled() {
+    jsStreamInfo* info = nullptr;
+    jsErrCode code = static_cast<jsErrCode>(0);
+    if (const natsStatus s =
+            js_GetStreamInfo(&info, nats_->js, settings_.stream.c_str(), nullptr, &code);
+        s != NATS_OK) {
+        return QVReportingExportNatsError(s);
+    }
+    std::string waiting;
+    if (const jsClusterInfo* cluster = info->Cluster) {
+        if (!cluster->Leader || !*cluster->Leader) {
+            waiting = "a leader";
+        }
+        for (int i = 0; i < cluster->ReplicasLen && waiting.empty(); ++i) {
+            const jsPeerInfo* peer = cluster->Replicas[i];
+            if (peer->Offline || !peer->Current) {
+                waiting = std::string("replica ") + (peer->Name ? peer->Name : "?") +
+                          (peer->Offline ? " (offline)" : " to catch up");
+            }
+        }
+    }
+    jsStreamInfo_Destroy(info);
+    return waiting;
+}
+
 std::string QVReportingExportPublisher::publish(std::string_view sink, std::uint64_t seq,
                                                 std::string_view text) {
     auto prefix = idPrefixes_.find(sink);

@@ -22,6 +22,9 @@ constexpr auto kLongestBackoff = 4000ms;
 constexpr auto kIdlePoll = 100ms;
 constexpr auto kDiscoveryInterval = 1s;
 constexpr auto kStreamRetryInterval = 1s;
+// After the connection was lost, how long sending waits for the stream's replicas to settle.
+constexpr auto kSettleLimit = 15s;
+constexpr auto kSettleInterval = 250ms;
 // The cursor is written at most this often; a crash resends at most this much, which the
 // stream refuses as duplicates.
 constexpr auto kCursorInterval = 1s;
@@ -122,6 +125,7 @@ QVReportingExportShipper::QVReportingExportShipper(QVReportingExportSettings set
     callbacks.connection = [this](bool connected) {
         std::lock_guard lock(mutex_);
         stats_.connected = connected;
+        disconnected_ = disconnected_ || !connected;
         wake_.notify_all();
     };
     publisher_ = std::make_unique<QVReportingExportPublisher>(settings_.server, settings_.device,
@@ -219,10 +223,39 @@ void QVReportingExportShipper::discoverSinks() {
 }
 
 void QVReportingExportShipper::ensureStream(Clock::time_point now) {
+    {
+        std::lock_guard lock(mutex_);
+        if (disconnected_) {
+            disconnected_ = false;
+            streamReady_ = false;
+            stats_.streamReady = false;
+            settleBy_ = now + kSettleLimit;
+        }
+    }
     if (streamReady_ || now < streamRetryAt_ || !publisher_->connected()) {
         return;
     }
     const std::string error = publisher_->ensureStream();
+    if (error.empty() && now < settleBy_) {
+        if (const std::string waiting = publisher_->streamSettled(); !waiting.empty()) {
+            if (waiting != settleWaiting_) {
+                log("stream " + settings_.server.stream + ": waiting for " + waiting +
+                    " before sending, " +
+                    std::to_string(
+                        std::chrono::duration_cast<std::chrono::seconds>(settleBy_ - now).count()) +
+                    " s at most");
+                settleWaiting_ = waiting;
+            }
+            streamRetryAt_ = now + kSettleInterval;
+            return;
+        }
+    }
+    if (!settleWaiting_.empty() && error.empty()) {
+        log("stream " + settings_.server.stream +
+            (now < settleBy_ ? ": settled, sending again"
+                             : ": not settled in time, sending again"));
+    }
+    settleWaiting_.clear();
     streamReady_ = error.empty();
     if (!streamReady_) {
         streamRetryAt_ = now + kStreamRetryInterval;

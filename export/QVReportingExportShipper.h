@@ -10,6 +10,9 @@
 // acknowledged, and each sink resends from its oldest line not acknowledged; servers that cannot be
 // reached are retried by the connection for as long as it takes, the lines staying in their
 // segments; lines the disk budget removed before they were read are counted as expired and logged.
+// After the connection was lost, sending waits (15 s at most) for the stream to have a leader with
+// every replica current: a cluster coming back from an outage of all its servers can take and
+// acknowledge writes on one history and then settle on another, losing them.
 //
 // Thread safety: run() on one thread; stop() from any thread (a signal-waiting thread).
 #pragma once
@@ -95,6 +98,8 @@ class QVReportingExportShipper {
     QVReportingExportCursor savedCursor_;
     bool streamReady_ = false;
     Clock::time_point streamRetryAt_{};
+    Clock::time_point settleBy_{};  // until then the stream must have settled before sending
+    std::string settleWaiting_;     // what it waited for when last told
     std::string streamError_;
     std::set<std::string> refusedSinks_;  // names told about once
 
@@ -106,6 +111,7 @@ class QVReportingExportShipper {
     Clock::time_point holdUntil_{};                                    // GUARDED_BY(mutex_)
     std::chrono::milliseconds backoff_;                                // GUARDED_BY(mutex_)
     bool probing_ = false;                                             // GUARDED_BY(mutex_)
+    bool disconnected_ = false;                                        // GUARDED_BY(mutex_)
     bool stopping_ = false;                                            // GUARDED_BY(mutex_)
 };
 
