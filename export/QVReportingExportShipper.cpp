@@ -236,26 +236,10 @@ void QVReportingExportShipper::ensureStream(Clock::time_point now) {
         return;
     }
     const std::string error = publisher_->ensureStream();
-    if (error.empty() && now < settleBy_) {
-        if (const std::string waiting = publisher_->streamSettled(); !waiting.empty()) {
-            if (waiting != settleWaiting_) {
-                log("stream " + settings_.server.stream + ": waiting for " + waiting +
-                    " before sending, " +
-                    std::to_string(
-                        std::chrono::duration_cast<std::chrono::seconds>(settleBy_ - now).count()) +
-                    " s at most");
-                settleWaiting_ = waiting;
-            }
-            streamRetryAt_ = now + kSettleInterval;
-            return;
-        }
+    if (error.empty() && !streamSettled(now)) {
+        streamRetryAt_ = now + kSettleInterval;
+        return;
     }
-    if (!settleWaiting_.empty() && error.empty()) {
-        log("stream " + settings_.server.stream +
-            (now < settleBy_ ? ": settled, sending again"
-                             : ": not settled in time, sending again"));
-    }
-    settleWaiting_.clear();
     streamReady_ = error.empty();
     if (!streamReady_) {
         streamRetryAt_ = now + kStreamRetryInterval;
@@ -271,6 +255,20 @@ void QVReportingExportShipper::ensureStream(Clock::time_point now) {
     if (!error.empty()) {
         stats_.lastError = error;
     }
+}
+
+bool QVReportingExportShipper::streamSettled(Clock::time_point now) {
+    const std::string waiting = now < settleBy_ ? publisher_->streamSettled() : std::string();
+    if (!waiting.empty() && waiting != settleWaiting_) {
+        const auto left = std::chrono::duration_cast<std::chrono::seconds>(settleBy_ - now);
+        log("stream " + settings_.server.stream + ": waiting for " + waiting + " before sending, " +
+            std::to_string(left.count()) + " s at most");
+    } else if (waiting.empty() && !settleWaiting_.empty()) {
+        log("stream " + settings_.server.stream +
+            (now < settleBy_ ? ": settled" : ": not settled in time") + ", sending again");
+    }
+    settleWaiting_ = waiting;
+    return waiting.empty();
 }
 
 bool QVReportingExportShipper::readLines() {
