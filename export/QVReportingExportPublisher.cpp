@@ -162,13 +162,42 @@ bool QVReportingExportPublisher::connected() const {
            natsConnection_Status(nats_->connection) == NATS_CONN_STATUS_CONNECTED;
 }
 
-std::string QVReportingExportPublisher::ensureStream() {
+namespace {
+
+// What a replicated stream lacks before it is written to: a leader, or a replica that is current.
+std::string unsettledPart(const jsStreamInfo& info) {
+    const jsClusterInfo* cluster = info.Cluster;
+    if (!cluster) {
+        return {};
+    }
+    if (!cluster->Leader || !*cluster->Leader) {
+        return "a leader";
+    }
+    for (int i = 0; i < cluster->ReplicasLen; ++i) {
+        const jsPeerInfo* peer = cluster->Replicas[i];
+        if (peer->Offline || !peer->Current) {
+            return std::string("replica ") + (peer->Name ? peer->Name : "?") +
+                   (peer->Offline ? " (offline)" : " to catch up");
+        }
+    }
+    return {};
+}
+
+}  // namespace
+
+std::string QVReportingExportPublisher::ensureStream(std::string* unsettled) {
     jsStreamInfo* info = nullptr;
     jsErrCode code = static_cast<jsErrCode>(0);
+    const auto found = [&] {
+        if (unsettled) {
+            *unsettled = unsettledPart(*info);
+        }
+        jsStreamInfo_Destroy(info);
+        return std::string();
+    };
     natsStatus s = js_GetStreamInfo(&info, nats_->js, settings_.stream.c_str(), nullptr, &code);
     if (s == NATS_OK) {
-        jsStreamInfo_Destroy(info);
-        return {};
+        return found();
     }
     if (s != NATS_NOT_FOUND && code != JSStreamNotFoundErr) {
         return "stream " + settings_.stream + ": " + QVReportingExportNatsError(s);
@@ -187,33 +216,7 @@ std::string QVReportingExportPublisher::ensureStream() {
     if (s != NATS_OK) {
         return "cannot create stream " + settings_.stream + ": " + QVReportingExportNatsError(s);
     }
-    jsStreamInfo_Destroy(info);
-    return {};
-}
-
-std::string QVReportingExportPublisher::streamSettled() {
-    jsStreamInfo* info = nullptr;
-    jsErrCode code = static_cast<jsErrCode>(0);
-    if (const natsStatus s =
-            js_GetStreamInfo(&info, nats_->js, settings_.stream.c_str(), nullptr, &code);
-        s != NATS_OK) {
-        return QVReportingExportNatsError(s);
-    }
-    std::string waiting;
-    if (const jsClusterInfo* cluster = info->Cluster) {
-        if (!cluster->Leader || !*cluster->Leader) {
-            waiting = "a leader";
-        }
-        for (int i = 0; i < cluster->ReplicasLen && waiting.empty(); ++i) {
-            const jsPeerInfo* peer = cluster->Replicas[i];
-            if (peer->Offline || !peer->Current) {
-                waiting = std::string("replica ") + (peer->Name ? peer->Name : "?") +
-                          (peer->Offline ? " (offline)" : " to catch up");
-            }
-        }
-    }
-    jsStreamInfo_Destroy(info);
-    return waiting;
+    return found();
 }
 
 std::string QVReportingExportPublisher::publish(std::string_view sink, std::uint64_t seq,

@@ -52,11 +52,10 @@ class QVReportingExportPublisher {
     std::string start();
     bool connected() const;
     // Makes the stream when it is missing (subjects "qvreporting.>", file storage, the replicas
-    // and duplicate window asked for). An empty string, or why it could not be done now.
-    std::string ensureStream();
-    // An empty string once the stream has a leader and every replica is current (or it has no
-    // replicas), else what it still waits for.
-    std::string streamSettled();
+    // and duplicate window asked for). An empty string, or why it could not be done now. With
+    // unsettled, also says what the stream still lacks before it is written to (a leader, a
+    // replica that is current): empty once it has settled.
+    std::string ensureStream(std::string* unsettled = nullptr);
     // Publishes one line asynchronously. An empty string, or why the library refused it at once
     // (then no callback comes for it).
     std::string publish(std::string_view sink, std::uint64_t seq, std::string_view text);

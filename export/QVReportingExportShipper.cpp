@@ -235,8 +235,9 @@ void QVReportingExportShipper::ensureStream(Clock::time_point now) {
     if (streamReady_ || now < streamRetryAt_ || !publisher_->connected()) {
         return;
     }
-    const std::string error = publisher_->ensureStream();
-    if (error.empty() && !streamSettled(now)) {
+    std::string unsettled;
+    const std::string error = publisher_->ensureStream(now < settleBy_ ? &unsettled : nullptr);
+    if (error.empty() && !streamSettled(now, unsettled)) {
         streamRetryAt_ = now + kSettleInterval;
         return;
     }
@@ -257,8 +258,7 @@ void QVReportingExportShipper::ensureStream(Clock::time_point now) {
     }
 }
 
-bool QVReportingExportShipper::streamSettled(Clock::time_point now) {
-    const std::string waiting = now < settleBy_ ? publisher_->streamSettled() : std::string();
+bool QVReportingExportShipper::streamSettled(Clock::time_point now, const std::string& waiting) {
     if (!waiting.empty() && waiting != settleWaiting_) {
         const auto left = std::chrono::duration_cast<std::chrono::seconds>(settleBy_ - now);
         log("stream " + settings_.server.stream + ": waiting for " + waiting + " before sending, " +

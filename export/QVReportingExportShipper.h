@@ -71,9 +71,9 @@ class QVReportingExportShipper {
 
     void discoverSinks();
     void ensureStream(Clock::time_point now);
-    // After the connection was lost: whether the stream has a leader with every replica
-    // current, or the wait is over; what it waits for is told once.
-    bool streamSettled(Clock::time_point now);
+    // After the connection was lost: whether the stream lacks nothing (waiting is empty: it has
+    // a leader with every replica current, or the wait is over); what it waits for is told once.
+    bool streamSettled(Clock::time_point now, const std::string& waiting);
     // Reads new lines into the windows; true when any was read.
     bool readLines();
     // Publishes what the windows have waiting; true when any was sent.
