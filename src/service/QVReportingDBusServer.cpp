@@ -243,7 +243,7 @@ bool QVReportingDBusServer::processConnections() {
     bool busy = false;
     // Reads one connection for a turn; false once it has closed.
     auto turn = [&](Connection& c) {
-        // The work of the turn's calls wakes the server queue once, when the turn ends.
+        // The turn's first call wakes the server queue at once; the others need no wake-up.
         SerialQueue::WakeBatch batch(service_.queue());
         for (int i = 0; i < kCallsPerTurn && callBytes_ < limits_.maxCallBytes && !stopping_; ++i) {
             const int r = sd_bus_process(c.bus, nullptr);

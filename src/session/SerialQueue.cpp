@@ -51,8 +51,14 @@ void SerialQueue::async(const Lane& lane, std::function<void()> task) {
     }
     for (WakeBatch* batch = batch_; batch; batch = batch->outer_) {
         if (&batch->queue_ == this) {
+            // The batch's first task wakes the queue at once, so that it works while the rest
+            // of the burst is still being posted; the others ride on that wake-up and the one
+            // at the batch's end.
+            if (batch->posted_) {
+                return;
+            }
             batch->posted_ = true;
-            return;
+            break;
         }
     }
     wake_.notify_one();

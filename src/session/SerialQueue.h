@@ -39,10 +39,11 @@ class SerialQueue {
         std::shared_ptr<LaneState> state_;
     };
 
-    // Holds back the wake-ups of the tasks this thread posts to the queue while it lives, and
-    // wakes the queue once at its end if any were posted: a thread that posts a burst (the bus
-    // thread reading a run of calls) then costs the queue one wake-up instead of one a task.
-    // Scopes nest. Only the thread that made it may post under it.
+    // Wakes the queue for the first task this thread posts to it while it lives, holds back the
+    // wake-ups of the later ones, and wakes the queue again at its end if any were posted: a
+    // thread that posts a burst (the bus thread reading a run of calls) then costs the queue two
+    // wake-ups instead of one a task, and the queue starts on the burst without waiting for its
+    // end. Scopes nest. Only the thread that made it may post under it.
     class WakeBatch {
       public:
         explicit WakeBatch(SerialQueue& queue);

@@ -76,7 +76,7 @@ TEST(ASerialQueue, LetsLanesTakeTurnsAndSyncWaitsForEveryLane) {
     EXPECT_GT(at("late"), at("f99"));
 }
 
-TEST(ASerialQueue, WakesOnceABatchOfPostsEndsLosingNoneAcrossNestedBatchesOfTwoQueues) {
+TEST(ASerialQueue, HoldsBackWakeUpsInABatchLosingNoneAcrossNestedBatchesOfTwoQueues) {
     SerialQueue a("test.a");
     SerialQueue b("test.b");
     a.sync([] {});  // both threads idle, waiting for a wake-up
