@@ -243,7 +243,7 @@ bool QVReportingDBusServer::processConnections() {
     bool busy = false;
     // Reads one connection for a turn; false once it has closed.
     auto turn = [&](Connection& c) {
-        // The turn's first call wakes the server queue at once; the others need no wake-up.
+        // The turn's calls cost the server queue two wake-ups at most (see WakeBatch).
         SerialQueue::WakeBatch batch(service_.queue());
         for (int i = 0; i < kCallsPerTurn && callBytes_ < limits_.maxCallBytes && !stopping_; ++i) {
             const int r = sd_bus_process(c.bus, nullptr);
