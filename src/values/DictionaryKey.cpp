@@ -20,8 +20,10 @@ Table& table() {
     return *t;
 }
 
-// A thread's recently made interned texts, by hash: most keys are found here, without a lock.
-constexpr std::size_t kCacheSlots = 256;
+// A thread's recently made interned texts, by hash: most keys are found here, without a lock. Two
+// ways a set, so that a client's few dozen keys rarely evict each other (with one way, two of a
+// payload's ten keys sharing a slot would both miss on every message).
+constexpr std::size_t kCacheSets = 256;
 
 }  // namespace
 
@@ -39,16 +41,27 @@ const DictionaryKey::Text* DictionaryKey::makeText(std::string_view text) {
     const std::size_t hash = std::hash<std::string_view>{}(text);
     const bool internable = text.size() <= kMaxInternedLength;
     if (internable) {
-        thread_local std::array<const Text*, kCacheSlots> cache{};
-        const Text*& cached = cache[hash % kCacheSlots];
-        if (cached != nullptr && cached->hash == hash && cached->text == text) {
-            return cached;
+        thread_local std::array<std::array<const Text*, 2>, kCacheSets> cache{};
+        auto& ways = cache[hash % kCacheSets];
+        auto holds = [&](const Text* cached) {
+            return cached != nullptr && cached->hash == hash && cached->text == text;
+        };
+        if (holds(ways[0])) {
+            return ways[0];
         }
+        if (holds(ways[1])) {
+            std::swap(ways[0], ways[1]);  // the most recent first
+            return ways[0];
+        }
+        auto remember = [&](const Text* found) {
+            ways[1] = ways[0];
+            ways[0] = found;
+            return found;
+        };
         Table& t = table();
         std::lock_guard lock(t.mutex);
         if (auto it = t.texts.find(text); it != t.texts.end()) {
-            cached = static_cast<const Text*>(it->second);
-            return cached;
+            return remember(static_cast<const Text*>(it->second));
         }
         if (t.texts.size() < kMaxInterned) {
             auto* made = new Text;
@@ -57,8 +70,7 @@ const DictionaryKey::Text* DictionaryKey::makeText(std::string_view text) {
             made->hasBlank = text.find(' ') != std::string_view::npos;
             made->interned = true;
             t.texts.emplace(made->text, made);
-            cached = made;
-            return made;
+            return remember(made);
         }
     }
     auto* owned = new Text;
