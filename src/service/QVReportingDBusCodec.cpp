@@ -3,6 +3,7 @@
 #include <fmt/format.h>
 #include <systemd/sd-bus.h>
 
+#include <algorithm>
 #include <cstring>
 
 #include "service/QVReportingDBusMessageBytes.h"
@@ -192,7 +193,7 @@ bool Reader::readStruct(const char* contents, std::size_t depth, Value& out) {
 
 bool Reader::readDictionary(const char* entrySignature, std::size_t depth, Value& out,
                             bool isTopLevel) {
-    const std::string arrayContents = fmt::format("{{{}}}", entrySignature);
+    const std::string arrayContents = std::string("{") + entrySignature + '}';
     if (!enter('a', arrayContents.c_str())) {
         return false;
     }
@@ -203,6 +204,12 @@ bool Reader::readDictionary(const char* entrySignature, std::size_t depth, Value
         return false;
     }
     Dictionary dict;
+    // A client's payloads tend to repeat their size: the top level starts with room for as many
+    // entries as this thread's last one had, so its entries are not moved as it grows.
+    thread_local std::size_t lastTopLevelSize = 0;
+    if (isTopLevel) {
+        dict.reserve(lastTopLevelSize);
+    }
     Array pairs;
     char type = 0;
     const char* inner = nullptr;
@@ -231,7 +238,8 @@ bool Reader::readDictionary(const char* entrySignature, std::size_t depth, Value
             return false;
         }
         if (stringKeys) {
-            dict.set(std::string(name, nameSize), std::move(v));
+            // By key, not text: finding a repeated key then compares pointers, not bytes.
+            dict.set(DictionaryKey(std::string_view(name, nameSize)), std::move(v));
         } else {
             pairs.push_back(Array{std::move(k), std::move(v)});
         }
@@ -240,6 +248,9 @@ bool Reader::readDictionary(const char* entrySignature, std::size_t depth, Value
         return false;
     }
     if (isTopLevel) {
+        constexpr std::size_t kMaxReserved = 256;
+        lastTopLevelSize = std::min(dict.size(), kMaxReserved);
+        dict.reserveMore(0);  // gives back what a smaller payload left unused
         topLevel = std::move(dict);
     } else if (stringKeys) {
         out = std::move(dict);

@@ -360,7 +360,7 @@ bool Reader::readDictionary(std::string_view entrySignature, std::size_t depth, 
         }
         --open_;
         if (stringKeys) {
-            dict.set(std::move(name), std::move(v));
+            dict.set(DictionaryKey(name), std::move(v));
         } else {
             pairs.push_back(Array{std::move(k), std::move(v)});
         }

@@ -7,6 +7,9 @@
 #include <cstdint>
 #include <functional>
 #include <map>
+#include <string>
+#include <utility>
+#include <vector>
 
 #include <sdbus-c++/Types.h>
 
@@ -97,6 +100,38 @@ TEST(AQVReportingDBusCodec, CountsWhatVariantsHoldNotTheirWrapping) {
     expectRereads(atLimits.dictionary, 3, 2);
     EXPECT_EQ(decode(array, 2, 2).limit, QVReportingStats::Limit::PayloadValues);
     EXPECT_EQ(decode(array, 3, 1).limit, QVReportingStats::Limit::PayloadDepth);
+}
+
+TEST(AQVReportingDBusCodec, KeepsARepeatedKeyOnceAndSizesEachPayloadToItsOwnEntries) {
+    // Entries in the order given; a key given twice keeps its first place and its last value.
+    auto entries = [](std::vector<std::pair<std::string, std::int64_t>> items) {
+        sdbus::PlainMessage m = sdbus::createPlainMessage();
+        m.openContainer("{sv}");
+        for (const auto& [key, value] : items) {
+            m.openDictEntry("sv");
+            m << key << sdbus::Variant(value);
+            m.closeDictEntry();
+        }
+        m.closeContainer();
+        m.seal();
+        return m;
+    };
+    sdbus::PlainMessage small = entries({{"a", 1}, {"b", 2}, {"a", 3}});
+    const QVReportingDecodeResult first = decode(small, 10000, 16);
+    ASSERT_FALSE(first.error) << first.error->message;
+    EXPECT_EQ(Value(first.dictionary), Value(Dictionary{{"a", 3}, {"b", 2}}));
+    EXPECT_EQ(first.dictionary.begin()->first, "a");
+
+    // A small payload read after a large one holds no room the large one needed.
+    std::vector<std::pair<std::string, std::int64_t>> many;
+    for (int i = 0; i < 40; ++i) {
+        many.emplace_back("key" + std::to_string(i), i);
+    }
+    sdbus::PlainMessage large = entries(many);
+    EXPECT_EQ(decode(large, 10000, 16).dictionary.size(), 40u);
+    const QVReportingDecodeResult after = decode(small, 10000, 16);
+    EXPECT_EQ(Value(after.dictionary), Value(first.dictionary));
+    EXPECT_EQ(after.dictionary.approximateHeapBytes(), first.dictionary.approximateHeapBytes());
 }
 
 }  // namespace
