@@ -6,19 +6,27 @@ void FrozenPayloads::append(const Dictionary& payload) {
     starts_.push_back(entries_.size());
     for (const auto& [key, value] : payload) {
         const std::string* s = value.asString();
-        Entry& e =
-            s ? entries_.emplace_back() : entries_.emplace_back(Entry{0, 0, 0, 0, false, value});
-        e.keyBegin = text_.size();
-        e.keyLength = static_cast<std::uint32_t>(key.size());
-        text_ += key;
+        Entry& e = s ? entries_.emplace_back(Entry{key, 0, 0, true, {}})
+                     : entries_.emplace_back(Entry{key, 0, 0, false, value});
         if (s) {
-            e.isText = true;
             e.textBegin = text_.size();
             // A string is bounded far below 4 GiB on its way in.
             e.textLength = static_cast<std::uint32_t>(s->size());
             text_ += *s;
         }
     }
+}
+
+void FrozenPayloads::reserveFor(std::size_t count, const Dictionary& like) {
+    std::size_t text = 0;
+    for (const auto& entry : like) {
+        if (const std::string* s = entry.second.asString()) {
+            text += s->size();
+        }
+    }
+    starts_.reserve(starts_.size() + count);
+    entries_.reserve(entries_.size() + count * like.size());
+    text_.reserve(text_.size() + count * text);
 }
 
 Dictionary FrozenPayloads::thaw(std::size_t i, std::size_t extra) const {
@@ -28,9 +36,8 @@ Dictionary FrozenPayloads::thaw(std::size_t i, std::size_t extra) const {
     d.reserve(end - begin + extra);
     for (std::size_t n = begin; n < end; ++n) {
         const Entry& e = entries_[n];
-        const std::string_view key(text_.data() + e.keyBegin, e.keyLength);
-        d.set(key, e.isText ? Value(std::string_view(text_.data() + e.textBegin, e.textLength))
-                            : e.value);
+        d.set(e.key, e.isText ? Value(std::string_view(text_.data() + e.textBegin, e.textLength))
+                              : e.value);
     }
     return d;
 }

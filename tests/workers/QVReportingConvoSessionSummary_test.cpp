@@ -79,6 +79,7 @@ TEST(FrozenPayloads, ComeBackEqualInOrderSharingNestedContainersAndBlindToLaterC
                       {"list", nested},
                       {"u", std::numeric_limits<std::uint64_t>::max()}};
     FrozenPayloads frozen;
+    frozen.reserveFor(3, source);  // room only: nothing to see
     frozen.append(Dictionary{});
     frozen.append(source);
     frozen.append(Dictionary{{"last", 1}});

@@ -127,11 +127,18 @@ void QVReportingSessionConvoWorker::handleMessage(
         if (!outbox_->taken) {
             outbox_->payloads.append(message->message());
             outbox_->kinds.emplace_back(message->category(), message->type());
+            ++outboxSize_;
             return;
         }
     }
-    // No open outbox: a new one, and the task that will take it.
+    // No open outbox: a new one, with room for as many messages as the last one took, and the
+    // task that will take it.
     outbox_ = std::make_shared<Outbox>();
+    constexpr std::size_t kMaxReserved = 256;  // a backlog's outbox is no measure of the next
+    const std::size_t room = std::min(outboxSize_, kMaxReserved);
+    outbox_->payloads.reserveFor(room, message->message());
+    outbox_->kinds.reserve(room);
+    outboxSize_ = 1;
     outbox_->payloads.append(message->message());
     outbox_->kinds.emplace_back(message->category(), message->type());
     convoReportingQueue().tryAsync(

@@ -154,6 +154,8 @@ class QVReportingSessionConvoWorker final
     // The outbox messages go to, until a task takes it or a start or stop closes it (session's
     // queue only).
     std::shared_ptr<Outbox> outbox_;
+    // Messages in the open outbox, or in the last one once it was taken (session's queue only).
+    std::size_t outboxSize_ = 0;
     // Messages in outboxes not yet taken.
     std::atomic<std::size_t> heldMessages_{0};
     // Convo queue only.
