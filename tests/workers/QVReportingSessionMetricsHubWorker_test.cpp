@@ -58,6 +58,18 @@ TEST_F(AMetricsHubWorker, OffersEachMessageUnchangedUnderTheQVSoundNameThenTheSe
         EXPECT_EQ(fake.analytics.events[i].payload, exact->message()) << "same entries, same order";
     }
 
+    // Names follow the kind and the service of each message, also when only one of them changes.
+    fake.analytics.queried.clear();
+    session->sendMessage(message({{"g", 7}}, category::kVolume, 500));
+    session->sendMessage(message({{"h", 8}}, category::kPlayback, type::kStart));
+    session->setServiceType(service::kHaptics);
+    session->sendMessage(message({{"i", 9}}, category::kPlayback, type::kStart));
+    EXPECT_EQ(fake.analytics.queried,
+              (std::vector<std::string>{
+                  "com.korvane.qvsound.Volume.Generic", "com.korvane.telephony.Volume.Generic",
+                  "com.korvane.qvsound.Playback.Start", "com.korvane.telephony.Playback.Start",
+                  "com.korvane.qvsound.Playback.Start", "com.korvane.haptics.Playback.Start"}));
+
     // A name no one uses gets no event; a service type without a name is "unknown"; a session
     // that is gone leaves the part empty.
     fake.analytics.queried.clear();

@@ -42,16 +42,19 @@ void QVReportingSessionMetricsHubWorker::handleMessage(
     if (!message) {
         return;
     }
-    const std::string first = qvsoundEventName(*message);
     // A session that is gone has no service name; the name is formed with an empty part anyway.
     std::string_view serviceName;
     const auto owner = session();
     if (owner) {
         serviceName = QVReportingUtilityGenerateServiceNameFromServiceType(owner->serviceType());
     }
-    const std::string second = serviceEventName(serviceName, *message);
-    sendIfUsed(first, message);
-    sendIfUsed(second, message);
+    if (names_.first.empty() || names_.category != message->category() ||
+        names_.type != message->type() || names_.serviceName != serviceName) {
+        names_ = {message->category(), message->type(), std::string(serviceName),
+                  qvsoundEventName(*message), serviceEventName(serviceName, *message)};
+    }
+    sendIfUsed(names_.first, message);
+    sendIfUsed(names_.second, message);
 }
 
 void QVReportingSessionMetricsHubWorker::sendIfUsed(

@@ -2,8 +2,9 @@
 // under two names: "com.korvane.qvsound.<category>.<type>" and
 // "com.korvane.<service>.<category>.<type>", in that order. Each name is asked about first and
 // sent only when some consumer uses it; the payload is copied only then, by a producer that holds
-// the message, so an unused event costs two names and two queries. Keeps no state between
-// messages and derives none.
+// the message, so an unused event costs two names and two queries. Derives nothing from the
+// messages; it keeps only the two names of the last message's kind, as a stream of messages
+// mostly repeats one category and type.
 //
 // Thread safety: called on the session's queue, like every worker.
 #pragma once
@@ -13,6 +14,7 @@
 #include <string_view>
 
 #include "session/QVReportingSessionWorker.h"
+#include "session/QVReportingVocabulary.h"
 
 namespace qv {
 
@@ -39,6 +41,16 @@ class QVReportingSessionMetricsHubWorker final : public QVReportingSessionWorker
     // The session's platform service, taken at creation: the platform outlives every session,
     // so a message still reaches the service should the session be gone.
     AnalyticsService& analytics_;
+
+    // The event names of the last message, and the kind of message they were made for.
+    struct Names {
+        AudioEventCategory category = 0;
+        AudioEventType type = 0;
+        std::string serviceName;
+        std::string first;  // empty until a message came
+        std::string second;
+    };
+    Names names_;
 };
 
 }  // namespace qv
