@@ -19,8 +19,8 @@
 // them; start and stop tasks run at once, after whatever was gathered before them.
 //
 // Intake. handleMessage() must cost the server queue little: a message for the Convo queue is a
-// copy of its top level appended to the worker's open outbox (FrozenPayloads: keys and texts in
-// one buffer, nested containers shared), and one Convo-queue task takes a whole outbox, so a
+// copy of its top level appended to the worker's open outbox (FrozenPayloads: texts in one
+// buffer, keys and nested containers shared), and one Convo-queue task takes a whole outbox, so a
 // stream of messages allocates and frees in batches rather than per message. A start or stop
 // closes the open outbox before it queues its task, so messages keep their place among them.
 //
