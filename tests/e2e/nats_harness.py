@@ -301,14 +301,16 @@ def ctl(*args, timeout=120):
 def stream_lines(urls, *extra, timeout=90):
     """{(device, sink): [(seq, object without device and sink)]} in stream order."""
     # After every server restarts, the stream takes writes before the cluster's meta leader is
-    # settled, and making a reader's consumer times out until it is: read again then.
+    # settled, and making a reader's consumer times out, or is refused as JetStream being
+    # temporarily unavailable, until it is: read again then.
+    unsettled = ("Timeout", "temporarily unavailable")
     deadline = time.monotonic() + timeout
     while True:
         try:
             text = ctl("--json", "fleet", "tail", "--nats-url", urls, *extra)
             break
         except AssertionError as e:
-            if "Timeout" not in str(e) or time.monotonic() > deadline:
+            if not any(s in str(e) for s in unsettled) or time.monotonic() > deadline:
                 raise
             time.sleep(1)
     out = {}
