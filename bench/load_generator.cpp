@@ -33,6 +33,7 @@
 #include <cstring>
 #include <filesystem>
 #include <fstream>
+#include <numeric>
 #include <optional>
 #include <sstream>
 #include <stdexcept>
@@ -230,9 +231,11 @@ double cpuSeconds(pid_t pid) {
 struct Result {
     double messagesPerSecond = 0;
     double p99 = 0;
-    double cpuMicrosPerMessage = 0;  // of the whole path
-    // The same by process: the clients (this process), then each process of the path.
+    // CPU time per message by process: the clients (this process), then each process of the path.
     std::vector<double> cpuMicrosByProcess;
+    double cpuMicrosPerMessage() const {  // of the whole path
+        return std::accumulate(cpuMicrosByProcess.begin(), cpuMicrosByProcess.end(), 0.0);
+    }
     std::uint64_t errors = 0;
 };
 
@@ -301,7 +304,6 @@ Result run(const Endpoint& endpoint, const std::vector<pid_t>& path, int clients
     r.messagesPerSecond = static_cast<double>(all.size()) / seconds;
     for (std::size_t i = 0; i < processes.size(); ++i) {
         r.cpuMicrosByProcess.push_back(1e6 * (cpu1[i] - cpu0[i]) / static_cast<double>(all.size()));
-        r.cpuMicrosPerMessage += r.cpuMicrosByProcess.back();
     }
     r.p99 = percentile(all, 0.99);
     return r;
@@ -532,7 +534,7 @@ int main(int argc, char** argv) {
                 "%9.1f%s\n",
                 clients, pipelined ? "pipelined" : "serial", t.messagesPerSecond, t.p99,
                 b.messagesPerSecond, b.p99, busRatio, d.messagesPerSecond, d.p99, directRatio,
-                t.cpuMicrosPerMessage, b.cpuMicrosPerMessage, d.cpuMicrosPerMessage,
+                t.cpuMicrosPerMessage(), b.cpuMicrosPerMessage(), d.cpuMicrosPerMessage(),
                 t.errors + b.errors + d.errors ? "  (errors!)" : "");
             if (cpuSplit) {
                 auto split = [](const char* name, const Result& r, const char* server) {
