@@ -21,6 +21,7 @@
 // binding's. Each client owns one connection and drives it from one thread.
 #include <poll.h>
 #include <signal.h>
+#include <sys/prctl.h>
 #include <sys/wait.h>
 #include <systemd/sd-bus.h>
 #include <time.h>
@@ -33,12 +34,14 @@
 #include <cstring>
 #include <filesystem>
 #include <fstream>
+#include <mutex>
 #include <numeric>
 #include <optional>
 #include <sstream>
 #include <stdexcept>
 #include <string>
 #include <thread>
+#include <utility>
 #include <vector>
 
 #include "QVReportingDBusNames.h"
@@ -217,7 +220,11 @@ double cpuSeconds(pid_t pid) {
     std::ifstream stat("/proc/" + std::to_string(pid) + "/stat");
     std::string text((std::istreambuf_iterator<char>(stat)), std::istreambuf_iterator<char>());
     // The command name (field 2) may hold spaces: fields are counted after its closing paren.
-    std::istringstream rest(text.substr(text.rfind(')') + 2));
+    const auto paren = text.rfind(')');
+    if (paren == std::string::npos) {
+        return 0;  // the process is gone
+    }
+    std::istringstream rest(text.substr(paren + 1));
     std::string field;
     double ticks = 0;
     for (int i = 3; i <= 15 && rest >> field; ++i) {
@@ -311,8 +318,19 @@ Result run(const Endpoint& endpoint, const std::vector<pid_t>& path, int clients
 
 // Starts a program; returns its PID. With outFd, the child's stdout goes there.
 pid_t spawn(const std::vector<std::string>& args, int outFd = -1) {
+    const pid_t parent = getpid();
     const pid_t pid = fork();
     if (pid == 0) {
+        // A ^C reaches the run alone, which then stops its programs in order; they still go
+        // if the run is killed outright.
+        setpgid(0, 0);
+        prctl(PR_SET_PDEATHSIG, SIGTERM);
+        if (getppid() != parent) {
+            _exit(127);
+        }
+        sigset_t none;
+        sigemptyset(&none);
+        pthread_sigmask(SIG_SETMASK, &none, nullptr);
         if (outFd >= 0) {
             dup2(outFd, 1);
         }
@@ -420,6 +438,41 @@ int trivialServer(const std::string& address) {
     }
 }
 
+// What a run started, stopped and cleared away however the run ends: at its end, when the
+// daemon does not come up, or on ^C or SIGTERM (else the daemon's store stays behind in /tmp).
+struct Started {
+    std::mutex mutex;
+    bool ended = false;  // guarded by mutex
+    std::atomic<pid_t> bus{0};
+    std::atomic<pid_t> qv{0};
+    std::atomic<pid_t> trivial{0};
+    std::filesystem::path stateDir;  // set before any signal is taken
+
+    void end() {
+        std::lock_guard lock(mutex);
+        if (std::exchange(ended, true)) {
+            return;
+        }
+        const pid_t servers[] = {trivial.load(), qv.load()};
+        for (const pid_t pid : servers) {
+            if (pid > 0) {
+                kill(pid, SIGTERM);
+            }
+        }
+        for (const pid_t pid : servers) {
+            if (pid > 0) {
+                waitpid(pid, nullptr, 0);
+            }
+        }
+        if (bus > 0) {
+            kill(bus, SIGTERM);
+            waitpid(bus, nullptr, 0);
+        }
+        std::error_code ignored;
+        std::filesystem::remove_all(stateDir, ignored);
+    }
+};
+
 }  // namespace
 
 int main(int argc, char** argv) {
@@ -471,20 +524,37 @@ int main(int argc, char** argv) {
     signal(SIGPIPE, SIG_IGN);
     std::setvbuf(stdout, nullptr, _IOLBF, 0);  // rows appear as they are measured
 
+    static Started started;
+    started.stateDir =
+        std::filesystem::temp_directory_path() / ("qv-load-" + std::to_string(getpid()));
+    // Every thread of the run holds these signals; one waits for them and ends the run cleanly.
+    sigset_t stops;
+    sigemptyset(&stops);
+    for (const int sig : {SIGINT, SIGTERM, SIGHUP}) {
+        sigaddset(&stops, sig);
+    }
+    pthread_sigmask(SIG_BLOCK, &stops, nullptr);
+    std::thread([stops] {
+        int sig = 0;
+        sigwait(&stops, &sig);
+        started.end();
+        _exit(128 + sig);
+    }).detach();
+
     int pipeFds[2];
     if (pipe(pipeFds) != 0) {
         return 1;
     }
     const pid_t bus =
         spawn({"dbus-daemon", "--session", "--nofork", "--print-address=1"}, pipeFds[1]);
+    started.bus = bus;
     close(pipeFds[1]);
     char buf[512] = {};
     const auto n = read(pipeFds[0], buf, sizeof buf - 1);
     std::string address(buf, n > 0 ? static_cast<std::size_t>(n) : 0);
     address.erase(address.find_last_not_of("\n") + 1);
 
-    const auto stateDir =
-        std::filesystem::temp_directory_path() / ("qv-load-" + std::to_string(getpid()));
+    const auto& stateDir = started.stateDir;
     std::filesystem::create_directories(stateDir);
     const std::string socket = (stateDir / "direct").string();
     std::vector<std::string> daemonArgs{
@@ -493,12 +563,12 @@ int main(int argc, char** argv) {
         daemonArgs.insert(daemonArgs.end(), {"--direct-socket", socket});
     }
     const pid_t qv = spawn(daemonArgs);
+    started.qv = qv;
     const pid_t trivial = spawn({argv[0], "--trivial-server", address});
+    started.trivial = trivial;
     if (!waitForName(address, qv::dbus::kBusName) || !waitForName(address, kTrivialName)) {
         std::fprintf(stderr, "the daemon or the trivial server did not come up\n");
-        kill(qv, SIGKILL);
-        kill(trivial, SIGKILL);
-        kill(bus, SIGKILL);
+        started.end();
         return 1;
     }
 
@@ -608,13 +678,6 @@ int main(int argc, char** argv) {
             memoryVerdict);
     }
 
-    kill(trivial, SIGTERM);
-    kill(qv, SIGTERM);
-    int status = 0;
-    waitpid(qv, &status, 0);
-    waitpid(trivial, nullptr, 0);
-    kill(bus, SIGTERM);
-    waitpid(bus, nullptr, 0);
-    std::filesystem::remove_all(stateDir);
+    started.end();
     return 0;
 }
