@@ -12,8 +12,8 @@
 //   (counted, reported as convo_lost / analytics_lost).
 // - BM_Intake/<table>/1 ("... drained"): the same, with the CPU of the whole process timed and
 //   the pool and the sinks drained every kDrainEvery messages, so that none is dropped: all the
-//   work one message makes behind the bus, on every thread (what the load generator's daemon
-//   figure holds beside the bus thread's).
+//   work one message makes behind the bus, on every thread: the part of the load generator's
+//   daemon figure that is not the bus thread's.
 // - BM_ConvoStopSummary/<n>/1: stop of a session of n messages with the Convo worker alone, from
 //   the stop call until the pool is idle again: the copy taken on the server queue, the summary
 //   built, sent and flushed on the Convo queue. The fill and its forwarding are not timed.
