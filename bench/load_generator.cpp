@@ -521,6 +521,10 @@ int main(int argc, char** argv) {
         std::fprintf(stderr, "--daemon PATH/qvreportd is required (see --help)\n");
         return 2;
     }
+    if (memoryOnly && throughputOnly) {
+        std::fprintf(stderr, "--memory-only and --throughput-only leave nothing to run\n");
+        return 2;
+    }
     signal(SIGPIPE, SIG_IGN);
     std::setvbuf(stdout, nullptr, _IOLBF, 0);  // rows appear as they are measured
 
